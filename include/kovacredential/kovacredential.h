@@ -1,0 +1,17 @@
+// libkovacredential: the whole public interface.
+#ifndef KOVACREDENTIAL_KOVACREDENTIAL_H
+#define KOVACREDENTIAL_KOVACREDENTIAL_H
+
+#include "kovaplatform.h"
+#include "kovacred.h"
+#include "kovacred_db.h"
+#include "kovacredsetter.h"
+#include "kovacredgetter.h"
+#include "kovacredsesssetter.h"
+#include "kovacredsessgetter.h"
+#include "cred_request.h"
+#include "cred_request_util.h"
+#include "cred_request_mgr.h"
+#include "cred_request_farlink.h"
+
+#endif  // KOVACREDENTIAL_KOVACREDENTIAL_H

@@ -1,0 +1,40 @@
+#include "platform/json_text.h"
+
+#include <memory>
+#include <sstream>
+
+#include <json/reader.h>
+#include <json/writer.h>
+
+namespace kova {
+
+bool JsonFromString(const std::string &text, Json::Value &value) {
+    static const std::unique_ptr<Json::CharReader> reader = [] {
+        Json::CharReaderBuilder builder;
+        Json::CharReaderBuilder::strictMode(&builder.settings_);
+        builder["allowSpecialFloats"] = false;
+        return std::unique_ptr<Json::CharReader>(builder.newCharReader());
+    }();
+    Json::Value parsed;
+    std::string errors;
+    if (text.empty() || !reader->parse(text.data(), text.data() + text.size(), &parsed, &errors)) {
+        value = Json::Value();
+        return false;
+    }
+    value.swap(parsed);
+    return true;
+}
+
+std::string JsonToString(const Json::Value &value) {
+    static const std::unique_ptr<Json::StreamWriter> writer = [] {
+        Json::StreamWriterBuilder builder;
+        builder["indentation"] = "";
+        builder["emitUTF8"] = true;
+        return std::unique_ptr<Json::StreamWriter>(builder.newStreamWriter());
+    }();
+    std::ostringstream out;
+    writer->write(value, &out);
+    return out.str();
+}
+
+}  // namespace kova

@@ -1,0 +1,20 @@
+// Port layer: the two text operations on JSON values the library needs beside jsoncpp itself.
+#ifndef KOVA_PLATFORM_JSON_TEXT_H
+#define KOVA_PLATFORM_JSON_TEXT_H
+
+#include <string>
+
+#include <json/value.h>
+
+namespace kova {
+
+// Parses the whole of `text` as one strict JSON document into `value`. Returns false (and
+// leaves `value` null) for invalid text, trailing garbage or an empty text.
+bool JsonFromString(const std::string &text, Json::Value &value);
+
+// The compact JSON text of `value` (no white space, UTF-8 kept as it is).
+std::string JsonToString(const Json::Value &value);
+
+}  // namespace kova
+
+#endif  // KOVA_PLATFORM_JSON_TEXT_H

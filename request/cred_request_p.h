@@ -1,0 +1,88 @@
+// Implementation object of KOVA::CredRequest: the request settings document, the libcurl
+// handle built from it, and the callbacks of the transfer.
+#ifndef KOVA_REQUEST_CRED_REQUEST_P_H
+#define KOVA_REQUEST_CRED_REQUEST_P_H
+
+#include <stdio.h>
+
+#include <string>
+
+#include <curl/curl.h>
+#include <json/value.h>
+
+#include "kovacredential/cred_request.h"
+#include "kovacredential/kovacred.h"
+
+namespace KOVA {
+
+class CredRequestPrivate {
+public:
+    explicit CredRequestPrivate(CredRequest *owner);
+    ~CredRequestPrivate();
+    CredRequestPrivate(const CredRequestPrivate &) = delete;
+    CredRequestPrivate &operator=(const CredRequestPrivate &) = delete;
+
+    // ---- Settings document. Bad keys, names or values set CRED_REQ_ERR_BAD_PARAM.
+    // settings[key][name] = value (a string).
+    bool SetData(const std::string &key, const std::string &name, const std::string &value);
+    // Merges the members of an object into settings[key].
+    bool SetData(const std::string &key, const Json::Value &members);
+    // settings[key] = value; null, empty arrays and empty objects are rejected.
+    bool SetRawData(const std::string &key, const Json::Value &value);
+    // The whole document for an empty key; settings[key] for an empty name; the member;
+    // otherwise `fallback`.
+    const Json::Value &GetData(const std::string &key, const std::string &name,
+                               const Json::Value &fallback) const;
+    bool HasData(const std::string &key) const;
+    bool HasRawData(const std::string &key) const;
+    bool HasData(const std::string &key, const std::string &name) const;
+    const Json::Value &GetResponseHeader() const { return respHeader; }
+
+    // ---- Parameter encoding.
+    std::string GetParamString(const Json::Value &params);
+    Json::Value GetParamJsonObj(const Json::Value &params);
+    bool GetRSAEncParam(const Json::Value &params, std::string &name, std::string &value);
+    bool GetAESEncParam(const Json::Value &params, std::string &textName, std::string &text,
+                        std::string &tokenName, std::string &token);
+    std::string GetCookies();
+
+    // ---- Transfer set-up and callbacks.
+    bool InitCurlHandler();
+    static size_t WriteToStrBuf(char *data, size_t size, size_t nmemb, std::string *out);
+    static size_t WriteToStream(char *data, size_t size, size_t nmemb, FILE *stream);
+    static size_t ReadFromStream(char *buffer, size_t size, size_t nmemb, FILE *stream);
+    static size_t WriteHeaderToJsonValue(char *data, size_t size, size_t nmemb,
+                                         Json::Value *headers);
+    static size_t WriteHeaderToStdout(char *data, size_t size, size_t nmemb,
+                                      const Json::Value *message);
+    static int DebugCallback(void *handle, curl_infotype type, char *data, size_t size,
+                             void *user);
+
+    // Fills protocol, host and port of the request's own credential from `url`.
+    bool buildCredByURL(const std::string &url);
+
+    // Fields, in this order.
+    KOVA_CRED *cred;
+    KOVA_CRED_SESS *sess;
+    CredRequest *owner;
+    CURL *curl = nullptr;
+    struct curl_slist *headers = nullptr;
+    FILE *reqStream = nullptr;
+    FILE *respStream = nullptr;
+    size_t (*respWriteFn)(char *, size_t, size_t, void *) = nullptr;
+    KOVA::_tag_CRED_REQ_ERR error = CRED_REQ_ERR_NONE;
+    bool jsonFormat = false;
+    Json::Value settings{Json::objectValue};
+    std::string response;
+    Json::Value respHeader{Json::objectValue};
+    struct curl_httppost *form = nullptr;
+    void (*sslCtxFn)(void *, void *, void *) = nullptr;
+    void *sslCtxData = nullptr;
+    long defaultTimeout = 120;
+    bool followLocation = true;
+    bool encoding = false;
+};
+
+}  // namespace KOVA
+
+#endif  // KOVA_REQUEST_CRED_REQUEST_P_H

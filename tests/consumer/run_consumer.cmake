@@ -1,0 +1,35 @@
+# Installs the built library into a scratch prefix, builds the consumer against the CMake
+# package and the pkg-config file, and runs both.
+set(prefix ${BINARY_DIR}/consumer-prefix)
+set(build ${BINARY_DIR}/consumer-build)
+file(REMOVE_RECURSE ${prefix} ${build})
+execute_process(COMMAND ${CMAKE_COMMAND} --install ${BINARY_DIR} --prefix ${prefix}
+                RESULT_VARIABLE rc OUTPUT_QUIET)
+if(rc)
+  message(FATAL_ERROR "install failed: ${rc}")
+endif()
+foreach(f include/kovacredential/kovacredential.h lib/libkovacredential.so.6
+          lib/pkgconfig/kovacredential.pc lib/cmake/KovaCredential/KovaCredentialConfig.cmake
+          bin/kovacred)
+  if(NOT EXISTS ${prefix}/${f})
+    message(FATAL_ERROR "not installed: ${f}")
+  endif()
+endforeach()
+set(ENV{PKG_CONFIG_PATH} ${prefix}/lib/pkgconfig)
+execute_process(COMMAND ${CMAKE_COMMAND} -S ${SOURCE_DIR}/tests/consumer -B ${build}
+                -DCMAKE_PREFIX_PATH=${prefix} -DCMAKE_INSTALL_LIBDIR=lib RESULT_VARIABLE rc)
+if(rc)
+  message(FATAL_ERROR "consumer configure failed")
+endif()
+execute_process(COMMAND ${CMAKE_COMMAND} --build ${build} RESULT_VARIABLE rc)
+if(rc)
+  message(FATAL_ERROR "consumer build failed")
+endif()
+foreach(exe consumer consumer_pc)
+  file(REMOVE ${build}/${exe}.sqlite)
+  set(ENV{LD_LIBRARY_PATH} ${prefix}/lib)
+  execute_process(COMMAND ${build}/${exe} ${build}/${exe}.sqlite RESULT_VARIABLE rc)
+  if(rc)
+    message(FATAL_ERROR "${exe} failed: ${rc}")
+  endif()
+endforeach()

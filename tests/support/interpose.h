@@ -1,0 +1,39 @@
+// Test-side replacements of libc's syslog, usleep and sleep. Every test program links
+// interpose.cpp and exports its symbols, so the library's calls land here: log records are
+// captured for assertions, and sleeps are counted (and skipped while fake sleeping is on).
+#ifndef KOVA_TESTS_SUPPORT_INTERPOSE_H
+#define KOVA_TESTS_SUPPORT_INTERPOSE_H
+
+#include <string>
+#include <vector>
+
+namespace kova_test {
+
+// Every record written since the last ClearLog, fully formatted, in order.
+std::vector<std::string> LogRecords();
+void ClearLog();
+// Number of records containing `needle`.
+size_t LogCount(const std::string &needle);
+inline bool LogHas(const std::string &needle) { return LogCount(needle) > 0; }
+// All records joined by newlines, for failure messages.
+std::string LogDump();
+
+// While on, usleep and sleep return at once (they are still recorded).
+void SetFakeSleep(bool on);
+std::vector<unsigned> UsleepCalls();  // microseconds of each usleep call
+std::vector<unsigned> SleepCalls();   // seconds of each sleep call
+void ClearSleeps();
+
+// RAII: fake sleeping for the lifetime of the object, with the records cleared at start.
+class FakeSleepScope {
+public:
+    FakeSleepScope() {
+        ClearSleeps();
+        SetFakeSleep(true);
+    }
+    ~FakeSleepScope() { SetFakeSleep(false); }
+};
+
+}  // namespace kova_test
+
+#endif  // KOVA_TESTS_SUPPORT_INTERPOSE_H

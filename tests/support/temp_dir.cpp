@@ -1,0 +1,62 @@
+#include "support/temp_dir.h"
+
+#include <stdio.h>
+#include <stdlib.h>
+#include <sys/wait.h>
+
+#include <filesystem>
+#include <stdexcept>
+
+namespace kova_test {
+
+TempDir::TempDir() {
+    const char *base = getenv("TMPDIR");
+    std::string tmpl = std::string(base && *base ? base : "/tmp") + "/kovatest.XXXXXX";
+    if (mkdtemp(tmpl.data()) == nullptr) {
+        throw std::runtime_error("mkdtemp failed");
+    }
+    path_ = tmpl;
+}
+
+TempDir::~TempDir() {
+    std::error_code ec;
+    // Folders made unwritable by a test are opened up again before removal.
+    std::filesystem::permissions(path_, std::filesystem::perms::owner_all,
+                                 std::filesystem::perm_options::add, ec);
+    std::filesystem::remove_all(path_, ec);
+}
+
+TempDatabase::TempDatabase() : db_(dir_.File("credentials.sqlite")) {
+    const char *old = getenv("kovacredential_db");
+    hadOld_ = old != nullptr;
+    if (hadOld_) {
+        old_ = old;
+    }
+    setenv("kovacredential_db", db_.c_str(), 1);
+}
+
+TempDatabase::~TempDatabase() {
+    if (hadOld_) {
+        setenv("kovacredential_db", old_.c_str(), 1);
+    } else {
+        unsetenv("kovacredential_db");
+    }
+}
+
+int RunCommand(const std::string &command, std::string *out) {
+    FILE *pipe = popen(command.c_str(), "r");
+    if (pipe == nullptr) {
+        return -1;
+    }
+    char buf[4096];
+    size_t n;
+    while ((n = fread(buf, 1, sizeof(buf), pipe)) > 0) {
+        if (out != nullptr) {
+            out->append(buf, n);
+        }
+    }
+    int status = pclose(pipe);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+}  // namespace kova_test

@@ -1,0 +1,43 @@
+// A fresh mkdtemp folder, removed with everything in it when the object goes.
+#ifndef KOVA_TESTS_SUPPORT_TEMP_DIR_H
+#define KOVA_TESTS_SUPPORT_TEMP_DIR_H
+
+#include <string>
+
+namespace kova_test {
+
+class TempDir {
+public:
+    TempDir();
+    ~TempDir();
+    TempDir(const TempDir &) = delete;
+    TempDir &operator=(const TempDir &) = delete;
+    const std::string &path() const { return path_; }
+    std::string File(const std::string &name) const { return path_ + "/" + name; }
+
+private:
+    std::string path_;
+};
+
+// Points kovacredential_db at a database in a fresh temporary folder for the object's life
+// and restores the previous value afterwards.
+class TempDatabase {
+public:
+    TempDatabase();
+    ~TempDatabase();
+    const std::string &path() const { return db_; }
+    const TempDir &dir() const { return dir_; }
+
+private:
+    TempDir dir_;
+    std::string db_;
+    bool hadOld_ = false;
+    std::string old_;
+};
+
+// Runs a shell command, returning its exit status and (optionally) its standard output.
+int RunCommand(const std::string &command, std::string *out = nullptr);
+
+}  // namespace kova_test
+
+#endif  // KOVA_TESTS_SUPPORT_TEMP_DIR_H

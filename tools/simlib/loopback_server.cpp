@@ -1,0 +1,296 @@
+#include "simlib/loopback_server.h"
+
+#include <errno.h>
+#include <string.h>
+#include <strings.h>
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+
+#include <openssl/bn.h>
+#include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/x509.h>
+
+namespace kovasim {
+
+namespace {
+
+// Set by a route's wrapper while it handles the current request, so that the error handler
+// can tell an unmatched request (to record and pass to the fallback) from a route's own error.
+thread_local bool tlsRouted = false;
+
+bool SameName(const std::string &a, const std::string &b) {
+    return a.size() == b.size() && strcasecmp(a.c_str(), b.c_str()) == 0;
+}
+
+// cpp-httplib listens with a backlog of 5, which drops connection attempts when many clients
+// connect at once (each drop costs the client a one-second SYN retry). The listening socket is
+// found by its port and given a larger backlog; calling listen again only changes the backlog.
+void WidenBacklog(int port) {
+    for (int fd = 3; fd < 4096; ++fd) {
+        int listening = 0;
+        socklen_t len = sizeof(listening);
+        if (getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &listening, &len) != 0 || !listening) {
+            continue;
+        }
+        struct sockaddr_storage addr;
+        socklen_t alen = sizeof(addr);
+        if (getsockname(fd, reinterpret_cast<struct sockaddr *>(&addr), &alen) != 0) {
+            continue;
+        }
+        int bound = addr.ss_family == AF_INET
+                        ? ntohs(reinterpret_cast<struct sockaddr_in *>(&addr)->sin_port)
+                        : ntohs(reinterpret_cast<struct sockaddr_in6 *>(&addr)->sin6_port);
+        if (bound == port) {
+            listen(fd, 1024);
+        }
+    }
+}
+
+}  // namespace
+
+std::string RecordedRequest::Header(const std::string &name) const {
+    for (const auto &h : headers) {
+        if (SameName(h.first, name)) {
+            return h.second;
+        }
+    }
+    return "";
+}
+
+bool RecordedRequest::HasHeader(const std::string &name) const {
+    for (const auto &h : headers) {
+        if (SameName(h.first, name)) {
+            return true;
+        }
+    }
+    return false;
+}
+
+std::string RecordedRequest::Param(const std::string &name) const {
+    auto it = params.find(name);
+    return it == params.end() ? "" : it->second;
+}
+
+bool RecordedRequest::HasParam(const std::string &name) const {
+    return params.find(name) != params.end();
+}
+
+struct LoopbackServer::KeyMaterial {
+    EVP_PKEY *key = nullptr;
+    X509 *cert = nullptr;
+    ~KeyMaterial() {
+        X509_free(cert);
+        EVP_PKEY_free(key);
+    }
+};
+
+LoopbackServer::LoopbackServer() : LoopbackServer(Options()) {}
+
+LoopbackServer::LoopbackServer(const Options &options) : options_(options) {
+    if (options_.https) {
+        if (MakeCertificate()) {
+            server_ = std::make_unique<httplib::SSLServer>(keys_->cert, keys_->key);
+        } else {
+            error_ = "cannot make a self-signed certificate";
+        }
+    } else {
+        server_ = std::make_unique<httplib::Server>();
+    }
+    if (!server_) {
+        return;
+    }
+    int threads = options_.threads > 0 ? options_.threads : 1;
+    server_->new_task_queue = [threads] { return new httplib::ThreadPool(threads); };
+    server_->set_keep_alive_max_count(options_.keepAlive ? 1000 : 1);
+    server_->set_payload_max_length(1ULL << 32);
+    // The body is read after pre-routing, so requests are recorded by the route wrappers and,
+    // for unmatched requests, by the error handler.
+    server_->set_pre_routing_handler([](const httplib::Request &, httplib::Response &) {
+        tlsRouted = false;
+        return httplib::Server::HandlerResponse::Unhandled;
+    });
+    server_->set_error_handler([this](const httplib::Request &req, httplib::Response &res) {
+        if (tlsRouted) {
+            return;
+        }
+        Record(req);
+        if (fallback_) {
+            res.status = 200;
+            fallback_(req, res);
+        }
+    });
+}
+
+LoopbackServer::~LoopbackServer() { Stop(); }
+
+bool LoopbackServer::MakeCertificate() {
+    keys_ = std::make_unique<KeyMaterial>();
+    keys_->key = EVP_RSA_gen(2048);
+    if (keys_->key == nullptr) {
+        return false;
+    }
+    X509 *cert = X509_new();
+    keys_->cert = cert;
+    ASN1_INTEGER_set(X509_get_serialNumber(cert), 1);
+    X509_gmtime_adj(X509_getm_notBefore(cert), -3600);
+    X509_gmtime_adj(X509_getm_notAfter(cert), 7 * 24 * 3600);
+    X509_set_pubkey(cert, keys_->key);
+    X509_NAME *name = X509_get_subject_name(cert);
+    X509_NAME_add_entry_by_txt(name, "CN", MBSTRING_ASC,
+                               reinterpret_cast<const unsigned char *>("localhost"), -1, -1, 0);
+    X509_set_issuer_name(cert, name);
+    if (X509_sign(cert, keys_->key, EVP_sha256()) == 0) {
+        return false;
+    }
+    BIO *bio = BIO_new(BIO_s_mem());
+    PEM_write_bio_X509(bio, cert);
+    char *data = nullptr;
+    long len = BIO_get_mem_data(bio, &data);
+    certPem_.assign(data, static_cast<size_t>(len));
+    BIO_free(bio);
+    return true;
+}
+
+void LoopbackServer::Route(const std::string &method, const std::string &pattern,
+                           Handler handler) {
+    if (!server_) {
+        return;
+    }
+    handler = [this, inner = std::move(handler)](const httplib::Request &req,
+                                                 httplib::Response &res) {
+        tlsRouted = true;
+        Record(req);
+        inner(req, res);
+    };
+    if (method == "GET" || method == "*") {
+        server_->Get(pattern, handler);
+    }
+    if (method == "POST" || method == "*") {
+        server_->Post(pattern, handler);
+    }
+    if (method == "PUT") {
+        server_->Put(pattern, handler);
+    }
+    if (method == "DELETE") {
+        server_->Delete(pattern, handler);
+    }
+}
+
+void LoopbackServer::Fallback(Handler handler) { fallback_ = std::move(handler); }
+
+bool LoopbackServer::Start() {
+    if (!server_) {
+        return false;
+    }
+    if (running_) {
+        return true;
+    }
+    if (options_.port == 0) {
+        port_ = server_->bind_to_any_port(options_.host);
+        if (port_ <= 0) {
+            error_ = "cannot bind " + options_.host;
+            return false;
+        }
+    } else {
+        if (!server_->bind_to_port(options_.host, options_.port)) {
+            error_ = "cannot bind " + options_.host + ":" + std::to_string(options_.port) +
+                     " (" + strerror(errno) + ")";
+            return false;
+        }
+        port_ = options_.port;
+    }
+    WidenBacklog(port_);
+    running_ = true;
+    // The socket is bound and listening already, so clients may connect at once; the accept
+    // loop picks their connections up from the backlog.
+    thread_ = std::thread([this] { server_->listen_after_bind(); });
+    return true;
+}
+
+void LoopbackServer::Stop() {
+    if (running_) {
+        server_->stop();
+        if (thread_.joinable()) {
+            thread_.join();
+        }
+        running_ = false;
+    }
+}
+
+std::string LoopbackServer::BaseUrl() const {
+    std::string host = options_.host.find(':') != std::string::npos ? "[" + options_.host + "]"
+                                                                     : options_.host;
+    return std::string(options_.https ? "https" : "http") + "://" + host + ":" +
+           std::to_string(port_);
+}
+
+void LoopbackServer::Record(const httplib::Request &req) {
+    RecordedRequest r;
+    r.method = req.method;
+    r.path = req.path;
+    r.target = req.target;
+    size_t q = req.target.find('?');
+    if (q != std::string::npos) {
+        r.query = req.target.substr(q + 1);
+    }
+    for (const auto &h : req.headers) {
+        r.headers.emplace(h.first, h.second);
+    }
+    for (const auto &p : req.params) {
+        r.params.emplace(p.first, p.second);
+    }
+    if (req.is_multipart_form_data()) {
+        for (const auto &f : req.files) {
+            r.parts.push_back({f.second.name, f.second.filename, f.second.content_type,
+                               f.second.content});
+            if (f.second.filename.empty()) {
+                r.params.emplace(f.second.name, f.second.content);
+            }
+        }
+    } else {
+        r.body = req.body;
+        if (req.get_header_value("Content-Type").find("application/x-www-form-urlencoded") == 0) {
+            httplib::Params form;
+            httplib::detail::parse_query_text(req.body, form);
+            for (const auto &p : form) {
+                r.params.emplace(p.first, p.second);
+            }
+        }
+    }
+    r.remoteAddr = req.remote_addr;
+    std::lock_guard<std::mutex> lock(mutex_);
+    records_.push_back(std::move(r));
+}
+
+std::vector<RecordedRequest> LoopbackServer::Requests() const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return records_;
+}
+
+size_t LoopbackServer::RequestCount() const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return records_.size();
+}
+
+size_t LoopbackServer::CountPath(const std::string &path) const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    size_t n = 0;
+    for (const auto &r : records_) {
+        n += r.path == path ? 1 : 0;
+    }
+    return n;
+}
+
+RecordedRequest LoopbackServer::Last() const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return records_.empty() ? RecordedRequest() : records_.back();
+}
+
+void LoopbackServer::ClearRecords() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    records_.clear();
+}
+
+}  // namespace kovasim

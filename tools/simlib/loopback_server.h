@@ -1,0 +1,113 @@
+// A loopback HTTP/HTTPS server for tests, benchmarks and kovasim: per-route handlers over
+// cpp-httplib, a self-signed certificate made at start, and a record of every request.
+#ifndef KOVASIM_LOOPBACK_SERVER_H
+#define KOVASIM_LOOPBACK_SERVER_H
+
+#include <atomic>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include <httplib.h>
+
+namespace kovasim {
+
+// One part of a multipart/form-data body.
+struct RecordedPart {
+    std::string name;
+    std::string filename;
+    std::string contentType;
+    std::string content;
+};
+
+// What reached the server for one request.
+struct RecordedRequest {
+    std::string method;
+    std::string path;    // without the query string
+    std::string target;  // path and query exactly as sent
+    std::string query;   // raw query string (after "?"), "" when none
+    std::multimap<std::string, std::string> headers;  // names as sent
+    std::multimap<std::string, std::string> params;   // decoded query and form fields
+    std::string body;                                  // raw body (empty for multipart)
+    std::vector<RecordedPart> parts;
+    std::string remoteAddr;
+
+    // First header with that name, compared without regard to case; "" when absent.
+    std::string Header(const std::string &name) const;
+    bool HasHeader(const std::string &name) const;
+    // First decoded parameter with that name; "" when absent.
+    std::string Param(const std::string &name) const;
+    bool HasParam(const std::string &name) const;
+};
+
+class LoopbackServer {
+public:
+    struct Options {
+        std::string host = "127.0.0.1";
+        int port = 0;         // 0 picks a free port
+        bool https = false;   // serve TLS with a self-signed certificate for "localhost"
+        int threads = 16;     // worker threads (concurrent connections served)
+        bool keepAlive = true;
+    };
+    using Handler = std::function<void(const httplib::Request &, httplib::Response &)>;
+
+    LoopbackServer();
+    explicit LoopbackServer(const Options &options);
+    ~LoopbackServer();
+    LoopbackServer(const LoopbackServer &) = delete;
+    LoopbackServer &operator=(const LoopbackServer &) = delete;
+
+    // Routes: `method` is "GET", "POST", "PUT", "DELETE" or "*" (GET and POST); `pattern` is a
+    // cpp-httplib regular expression over the path. Register routes before Start.
+    void Route(const std::string &method, const std::string &pattern, Handler handler);
+    // Handler for everything no route matches (default: 404 with an empty body).
+    void Fallback(Handler handler);
+
+    // Binds and starts serving on a thread of its own. False when the address cannot be bound
+    // (for example port 80 without the right to bind it); Error() says why.
+    bool Start();
+    void Stop();
+    bool Running() const { return running_; }
+    const std::string &Error() const { return error_; }
+
+    int Port() const { return port_; }
+    const std::string &Host() const { return options_.host; }
+    bool Https() const { return options_.https; }
+    // "http://127.0.0.1:PORT" (no trailing slash); brackets around an IPv6 host.
+    std::string BaseUrl() const;
+    // The certificate in PEM form (HTTPS servers only), for clients that want to verify it.
+    const std::string &CertificatePem() const { return certPem_; }
+
+    // Every request received so far, in order of arrival.
+    std::vector<RecordedRequest> Requests() const;
+    size_t RequestCount() const;
+    // Requests whose path equals `path`.
+    size_t CountPath(const std::string &path) const;
+    RecordedRequest Last() const;
+    void ClearRecords();
+
+private:
+    void Record(const httplib::Request &req);
+    bool MakeCertificate();
+
+    Options options_;
+    std::unique_ptr<httplib::Server> server_;
+    std::thread thread_;
+    std::atomic<bool> running_{false};
+    int port_ = 0;
+    std::string error_;
+    std::string certPem_;
+    struct KeyMaterial;
+    std::unique_ptr<KeyMaterial> keys_;
+    mutable std::mutex mutex_;
+    std::vector<RecordedRequest> records_;
+    Handler fallback_;
+};
+
+}  // namespace kovasim
+
+#endif  // KOVASIM_LOOPBACK_SERVER_H
