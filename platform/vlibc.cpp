@@ -33,11 +33,16 @@ int MakeParents(const std::string &path) {
 const char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
 
 int DecodeChar(unsigned char c) {
-    if (c >= 'A' && c <= 'Z') return c - 'A';
-    if (c >= 'a' && c <= 'z') return c - 'a' + 26;
-    if (c >= '0' && c <= '9') return c - '0' + 52;
-    if (c == '+') return 62;
-    if (c == '/') return 63;
+    if (c >= 'A' && c <= 'Z')
+        return c - 'A';
+    if (c >= 'a' && c <= 'z')
+        return c - 'a' + 26;
+    if (c >= '0' && c <= '9')
+        return c - '0' + 52;
+    if (c == '+')
+        return 62;
+    if (c == '/')
+        return 63;
     return -1;
 }
 
@@ -49,11 +54,17 @@ extern "C" void VLIBCErrSetEx(int code, const char *file, int line) {
     snprintf(tlsError.file, sizeof(tlsError.file), "%s", file ? file : "");
 }
 
-extern "C" int VLIBCErrGet(void) { return tlsError.code; }
+extern "C" int VLIBCErrGet(void) {
+    return tlsError.code;
+}
 
-extern "C" const char *VLIBCErrorGetFile(void) { return tlsError.file; }
+extern "C" const char *VLIBCErrorGetFile(void) {
+    return tlsError.file;
+}
 
-extern "C" int VLIBCErrorGetLine(void) { return tlsError.line; }
+extern "C" int VLIBCErrorGetLine(void) {
+    return tlsError.line;
+}
 
 int VLIBCFileTouch(const char *path) {
     if (path == nullptr || *path == '\0') {
@@ -91,7 +102,8 @@ int VLIBCBase64SzEncodeFull(const unsigned char *in, size_t inLen, char *out, si
     }
     if (i < inLen) {
         unsigned v = in[i] << 16;
-        if (i + 1 < inLen) v |= in[i + 1] << 8;
+        if (i + 1 < inLen)
+            v |= in[i + 1] << 8;
         *w++ = kAlphabet[(v >> 18) & 63];
         *w++ = kAlphabet[(v >> 12) & 63];
         *w++ = (i + 1 < inLen) ? kAlphabet[(v >> 6) & 63] : '=';

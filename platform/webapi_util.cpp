@@ -33,8 +33,7 @@ bool JsonObjTostrPair(const Json::Value &obj, std::string &out, bool encode, boo
     }
     for (auto it = obj.begin(); it != obj.end(); ++it) {
         std::string name = it.name();
-        std::string value =
-            (!json && it->isString()) ? it->asString() : kova::JsonToString(*it);
+        std::string value = (!json && it->isString()) ? it->asString() : kova::JsonToString(*it);
         if (!out.empty()) {
             out.push_back('&');
         }

@@ -16,7 +16,7 @@
 namespace KOVA {
 
 class CredRequestPrivate {
-public:
+  public:
     explicit CredRequestPrivate(CredRequest *owner);
     ~CredRequestPrivate();
     CredRequestPrivate(const CredRequestPrivate &) = delete;
@@ -55,8 +55,7 @@ public:
                                          Json::Value *headers);
     static size_t WriteHeaderToStdout(char *data, size_t size, size_t nmemb,
                                       const Json::Value *message);
-    static int DebugCallback(void *handle, curl_infotype type, char *data, size_t size,
-                             void *user);
+    static int DebugCallback(void *handle, curl_infotype type, char *data, size_t size, void *user);
 
     // Fills protocol, host and port of the request's own credential from `url`.
     bool buildCredByURL(const std::string &url);

@@ -24,35 +24,35 @@ namespace KOVA {
 // WebAPI utilities. Values 3, 16 and 25 to 400 are unused.
 typedef enum _tag_CRED_REQ_ERR {
     CRED_REQ_ERR_NONE = 0,
-    CRED_REQ_ERR_BAD_PARAM = 1,         // an argument was rejected
-    CRED_REQ_ERR_NO_URL = 2,            // no "URL" string at transfer set-up
-    CRED_REQ_ERR_LOGIN_FAIL = 4,        // the login ProcessWithLogin makes first failed
-    CRED_REQ_ERR_QUERY_FAIL = 5,        // a probe or API-description query failed
-    CRED_REQ_ERR_NO_SUCH_API = 6,       // the server does not offer the API
-    CRED_REQ_ERR_NO_REQUEST_FORMAT = 7, // the API's request format is unknown
-    CRED_REQ_ERR_CURL_INTERNAL = 8,     // a libcurl call itself failed
-    CRED_REQ_ERR_RESOLVE = 9,           // host or proxy name not resolved
-    CRED_REQ_ERR_TIMEOUT = 10,          // operation timed out
-    CRED_REQ_ERR_SSL_CONNECT = 11,      // TLS handshake failed
-    CRED_REQ_ERR_CURL_OTHER = 12,       // any other libcurl failure
-    CRED_REQ_ERR_HTTP_SERVER = 13,      // HTTP status 500 to 599
-    CRED_REQ_ERR_HTTP_CLIENT = 14,      // HTTP status 400 to 499
-    CRED_REQ_ERR_HTTP_UNEXPECTED = 15,  // any status but 200, 302, 304, 4xx, 5xx
-    CRED_REQ_ERR_SELECT = 17,           // waiting for the multi handle's sockets failed
-    CRED_REQ_ERR_INVALID_RESPONSE = 18, // a login or logout answer could not be used
-    CRED_REQ_ERR_SEND = 19,             // sending failed
-    CRED_REQ_ERR_CONNECT = 20,          // connecting or receiving failed
-    CRED_REQ_ERR_NOT_MODIFIED = 21,     // HTTP status 304
-    CRED_REQ_ERR_UNKNOWN = 22,          // generic failure
-    CRED_REQ_ERR_SERVER_ERRNO = 23,     // the relay directory answered with an error
-    CRED_REQ_ERR_REDIRECT = 24,         // HTTP status 302 (redirects not followed)
-    CRED_REQ_ERR_NO_SERVER_ID = 401,    // relay client: no server id
-    CRED_REQ_ERR_NO_CONN_INFO = 402,    // relay client: no usable connection information
-    CRED_REQ_ERR_NO_SERVICE_ID = 403,   // relay client: no service id (or directory host)
-    CRED_REQ_ERR_EMPTY_REQUEST = 404,   // relay client: empty request document
-    CRED_REQ_ERR_NO_PORT = 405,         // relay client: no usable port for a direct connection
-    CRED_REQ_ERR_LOGIN_PARAM = 406,     // Login: the credential could not be prepared
-    CRED_REQ_ERR_LOGIN_SESSION = 407,   // Login: no session could be obtained or attached
+    CRED_REQ_ERR_BAD_PARAM = 1,          // an argument was rejected
+    CRED_REQ_ERR_NO_URL = 2,             // no "URL" string at transfer set-up
+    CRED_REQ_ERR_LOGIN_FAIL = 4,         // the login ProcessWithLogin makes first failed
+    CRED_REQ_ERR_QUERY_FAIL = 5,         // a probe or API-description query failed
+    CRED_REQ_ERR_NO_SUCH_API = 6,        // the server does not offer the API
+    CRED_REQ_ERR_NO_REQUEST_FORMAT = 7,  // the API's request format is unknown
+    CRED_REQ_ERR_CURL_INTERNAL = 8,      // a libcurl call itself failed
+    CRED_REQ_ERR_RESOLVE = 9,            // host or proxy name not resolved
+    CRED_REQ_ERR_TIMEOUT = 10,           // operation timed out
+    CRED_REQ_ERR_SSL_CONNECT = 11,       // TLS handshake failed
+    CRED_REQ_ERR_CURL_OTHER = 12,        // any other libcurl failure
+    CRED_REQ_ERR_HTTP_SERVER = 13,       // HTTP status 500 to 599
+    CRED_REQ_ERR_HTTP_CLIENT = 14,       // HTTP status 400 to 499
+    CRED_REQ_ERR_HTTP_UNEXPECTED = 15,   // any status but 200, 302, 304, 4xx, 5xx
+    CRED_REQ_ERR_SELECT = 17,            // waiting for the multi handle's sockets failed
+    CRED_REQ_ERR_INVALID_RESPONSE = 18,  // a login or logout answer could not be used
+    CRED_REQ_ERR_SEND = 19,              // sending failed
+    CRED_REQ_ERR_CONNECT = 20,           // connecting or receiving failed
+    CRED_REQ_ERR_NOT_MODIFIED = 21,      // HTTP status 304
+    CRED_REQ_ERR_UNKNOWN = 22,           // generic failure
+    CRED_REQ_ERR_SERVER_ERRNO = 23,      // the relay directory answered with an error
+    CRED_REQ_ERR_REDIRECT = 24,          // HTTP status 302 (redirects not followed)
+    CRED_REQ_ERR_NO_SERVER_ID = 401,     // relay client: no server id
+    CRED_REQ_ERR_NO_CONN_INFO = 402,     // relay client: no usable connection information
+    CRED_REQ_ERR_NO_SERVICE_ID = 403,    // relay client: no service id (or directory host)
+    CRED_REQ_ERR_EMPTY_REQUEST = 404,    // relay client: empty request document
+    CRED_REQ_ERR_NO_PORT = 405,          // relay client: no usable port for a direct connection
+    CRED_REQ_ERR_LOGIN_PARAM = 406,      // Login: the credential could not be prepared
+    CRED_REQ_ERR_LOGIN_SESSION = 407,    // Login: no session could be obtained or attached
 } CRED_REQ_ERR;
 
 // How a request's parameters travel: in plain, in an RSA envelope, or in an AES envelope.
@@ -65,7 +65,7 @@ typedef enum _tag_CRED_REQ_CRYPTO {
 class CredRequestPrivate;
 
 class KOVA_EXPORT CredRequest {
-public:
+  public:
     CredRequest();
     ~CredRequest();
     CredRequest(const CredRequest &) = delete;
@@ -159,24 +159,21 @@ public:
                           const Json::Value &params);
     // Fills `request` for the records' server and session.
     static bool CreateWebAPIRequest(KOVA::CredRequest *request, const KOVA_CRED *cred,
-                                    const KOVA_CRED_SESS *sess, const std::string &api,
-                                    int version, const std::string &method,
-                                    const Json::Value &params);
-    static KOVA::CredRequest *CreateWebAPIRequest(const KOVA_CRED *cred,
-                                                  const KOVA_CRED_SESS *sess,
+                                    const KOVA_CRED_SESS *sess, const std::string &api, int version,
+                                    const std::string &method, const Json::Value &params);
+    static KOVA::CredRequest *CreateWebAPIRequest(const KOVA_CRED *cred, const KOVA_CRED_SESS *sess,
                                                   const std::string &api, int version,
                                                   const std::string &method,
                                                   const Json::Value &params);
     // Loads credential credId, obtains a session (stored, or a fresh login), then builds.
-    static KOVA::CredRequest *CreateWebAPIRequest(long credId, const std::string &api,
-                                                  int version, const std::string &method,
+    static KOVA::CredRequest *CreateWebAPIRequest(long credId, const std::string &api, int version,
+                                                  const std::string &method,
                                                   const Json::Value &params);
-    static KOVA::CredRequest *CreateRelayRequest(long credId, const std::string &api,
-                                                 int version, const std::string &method,
-                                                 const Json::Value &headers, FILE *in,
-                                                 FILE *out);
+    static KOVA::CredRequest *CreateRelayRequest(long credId, const std::string &api, int version,
+                                                 const std::string &method,
+                                                 const Json::Value &headers, FILE *in, FILE *out);
 
-private:
+  private:
     friend class CredRequestPrivate;
     CredRequestPrivate *d;
 };

@@ -14,7 +14,7 @@ namespace KOVA {
 class CredRequestFarlinkPrivate;
 
 class KOVA_EXPORT CredRequestFarlink {
-public:
+  public:
     CredRequestFarlink();
     ~CredRequestFarlink();
     CredRequestFarlink(const CredRequestFarlink &) = delete;
@@ -49,7 +49,7 @@ public:
     static bool GetConnInfoPortal(const std::string &serverId, Json::Value &candidate,
                                   Json::Value *errors);
 
-private:
+  private:
     friend class CredRequestFarlinkPrivate;
     CredRequestFarlinkPrivate *d;
 };

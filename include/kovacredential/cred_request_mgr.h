@@ -18,7 +18,7 @@
 namespace KOVA {
 
 class KOVA_EXPORT CredRequestMgr {
-public:
+  public:
     CredRequestMgr();
     ~CredRequestMgr();
     CredRequestMgr(const CredRequestMgr &) = delete;
@@ -32,12 +32,10 @@ public:
     // Builds a WebAPI request with CredRequest::CreateWebAPIRequest and adds it.
     int AddWebAPIRequest(long credId, const std::string &api, int version,
                          const std::string &method, const Json::Value &params);
-    int AddWebAPIRequest(const KOVA_CRED *cred, const KOVA_CRED_SESS *sess,
-                         const std::string &api, int version, const std::string &method,
-                         const Json::Value &params);
-    int AddRelayRequest(long credId, const std::string &api, int version,
-                        const std::string &method, const Json::Value &headers, FILE *in,
-                        FILE *out);
+    int AddWebAPIRequest(const KOVA_CRED *cred, const KOVA_CRED_SESS *sess, const std::string &api,
+                         int version, const std::string &method, const Json::Value &params);
+    int AddRelayRequest(long credId, const std::string &api, int version, const std::string &method,
+                        const Json::Value &headers, FILE *in, FILE *out);
     // A WebAPI request for a server without a stored credential; the API description is
     // fetched under a temporary negative id and dropped again.
     int AddCredRequest(const std::string &protocol, const std::string &host, int port,
@@ -62,7 +60,7 @@ public:
                               void *socketp);
     bool curlHandlerProcess(CURLM *multi, long waitSeconds);
 
-private:
+  private:
     std::vector<KOVA::CredRequest *> requests;
     KOVA::_tag_CRED_REQ_ERR error;
 };

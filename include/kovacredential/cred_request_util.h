@@ -18,7 +18,7 @@
 namespace KOVA {
 
 class KOVA_EXPORT CredRequestUtil {
-public:
+  public:
     // {"webapiDesc": {"<credential id>": <the server's "data" answer to KOVA.API.Info>}}
     static Json::Value m_jsData;
     // Last error of these operations (CRED_REQ_ERR_QUERY_FAIL, CRED_REQ_ERR_NO_SUCH_API);

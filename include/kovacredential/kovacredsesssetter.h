@@ -9,9 +9,9 @@
 
 #include "kovacred.h"
 
-KOVA_EXPORT int KOVACredSessItemSetID(KOVA_CRED_SESS *pSess, int32_t val);  // 1
+KOVA_EXPORT int KOVACredSessItemSetID(KOVA_CRED_SESS *pSess, int32_t val);                 // 1
 KOVA_EXPORT int KOVACredSessItemSetAccessToken(KOVA_CRED_SESS *pSess, const char *szVal);  // 2
-KOVA_EXPORT int KOVACredSessItemSetCsrfToken(KOVA_CRED_SESS *pSess, const char *szVal);  // 3
-KOVA_EXPORT int KOVACredSessItemSetExtraInfo(KOVA_CRED_SESS *pSess, const char *szVal);  // 4
+KOVA_EXPORT int KOVACredSessItemSetCsrfToken(KOVA_CRED_SESS *pSess, const char *szVal);    // 3
+KOVA_EXPORT int KOVACredSessItemSetExtraInfo(KOVA_CRED_SESS *pSess, const char *szVal);    // 4
 
 #endif  // KOVACREDENTIAL_KOVACREDSESSSETTER_H

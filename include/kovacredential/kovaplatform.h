@@ -13,10 +13,10 @@ extern "C" {
 #endif
 
 // Error codes recorded in the error slot by the credential store.
-#define KOVA_ERR_OUT_OF_MEMORY 0x0200    // 512: an allocation failed
-#define KOVA_ERR_DB_OPEN 0x0900          // 2304: the database cannot be opened
-#define KOVA_ERR_DB_READBACK 0x0B00      // 2816: a written row is not found when read back
-#define KOVA_ERR_INVALID_ARGUMENT 0x0D00 // 3328: an argument was rejected
+#define KOVA_ERR_OUT_OF_MEMORY 0x0200     // 512: an allocation failed
+#define KOVA_ERR_DB_OPEN 0x0900           // 2304: the database cannot be opened
+#define KOVA_ERR_DB_READBACK 0x0B00       // 2816: a written row is not found when read back
+#define KOVA_ERR_INVALID_ARGUMENT 0x0D00  // 3328: an argument was rejected
 
 // Records `code` with the source `file` and `line` that detected it, replacing the previous
 // error of the calling thread. `file` is copied (at most 255 bytes kept); null reads back as "".

@@ -44,7 +44,9 @@ void RealSleep(unsigned long micros) {
 
 extern "C" {
 
-void vsyslog(int, const char *fmt, va_list ap) { Capture(fmt, ap); }
+void vsyslog(int, const char *fmt, va_list ap) {
+    Capture(fmt, ap);
+}
 
 void syslog(int, const char *fmt, ...) {
     va_list ap;
@@ -53,7 +55,9 @@ void syslog(int, const char *fmt, ...) {
     va_end(ap);
 }
 
-void __vsyslog_chk(int, int, const char *fmt, va_list ap) { Capture(fmt, ap); }
+void __vsyslog_chk(int, int, const char *fmt, va_list ap) {
+    Capture(fmt, ap);
+}
 
 void __syslog_chk(int, int, const char *fmt, ...) {
     va_list ap;
@@ -119,7 +123,9 @@ std::string LogDump() {
     return out;
 }
 
-void SetFakeSleep(bool on) { gFakeSleep = on; }
+void SetFakeSleep(bool on) {
+    gFakeSleep = on;
+}
 
 std::vector<unsigned> UsleepCalls() {
     std::lock_guard<std::mutex> lock(gMutex);

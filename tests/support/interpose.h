@@ -14,7 +14,9 @@ std::vector<std::string> LogRecords();
 void ClearLog();
 // Number of records containing `needle`.
 size_t LogCount(const std::string &needle);
-inline bool LogHas(const std::string &needle) { return LogCount(needle) > 0; }
+inline bool LogHas(const std::string &needle) {
+    return LogCount(needle) > 0;
+}
 // All records joined by newlines, for failure messages.
 std::string LogDump();
 
@@ -26,7 +28,7 @@ void ClearSleeps();
 
 // RAII: fake sleeping for the lifetime of the object, with the records cleared at start.
 class FakeSleepScope {
-public:
+  public:
     FakeSleepScope() {
         ClearSleeps();
         SetFakeSleep(true);

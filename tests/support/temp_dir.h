@@ -7,7 +7,7 @@
 namespace kova_test {
 
 class TempDir {
-public:
+  public:
     TempDir();
     ~TempDir();
     TempDir(const TempDir &) = delete;
@@ -15,20 +15,20 @@ public:
     const std::string &path() const { return path_; }
     std::string File(const std::string &name) const { return path_ + "/" + name; }
 
-private:
+  private:
     std::string path_;
 };
 
 // Points kovacredential_db at a database in a fresh temporary folder for the object's life
 // and restores the previous value afterwards.
 class TempDatabase {
-public:
+  public:
     TempDatabase();
     ~TempDatabase();
     const std::string &path() const { return db_; }
     const TempDir &dir() const { return dir_; }
 
-private:
+  private:
     TempDir dir_;
     std::string db_;
     bool hadOld_ = false;

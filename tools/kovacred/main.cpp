@@ -15,7 +15,9 @@ std::vector<RegisterFn> &Registry() {
     return registry;
 }
 
-Registrar::Registrar(RegisterFn fn) { Registry().push_back(std::move(fn)); }
+Registrar::Registrar(RegisterFn fn) {
+    Registry().push_back(std::move(fn));
+}
 
 int Fail(const std::string &what, long code) {
     fprintf(stderr, "kovacred: %s failed (error %ld)\n", what.c_str(), code);

@@ -123,7 +123,9 @@ LoopbackServer::LoopbackServer(const Options &options) : options_(options) {
     });
 }
 
-LoopbackServer::~LoopbackServer() { Stop(); }
+LoopbackServer::~LoopbackServer() {
+    Stop();
+}
 
 bool LoopbackServer::MakeCertificate() {
     keys_ = std::make_unique<KeyMaterial>();
@@ -153,8 +155,7 @@ bool LoopbackServer::MakeCertificate() {
     return true;
 }
 
-void LoopbackServer::Route(const std::string &method, const std::string &pattern,
-                           Handler handler) {
+void LoopbackServer::Route(const std::string &method, const std::string &pattern, Handler handler) {
     if (!server_) {
         return;
     }
@@ -178,7 +179,9 @@ void LoopbackServer::Route(const std::string &method, const std::string &pattern
     }
 }
 
-void LoopbackServer::Fallback(Handler handler) { fallback_ = std::move(handler); }
+void LoopbackServer::Fallback(Handler handler) {
+    fallback_ = std::move(handler);
+}
 
 bool LoopbackServer::Start() {
     if (!server_) {
@@ -195,8 +198,8 @@ bool LoopbackServer::Start() {
         }
     } else {
         if (!server_->bind_to_port(options_.host, options_.port)) {
-            error_ = "cannot bind " + options_.host + ":" + std::to_string(options_.port) +
-                     " (" + strerror(errno) + ")";
+            error_ = "cannot bind " + options_.host + ":" + std::to_string(options_.port) + " (" +
+                     strerror(errno) + ")";
             return false;
         }
         port_ = options_.port;
@@ -220,8 +223,8 @@ void LoopbackServer::Stop() {
 }
 
 std::string LoopbackServer::BaseUrl() const {
-    std::string host = options_.host.find(':') != std::string::npos ? "[" + options_.host + "]"
-                                                                     : options_.host;
+    std::string host =
+        options_.host.find(':') != std::string::npos ? "[" + options_.host + "]" : options_.host;
     return std::string(options_.https ? "https" : "http") + "://" + host + ":" +
            std::to_string(port_);
 }
@@ -243,8 +246,8 @@ void LoopbackServer::Record(const httplib::Request &req) {
     }
     if (req.is_multipart_form_data()) {
         for (const auto &f : req.files) {
-            r.parts.push_back({f.second.name, f.second.filename, f.second.content_type,
-                               f.second.content});
+            r.parts.push_back(
+                {f.second.name, f.second.filename, f.second.content_type, f.second.content});
             if (f.second.filename.empty()) {
                 r.params.emplace(f.second.name, f.second.content);
             }

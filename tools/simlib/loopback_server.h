@@ -27,12 +27,12 @@ struct RecordedPart {
 // What reached the server for one request.
 struct RecordedRequest {
     std::string method;
-    std::string path;    // without the query string
-    std::string target;  // path and query exactly as sent
-    std::string query;   // raw query string (after "?"), "" when none
+    std::string path;                                 // without the query string
+    std::string target;                               // path and query exactly as sent
+    std::string query;                                // raw query string (after "?"), "" when none
     std::multimap<std::string, std::string> headers;  // names as sent
     std::multimap<std::string, std::string> params;   // decoded query and form fields
-    std::string body;                                  // raw body (empty for multipart)
+    std::string body;                                 // raw body (empty for multipart)
     std::vector<RecordedPart> parts;
     std::string remoteAddr;
 
@@ -45,12 +45,12 @@ struct RecordedRequest {
 };
 
 class LoopbackServer {
-public:
+  public:
     struct Options {
         std::string host = "127.0.0.1";
-        int port = 0;         // 0 picks a free port
-        bool https = false;   // serve TLS with a self-signed certificate for "localhost"
-        int threads = 16;     // worker threads (concurrent connections served)
+        int port = 0;        // 0 picks a free port
+        bool https = false;  // serve TLS with a self-signed certificate for "localhost"
+        int threads = 16;    // worker threads (concurrent connections served)
         bool keepAlive = true;
     };
     using Handler = std::function<void(const httplib::Request &, httplib::Response &)>;
@@ -90,7 +90,7 @@ public:
     RecordedRequest Last() const;
     void ClearRecords();
 
-private:
+  private:
     void Record(const httplib::Request &req);
     bool MakeCertificate();
 

@@ -1,0 +1,198 @@
+// The port layer: error slot, file touch, Base64, pair and URL encoding, token service and
+// address-family query.
+#include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <string>
+#include <thread>
+
+#include <gtest/gtest.h>
+
+#include "platform/json_text.h"
+#include "platform/vlibc.h"
+#include "platform/webapi_util.h"
+#include "support/temp_dir.h"
+
+namespace {
+
+TEST(ErrorSlot, RecordsCodeFileAndLinePerThread) {
+    VLIBCErrSetEx(0x0D00, "cred_db", 193);
+    EXPECT_EQ(VLIBCErrGet(), 0x0D00);
+    EXPECT_STREQ(VLIBCErrorGetFile(), "cred_db");
+    EXPECT_EQ(VLIBCErrorGetLine(), 193);
+
+    int otherCode = -1;
+    std::thread([&] { otherCode = VLIBCErrGet(); }).join();
+    EXPECT_EQ(otherCode, 0) << "a fresh thread starts with an empty slot";
+
+    std::string longName(400, 'f');
+    VLIBCErrSetEx(0x0900, longName.c_str(), 169);
+    EXPECT_EQ(std::string(VLIBCErrorGetFile()), longName.substr(0, 255));
+    VLIBCErrSetEx(0x0200, nullptr, 10);
+    EXPECT_STREQ(VLIBCErrorGetFile(), "");
+}
+
+TEST(FileTouch, CreatesMissingFoldersPrivately) {
+    kova_test::TempDir dir;
+    std::string path = dir.File("a/b/c/file.sqlite");
+    ASSERT_EQ(VLIBCFileTouch(path.c_str()), 0);
+    struct stat st;
+    ASSERT_EQ(stat(path.c_str(), &st), 0);
+    EXPECT_TRUE(S_ISREG(st.st_mode));
+    EXPECT_EQ(st.st_size, 0);
+    ASSERT_EQ(stat(dir.File("a/b").c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0700u);
+
+    // An existing file keeps its contents.
+    FILE *f = fopen(path.c_str(), "w");
+    fputs("data", f);
+    fclose(f);
+    ASSERT_EQ(VLIBCFileTouch(path.c_str()), 0);
+    ASSERT_EQ(stat(path.c_str(), &st), 0);
+    EXPECT_EQ(st.st_size, 4);
+
+    // A parent that is a regular file cannot become a folder.
+    EXPECT_EQ(VLIBCFileTouch((path + "/below").c_str()), -1);
+    EXPECT_EQ(VLIBCFileTouch(""), -1);
+    EXPECT_EQ(VLIBCFileTouch(nullptr), -1);
+}
+
+std::string Encode(const std::string &in) {
+    char buf[256];
+    EXPECT_NE(VLIBCBase64SzEncodeFull(reinterpret_cast<const unsigned char *>(in.data()), in.size(),
+                                      buf, sizeof(buf), 0),
+              0);
+    return buf;
+}
+
+std::string Decode(const std::string &in, bool *ok) {
+    unsigned char buf[256];
+    size_t len = sizeof(buf);
+    *ok = VLIBCBase64Decode(in.data(), in.size(), buf, &len) != 0;
+    return *ok ? std::string(reinterpret_cast<char *>(buf), len) : "";
+}
+
+TEST(Base64, MatchesTheStandardVectorsBothWays) {
+    const std::pair<std::string, std::string> vectors[] = {
+        {"", ""},
+        {"f", "Zg=="},
+        {"fo", "Zm8="},
+        {"foo", "Zm9v"},
+        {"foob", "Zm9vYg=="},
+        {"fooba", "Zm9vYmE="},
+        {"foobar", "Zm9vYmFy"},
+        {std::string("\xfb\xff\x00", 3), "+/8A"}};
+    for (const auto &v : vectors) {
+        EXPECT_EQ(Encode(v.first), v.second);
+        bool ok = false;
+        EXPECT_EQ(Decode(v.second, &ok), v.first);
+        EXPECT_TRUE(ok) << v.second;
+    }
+    // Long input is not broken into lines.
+    std::string longText(300, 'x');
+    char big[512];
+    ASSERT_NE(VLIBCBase64SzEncodeFull(reinterpret_cast<const unsigned char *>(longText.data()),
+                                      longText.size(), big, sizeof(big), 0),
+              0);
+    EXPECT_EQ(std::string(big).find('\n'), std::string::npos);
+    EXPECT_EQ(strlen(big), 400u);
+}
+
+TEST(Base64, RejectsBadInputAndSmallBuffers) {
+    bool ok = true;
+    Decode("Zm9v!A==", &ok);
+    EXPECT_FALSE(ok);
+    Decode("Z", &ok);
+    EXPECT_FALSE(ok);
+    Decode("Zm=v", &ok);
+    EXPECT_FALSE(ok);
+    EXPECT_EQ(Decode("Zm9vYg", &ok), "foob") << "padding may be left out";
+    EXPECT_TRUE(ok);
+
+    char small[4];
+    const unsigned char data[] = "abc";
+    EXPECT_EQ(VLIBCBase64SzEncodeFull(data, 3, small, sizeof(small), 0), 0)
+        << "no room for the terminating NUL";
+    unsigned char out[2];
+    size_t len = sizeof(out);
+    EXPECT_EQ(VLIBCBase64Decode("Zm9v", 4, out, &len), 0);
+}
+
+TEST(PairEncoding, EncodesNamesAndValues) {
+    EXPECT_EQ(KOVA::WebAPIUtil::URLEncode("a b&c=d/é~-._"), "a%20b%26c%3Dd%2F%C3%A9~-._");
+
+    Json::Value params;
+    params["version"] = 3;
+    params["account"] = "ad min";
+    params["flag"] = true;
+    params["list"] = Json::Value(Json::arrayValue);
+    params["list"].append("x");
+    std::string out;
+    ASSERT_TRUE(KOVA::WebAPIUtil::JsonObjTostrPair(params, out, true, false));
+    EXPECT_EQ(out, "account=ad%20min&flag=true&list=%5B%22x%22%5D&version=3");
+
+    ASSERT_TRUE(KOVA::WebAPIUtil::JsonObjTostrPair(params, out, true, true));
+    EXPECT_EQ(out, "account=%22ad%20min%22&flag=true&list=%5B%22x%22%5D&version=3")
+        << "JSON format writes strings with their quotes";
+
+    ASSERT_TRUE(KOVA::WebAPIUtil::JsonObjTostrPair(params, out, false, false));
+    EXPECT_EQ(out, "account=ad min&flag=true&list=[\"x\"]&version=3");
+
+    EXPECT_TRUE(KOVA::WebAPIUtil::JsonObjTostrPair(Json::Value(), out, true, false));
+    EXPECT_EQ(out, "");
+    out = "stale";
+    EXPECT_FALSE(KOVA::WebAPIUtil::JsonObjTostrPair(Json::Value("text"), out, true, false));
+    EXPECT_EQ(out, "");
+}
+
+TEST(JsonText, ParsesStrictlyAndWritesCompactly) {
+    Json::Value v;
+    EXPECT_TRUE(kova::JsonFromString("{\"a\": [1, \"\xc3\xa9\"]}", v));
+    EXPECT_EQ(kova::JsonToString(v), "{\"a\":[1,\"\xc3\xa9\"]}");
+    EXPECT_FALSE(kova::JsonFromString("<html></html>", v));
+    EXPECT_TRUE(v.isNull());
+    EXPECT_FALSE(kova::JsonFromString("{\"a\":1} trailing", v));
+    EXPECT_FALSE(kova::JsonFromString("", v));
+    EXPECT_FALSE(kova::JsonFromString("{'a':1}", v));
+}
+
+int FixedProvider(char *token, size_t tokenSize, char *key, size_t keySize) {
+    snprintf(token, tokenSize, "%s", "token-0123456789-0123456789-0123456789");
+    snprintf(key, keySize, "%s", "key");
+    return 0;
+}
+
+int FailingProvider(char *, size_t, char *, size_t) {
+    return -7;
+}
+
+TEST(TokenService, NeedsAProviderAndTerminatesItsBuffers) {
+    char token[36];
+    char key[33];
+    KOVACloudServiceHxtokenSetProvider(nullptr);
+    EXPECT_EQ(KOVACloudServiceHxtokenGetToken(token, sizeof(token), key, sizeof(key)), -1);
+
+    KOVACloudServiceHxtokenSetProvider(FixedProvider);
+    EXPECT_EQ(KOVACloudServiceHxtokenGetToken(token, sizeof(token), key, sizeof(key)), 0);
+    EXPECT_EQ(strlen(token), sizeof(token) - 1) << "cut to the buffer";
+    EXPECT_STREQ(key, "key");
+    EXPECT_EQ(KOVACloudServiceHxtokenGetToken(nullptr, 0, key, sizeof(key)), -1);
+
+    KOVACloudServiceHxtokenSetProvider(FailingProvider);
+    EXPECT_EQ(KOVACloudServiceHxtokenGetToken(token, sizeof(token), key, sizeof(key)), -7);
+    KOVACloudServiceHxtokenSetProvider(nullptr);
+}
+
+TEST(AddressType, ClassifiesNumericHostsOnly) {
+    EXPECT_EQ(KOVANetGetAddrType("192.168.1.10"), 2);
+    EXPECT_EQ(KOVANetGetAddrType("::1"), 10);
+    EXPECT_EQ(KOVANetGetAddrType("fe80::1%eth0"), 10);
+    EXPECT_EQ(KOVANetGetAddrType("[::1]"), -1);
+    EXPECT_EQ(KOVANetGetAddrType("nas.local"), -1);
+    EXPECT_EQ(KOVANetGetAddrType("1.2.3"), -1);
+    EXPECT_EQ(KOVANetGetAddrType(""), -1);
+    EXPECT_EQ(KOVANetGetAddrType(nullptr), -1);
+}
+
+}  // namespace
