@@ -1,8 +1,10 @@
 // Credential and session records: accessors, their argument errors, the row callbacks and the
 // allocation, clearing and list functions.
+#include <errno.h>
 #include <string.h>
 
 #include <functional>
+#include <new>
 #include <string>
 #include <vector>
 
@@ -10,9 +12,29 @@
 
 #include "store_fixture.h"
 
+// While set, the non-throwing operator new fails as an exhausted heap would.
+bool gFailNothrowNew = false;
+
+void *operator new(std::size_t size, const std::nothrow_t &) noexcept {
+    if (gFailNothrowNew) {
+        errno = ENOMEM;
+        return nullptr;
+    }
+    try {
+        return ::operator new(size);
+    } catch (...) {
+        return nullptr;
+    }
+}
+
 namespace {
 
 using namespace store_test;
+
+struct FailNothrowNewScope {
+    FailNothrowNewScope() { gFailNothrowNew = true; }
+    ~FailNothrowNewScope() { gFailNothrowNew = false; }
+};
 
 const std::string kSetter = "../include/kovacredential/kovacredsetter.h";
 const std::string kGetter = "../include/kovacredential/kovacredgetter.h";
@@ -379,6 +401,44 @@ TEST_F(RecordsTest, ClearFreesTheChainAndResets) {
     EXPECT_EQ(KOVACredSessClear(nullptr), -1);
     EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
     EXPECT_EQ(VLIBCErrGet(), 0);
+}
+
+TEST_F(RecordsTest, FailedAllocationsAreReported) {
+    KOVA_CRED *cred;
+    KOVA_CRED_SESS *sess;
+    {
+        FailNothrowNewScope noMemory;
+        cred = KOVACredAlloc();
+        sess = KOVACredSessAlloc();
+    }
+    EXPECT_EQ(cred, nullptr);
+    EXPECT_EQ(sess, nullptr);
+    EXPECT_TRUE(ErrorIs(KOVA_ERR_OUT_OF_MEMORY, "cred_sess_alloc", 10));
+    EXPECT_EQ(
+        kova_test::LogRecords(),
+        (std::vector<std::string>{
+            std::string("cred_alloc:9 Allocate KOVA_CRED failed. ") + strerror(ENOMEM),
+            std::string("cred_sess_alloc:9 Allocate KOVA_CRED_SESS failed. ") + strerror(ENOMEM)}));
+}
+
+TEST_F(RecordsTest, RowAppendDropsARowItCannotAllocate) {
+    KOVA_CRED *head = nullptr;
+    FakeRow first = CredRow("1", "a");
+    FakeRow second = CredRow("2", "b");
+    FakeRow third = CredRow("3", "c");
+    first.Feed(CredRowAppend, &head);
+    {
+        FailNothrowNewScope noMemory;
+        EXPECT_EQ(second.Feed(CredRowAppend, &head), 0);  // the query goes on
+    }
+    third.Feed(CredRowAppend, &head);
+    ASSERT_NE(head, nullptr);
+    EXPECT_EQ(head->id, 3);
+    ASSERT_NE(head->next, nullptr);
+    EXPECT_EQ(head->next->id, 1);
+    EXPECT_EQ(head->next->next, nullptr);
+    KOVACredListFree(&head);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
 }
 
 TEST_F(RecordsTest, FreeAndNextOfNullRecords) {
