@@ -83,12 +83,12 @@ bool ReadPassword(std::string *password) {
         if (tcgetattr(STDIN_FILENO, &saved) == 0) {
             struct termios quiet = saved;
             quiet.c_lflag &= ~static_cast<tcflag_t>(ECHO);
-            tcsetattr(STDIN_FILENO, TCSAFLUSH, &quiet);
+            tcsetattr(STDIN_FILENO, TCSANOW, &quiet);
         }
     }
     const bool got = static_cast<bool>(std::getline(std::cin, *password));
     if (terminal) {
-        tcsetattr(STDIN_FILENO, TCSAFLUSH, &saved);
+        tcsetattr(STDIN_FILENO, TCSANOW, &saved);
         fprintf(stderr, "\n");
     }
     if (!password->empty() && password->back() == '\r') {
