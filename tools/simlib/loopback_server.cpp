@@ -7,6 +7,8 @@
 #include <netinet/in.h>
 #include <sys/socket.h>
 
+#include <chrono>
+
 #include <openssl/bn.h>
 #include <openssl/evp.h>
 #include <openssl/pem.h>
@@ -123,7 +125,9 @@ LoopbackServer::LoopbackServer(const Options &options) : options_(options) {
     });
 }
 
-LoopbackServer::~LoopbackServer() { Stop(); }
+LoopbackServer::~LoopbackServer() {
+    Stop();
+}
 
 bool LoopbackServer::MakeCertificate() {
     keys_ = std::make_unique<KeyMaterial>();
@@ -153,8 +157,7 @@ bool LoopbackServer::MakeCertificate() {
     return true;
 }
 
-void LoopbackServer::Route(const std::string &method, const std::string &pattern,
-                           Handler handler) {
+void LoopbackServer::Route(const std::string &method, const std::string &pattern, Handler handler) {
     if (!server_) {
         return;
     }
@@ -178,7 +181,9 @@ void LoopbackServer::Route(const std::string &method, const std::string &pattern
     }
 }
 
-void LoopbackServer::Fallback(Handler handler) { fallback_ = std::move(handler); }
+void LoopbackServer::Fallback(Handler handler) {
+    fallback_ = std::move(handler);
+}
 
 bool LoopbackServer::Start() {
     if (!server_) {
@@ -195,8 +200,8 @@ bool LoopbackServer::Start() {
         }
     } else {
         if (!server_->bind_to_port(options_.host, options_.port)) {
-            error_ = "cannot bind " + options_.host + ":" + std::to_string(options_.port) +
-                     " (" + strerror(errno) + ")";
+            error_ = "cannot bind " + options_.host + ":" + std::to_string(options_.port) + " (" +
+                     strerror(errno) + ")";
             return false;
         }
         port_ = options_.port;
@@ -206,6 +211,11 @@ bool LoopbackServer::Start() {
     // The socket is bound and listening already, so clients may connect at once; the accept
     // loop picks their connections up from the backlog.
     thread_ = std::thread([this] { server_->listen_after_bind(); });
+    // cpp-httplib marks the server running only when its accept loop starts, and ignores a
+    // stop() that comes before; waiting here keeps an early Stop from hanging in join.
+    for (int i = 0; i < 5000 && !server_->is_running(); ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
     return true;
 }
 
@@ -220,8 +230,8 @@ void LoopbackServer::Stop() {
 }
 
 std::string LoopbackServer::BaseUrl() const {
-    std::string host = options_.host.find(':') != std::string::npos ? "[" + options_.host + "]"
-                                                                     : options_.host;
+    std::string host =
+        options_.host.find(':') != std::string::npos ? "[" + options_.host + "]" : options_.host;
     return std::string(options_.https ? "https" : "http") + "://" + host + ":" +
            std::to_string(port_);
 }
@@ -243,8 +253,8 @@ void LoopbackServer::Record(const httplib::Request &req) {
     }
     if (req.is_multipart_form_data()) {
         for (const auto &f : req.files) {
-            r.parts.push_back({f.second.name, f.second.filename, f.second.content_type,
-                               f.second.content});
+            r.parts.push_back(
+                {f.second.name, f.second.filename, f.second.content_type, f.second.content});
             if (f.second.filename.empty()) {
                 r.params.emplace(f.second.name, f.second.content);
             }
