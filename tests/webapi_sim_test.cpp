@@ -1,0 +1,172 @@
+// The simulator's own contract: JSON error answers for every bad request (never a crash),
+// configuration checks, and enough worker threads for many concurrent slow calls.
+#include <atomic>
+#include <chrono>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "webapi_fixture.h"
+
+namespace kova_test {
+namespace {
+
+using KOVA::CredRequest;
+
+class WebApiSimTest : public WebApiTest {
+  protected:
+    // Posts a raw form body to /webapi/<cgi> and returns the answer's error code (0 on success).
+    static int Post(const std::string &cgi, const std::string &body, Json::Value *answer = nullptr,
+                    const std::string &query = "") {
+        CredRequest request;
+        request.SetURL(Server().BaseUrl() + "/webapi/" + cgi + query);
+        request.AddRawParam(body);
+        EXPECT_TRUE(request.Process(true, 0)) << request.GetError();
+        Json::Value parsed = ParseBody(request.GetResponse());
+        if (answer != nullptr) {
+            *answer = parsed;
+        }
+        EXPECT_TRUE(parsed.isObject()) << request.GetResponse();
+        return parsed["success"].asBool() ? 0 : parsed["error"]["code"].asInt();
+    }
+};
+
+TEST_F(WebApiSimTest, BadRequestsGetJsonErrors) {
+    using S = kovasim::WebApiSim;
+    EXPECT_EQ(S::kErrMissingParam, Post("entry.cgi", "version=1&method=echo"));
+    EXPECT_EQ(S::kErrMissingParam, Post("entry.cgi", "garbage"));
+    EXPECT_EQ(S::kErrNoSuchApi, Post("entry.cgi", "api=KOVA.None&version=1&method=x"));
+    EXPECT_EQ(S::kErrNoSuchApi, Post("auth.cgi", "api=KOVA.Demo.Echo&version=1&method=x"));
+    EXPECT_EQ(S::kErrBadVersion, Post("entry.cgi", "api=KOVA.Demo.Echo&version=3&method=x"));
+    EXPECT_EQ(S::kErrBadParam, Post("entry.cgi", "api=KOVA.Demo.Echo&version=one&method=x"));
+    EXPECT_EQ(S::kErrNoSuchMethod, Post("query.cgi", "api=KOVA.API.Info&version=1&method=x"));
+    EXPECT_EQ(S::kErrNeedEncryption, Post("auth.cgi",
+                                          "api=KOVA.API.Auth&version=3&method=login&account=admin&"
+                                          "passwd=secret"));
+    EXPECT_EQ(S::kErrBadVersion,
+              Post("auth.cgi", "api=KOVA.API.Auth&version=1&method=login&account=admin"));
+    EXPECT_EQ(S::kErrBadEnvelope, Post("auth.cgi", Sim().CipherKey() + "=%21%21notbase64"));
+    EXPECT_EQ(S::kErrBadEnvelope, Post("auth.cgi", Sim().CipherKey() + "=QUJDRA%3D%3D"));
+    EXPECT_EQ(S::kErrBadEnvelope, Post("entry.cgi", "__tXeTrEhPiC=QUJD&__nEkOtReHpIc=wrong"));
+    EXPECT_EQ(S::kErrInvalidSession,
+              Post("entry.cgi", "api=KOVA.Demo.Session&version=1&method=x&_sid=unknown"));
+    EXPECT_EQ(S::kErrInvalidSession,
+              Post("auth.cgi", "api=KOVA.API.Auth&version=1&method=logout&_sid=unknown"));
+    EXPECT_EQ(S::kErrMissingParam, Post("auth.cgi", "api=KOVA.API.Auth&version=1&method=logout"));
+    EXPECT_EQ(S::kErrBadParam, Post("entry.cgi", "count=notjson", nullptr,
+                                    "?api=%22KOVA.Demo.Json%22&version=%221%22&method=%22get%22"));
+    EXPECT_EQ(S::kErrBadParam, Post("delay.cgi", "api=KOVA.Demo.Delay&version=1&method=x&ms=z"));
+
+    Json::Value answer;
+    EXPECT_EQ(0,
+              Post("encryption.cgi", "api=KOVA.API.Encryption&version=1&method=getinfo", &answer));
+    EXPECT_EQ(Sim().PublicKeyHex(), answer["data"]["public_key"].asString());
+    EXPECT_TRUE(answer["data"]["server_time"].isIntegral());
+    EXPECT_EQ(0, Post("query.cgi", "api=KOVA.API.Info&version=1&method=query&query=KOVA.API.Auth",
+                      &answer));
+    EXPECT_EQ(1u, answer["data"].size());
+}
+
+TEST_F(WebApiSimTest, UploadNeedsASessionAndAFile) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    KOVA_CRED_SESS sess;
+    ASSERT_TRUE(KOVA::CredRequestUtil::Login(&cred, &sess));
+    TempDir dir;
+    std::string path = dir.File("data.bin");
+    FILE *f = fopen(path.c_str(), "wb");
+    ASSERT_NE(nullptr, f);
+    fputs("0123456789", f);
+    fclose(f);
+    std::unique_ptr<CredRequest> request(CredRequest::CreateWebAPIRequest(
+        &cred, &sess, "KOVA.Demo.Upload", 1, "put", Json::Value()));
+    ASSERT_TRUE(request);
+    ASSERT_TRUE(request->SetUploadFile("file", path.c_str()));
+    ASSERT_TRUE(request->Process(true, 0));
+    Json::Value answer = ParseBody(request->GetResponse());
+    ASSERT_TRUE(answer["success"].asBool()) << request->GetResponse();
+    EXPECT_EQ(10, answer["data"]["size"].asInt());
+    EXPECT_EQ("data.bin", answer["data"]["name"].asString());
+    ASSERT_FALSE(Sim().Uploads().empty());
+    EXPECT_EQ("0123456789", Sim().Uploads().back().content);
+
+    EXPECT_EQ(
+        kovasim::WebApiSim::kErrMissingParam,
+        Post("upload.cgi", "api=KOVA.Demo.Upload&version=1&method=put&_sid=" + sess.access_token));
+}
+
+TEST_F(WebApiSimTest, ConfigurationIsCheckedBeforeItApplies) {
+    kovasim::WebApiSim sim;
+    std::string error;
+    Json::Value bad;
+    bad["apis"]["X.Y"]["handler"] = "echo";
+    EXPECT_FALSE(sim.Configure(bad, &error));
+    EXPECT_NE(std::string::npos, error.find("path")) << error;
+    bad = Json::Value();
+    bad["accounts"] = "admin";
+    EXPECT_FALSE(sim.Configure(bad, &error));
+    bad = Json::Value();
+    bad["delayMs"] = "slow";
+    EXPECT_FALSE(sim.Configure(bad, &error));
+    bad = Json::Value();
+    bad["apis"]["X.Y"]["path"] = "x.cgi";
+    bad["apis"]["X.Y"]["handler"] = "nonsense";
+    EXPECT_FALSE(sim.Configure(bad, &error));
+    EXPECT_FALSE(sim.Configure(Json::Value("text"), &error));
+
+    Json::Value good;
+    good["apis"]["X.Custom"]["path"] = "custom.cgi";
+    good["apis"]["X.Custom"]["requestFormat"] = "JSON";
+    good["apis"]["KOVA.Demo.Delay"] = Json::Value();
+    good["accounts"][0]["account"] = "ops";
+    good["accounts"][0]["password"] = "pw";
+    good["delayMs"] = 5;
+    EXPECT_TRUE(sim.Configure(good, &error)) << error;
+    kovasim::LoopbackServer server;
+    sim.Install(server);
+    ASSERT_TRUE(server.Start());
+    KOVA_CRED cred;
+    cred.protocol = "http";
+    cred.host = "127.0.0.1";
+    cred.port = server.Port();
+    cred.remote_account = "ops";
+    cred.remote_passwd = "pw";
+    EXPECT_EQ("custom.cgi", KOVA::CredRequestUtil::GetWebAPIPath(&cred, "X.Custom"));
+    EXPECT_EQ("JSON", KOVA::CredRequestUtil::GetWebAPIRequestFormat(&cred, "X.Custom"));
+    EXPECT_EQ("", KOVA::CredRequestUtil::GetWebAPIPath(&cred, "KOVA.Demo.Delay"));
+    EXPECT_TRUE(KOVA::CredRequestUtil::Login(&cred, nullptr));
+}
+
+TEST_F(WebApiSimTest, ServesManySlowCallsAtOnce) {
+    kovasim::LoopbackServer::Options options;
+    options.threads = 256;
+    kovasim::LoopbackServer wide(options);
+    Sim().Install(wide);
+    ASSERT_TRUE(wide.Start());
+    const std::string url = wide.BaseUrl() + "/webapi/delay.cgi";
+    auto call = [&url] {
+        CredRequest request;
+        request.SetURL(url);
+        request.AddRawParam("api=KOVA.Demo.Delay&version=1&method=wait&ms=400");
+        return request.Process(true, 0);
+    };
+    ASSERT_TRUE(call());  // initialises libcurl on this thread first
+    const int clients = 96;
+    std::atomic<int> done{0};
+    std::vector<std::thread> threads;
+    auto start = std::chrono::steady_clock::now();
+    for (int i = 0; i < clients; ++i) {
+        threads.emplace_back([&] { done += call() ? 1 : 0; });
+    }
+    for (auto &t : threads) {
+        t.join();
+    }
+    double seconds =
+        std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+    EXPECT_EQ(clients, done.load());
+    EXPECT_GE(Sim().MaxConcurrent(), clients / 2);
+    EXPECT_LT(seconds, 0.4 * clients / 4);  // far from one call after another
+}
+
+}  // namespace
+}  // namespace kova_test
