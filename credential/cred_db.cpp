@@ -1,0 +1,398 @@
+// The credential database: opening it (file, mode, schema), the lock retry every statement
+// runs under, and the record-level operations on an open connection.
+#include <errno.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <string>
+
+#include "credential/cred_internal.h"
+#include "kovacredential/kovacred_db.h"
+#include "platform/kova_log.h"
+#include "platform/vlibc.h"
+
+namespace kova {
+namespace cred {
+namespace {
+
+constexpr const char kUnit[] = "cred_db";
+
+// Lines that the messages of this unit carry.
+constexpr int kLineChmodFailed = 165;
+constexpr int kLineOpenError = 169;
+constexpr int kLineOpenLog = 170;
+constexpr int kLinePragma = 174;
+constexpr int kLineCredSchema = 175;
+constexpr int kLineSessSchema = 176;
+constexpr int kLineAddArg = 193;
+constexpr int kLineAddExec = 214;
+constexpr int kLineGetArg = 235;
+constexpr int kLineGetExec = 242;
+constexpr int kLineGetListArg = 265;
+constexpr int kLineGetListExec = 297;
+constexpr int kLineRemoveArg = 312;
+constexpr int kLineRemoveExec = 319;
+constexpr int kLineUpdateArg = 337;
+constexpr int kLineUpdateExec = 356;
+constexpr int kLineUpdateCheckExec = 374;
+constexpr int kLineUpdateReadBack = 377;
+constexpr int kLineSessAddArg = 401;
+constexpr int kLineSessAddExec = 414;
+constexpr int kLineSessGetArg = 436;
+constexpr int kLineSessGetExec = 443;
+constexpr int kLineSessGetListArg = 467;
+constexpr int kLineSessGetListExec = 498;
+constexpr int kLineSessRemoveArg = 513;
+constexpr int kLineSessRemoveExec = 520;
+constexpr int kLineSessUpdateArg = 539;
+constexpr int kLineSessUpdateExec = 550;
+constexpr int kLineSessUpdateCheckExec = 560;
+constexpr int kLineSessUpdateReadBack = 563;
+
+constexpr const char kPragmaForeignKeys[] = "PRAGMA foreign_keys = ON;";
+constexpr const char kCredSchema[] =
+    "CREATE TABLE if not exists credentials (id INTEGER PRIMARY KEY ASC, \t\t\t\t\t\t ctime "
+    "INTEGER, mtime INTEGER, host TEXT, owner INTEGER, remote_account TEXT, \t\t\t\t\t\t "
+    "remote_passwd TEXT, port INTEGER, protocol TEXT, application TEXT, extra_info TEXT, pid "
+    "INTEGER);";
+constexpr const char kSessSchema[] =
+    "CREATE TABLE if not exists credential_sessions (id INTEGER PRIMARY KEY, \t\t\t\t\t\t mtime "
+    "INTEGER, access_token TEXT, csrf_token TEXT, extra_info TEXT, FOREIGN KEY (id) REFERENCES "
+    "credentials (id));";
+
+constexpr const char kCredInsert[] =
+    "INSERT INTO credentials \t\t(ctime, mtime, host, owner, remote_account, remote_passwd, port, "
+    "protocol, application, extra_info, pid) \t\tVALUES (%ld, %ld, '%q', %ld, '%q', '%q', '%ld', "
+    "'%q', '%q', '%q', %ld);";
+constexpr const char kCredSelectById[] = "SELECT * FROM credentials WHERE id=%ld;";
+constexpr const char kCredSelectAll[] = "SELECT * FROM credentials";
+constexpr const char kCredUpdate[] =
+    "UPDATE credentials SET \t\tmtime=%ld, host='%q', owner=%ld, remote_account='%q', "
+    "\t\tremote_passwd='%q', port='%ld', protocol='%q', application='%q', extra_info='%q' "
+    "\t\tWHERE id=%ld;";
+constexpr const char kCredUpdateCheck[] =
+    "SELECT * FROM credentials WHERE \t\tid=%ld AND mtime=%ld AND host='%q' AND owner=%ld AND "
+    "remote_account='%q' \t\tAND remote_passwd='%q' AND port='%ld' AND protocol='%q' AND "
+    "application='%q' AND extra_info='%q';";
+constexpr const char kCredDelete[] = "DELETE FROM credentials WHERE id=%ld;";
+
+constexpr const char kSessInsert[] =
+    "INSERT INTO credential_sessions (mtime, access_token, csrf_token, extra_info) \t\t\tVALUES "
+    "(%ld, '%q', '%q', '%q');";
+constexpr const char kSessSelectById[] = "SELECT * FROM credential_sessions WHERE id=%ld;";
+constexpr const char kSessSelectAll[] = "SELECT * FROM credential_sessions";
+constexpr const char kSessReplace[] =
+    "REPLACE INTO credential_sessions (id, mtime, access_token, csrf_token, extra_info) "
+    "\t\t\tVALUES (%ld, %ld, '%q', '%q', '%q');";
+constexpr const char kSessUpdateCheck[] =
+    "SELECT * FROM credential_sessions WHERE id=%ld AND access_token='%q' AND csrf_token='%q' "
+    "AND extra_info='%q';";
+constexpr const char kSessDelete[] = "DELETE FROM credential_sessions WHERE id=%ld;";
+
+constexpr const char kLockedMessage[] = "database is locked";
+
+bool gRandSeeded = false;
+
+long Now() {
+    return static_cast<long>(time(nullptr));
+}
+
+// The list statement: the base text, the condition and ordering parts (each left as an
+// empty "%q" when not given), and the end.
+SqlText FormatListStatement(const char *base, const char *whereFormat, const char *szCondition,
+                            const char *szOrderBy, int blAscending) {
+    const bool hasCondition = szCondition != nullptr && *szCondition != '\0';
+    const bool hasOrder = szOrderBy != nullptr && *szOrderBy != '\0';
+    std::string format;
+    try {
+        format = base;
+        format += hasCondition ? whereFormat : "%q";
+        format += hasOrder ? (blAscending ? " ORDER BY %q ASC" : " ORDER BY %q DESC") : "%q";
+        format += ";";
+    } catch (const std::bad_alloc &) {
+        return nullptr;
+    }
+    return SqlText(sqlite3_mprintf(format.c_str(), hasCondition ? szCondition : "",
+                                   hasOrder ? szOrderBy : ""));
+}
+
+}  // namespace
+
+std::string DatabasePath() {
+    const char *path = getenv("kovacredential_db");
+    return (path != nullptr && *path != '\0') ? path : kDefaultDatabasePath;
+}
+
+uint32_t LockBackoffMicros(int randomValue) {
+    const int32_t shifted = static_cast<int32_t>(static_cast<uint32_t>(randomValue) << 5);
+    const int32_t sum = shifted % 1000000 + 100000;
+    return static_cast<uint32_t>(sum) <= 999999u ? static_cast<uint32_t>(sum) : 999999u;
+}
+
+ExecResult ExecWithRetry(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg,
+                         SqlText *errorMessage) {
+    int attemptsLeft = kLockAttempts;
+    for (;;) {
+        char *raw = nullptr;
+        if (sqlite3_exec(db, sql, callback, arg, &raw) == SQLITE_OK) {
+            sqlite3_free(raw);
+            return ExecResult::kOk;
+        }
+        SqlText message(raw);
+        if (!message) {
+            return ExecResult::kFailedSilently;
+        }
+        if (strstr(message.get(), kLockedMessage) == nullptr || --attemptsLeft == 0) {
+            *errorMessage = std::move(message);
+            return ExecResult::kFailed;
+        }
+        usleep(LockBackoffMicros(rand()));
+    }
+}
+
+bool ExecLogged(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg,
+                const char *unit, int line) {
+    SqlText message;
+    switch (ExecWithRetry(db, sql, callback, arg, &message)) {
+        case ExecResult::kOk:
+            return true;
+        case ExecResult::kFailed:
+            Log("%s:%d Exec sql:[%s] error: %s\n", unit, line, sql, message.get());
+            return false;
+        case ExecResult::kFailedSilently:
+            break;
+    }
+    return false;
+}
+
+}  // namespace cred
+}  // namespace kova
+
+using kova::ArgInvalid;
+using namespace kova::cred;
+
+void KOVACredRandInit(void) {
+    if (!gRandSeeded) {
+        srand(static_cast<unsigned>(time(nullptr) + getpid()));
+        gRandSeeded = true;
+    }
+}
+
+sqlite3 *KOVACredDBInit(void) {
+    KOVACredRandInit();
+    std::string path;
+    try {
+        path = DatabasePath();
+    } catch (const std::bad_alloc &) {
+        VLIBCErrSetEx(KOVA_ERR_OUT_OF_MEMORY, kUnit, kLineOpenError);
+        return nullptr;
+    }
+    // A failed touch shows up below: chmod and the open fail on a missing file.
+    if (access(path.c_str(), F_OK) != 0) {
+        VLIBCFileTouch(path.c_str());
+    }
+    if (chmod(path.c_str(), 0600) != 0) {
+        kova::Log("%s:%d %s chmod failed. errno=[0x%04X]", kUnit, kLineChmodFailed, path.c_str(),
+                  errno);
+    }
+    sqlite3 *raw = nullptr;
+    if (sqlite3_open(path.c_str(), &raw) != SQLITE_OK) {
+        VLIBCErrSetEx(KOVA_ERR_DB_OPEN, kUnit, kLineOpenError);
+        kova::Log("%s:%d Can't open database: %s\n", kUnit, kLineOpenLog, sqlite3_errmsg(raw));
+        sqlite3_close(raw);
+        return nullptr;
+    }
+    Database db(raw);
+    // SQLite reads the file only at the first statement, so a file that is not a database
+    // fails here rather than at the open.
+    if (!ExecLogged(db.get(), kPragmaForeignKeys, nullptr, nullptr, kUnit, kLinePragma) ||
+        !ExecLogged(db.get(), kCredSchema, nullptr, nullptr, kUnit, kLineCredSchema) ||
+        !ExecLogged(db.get(), kSessSchema, nullptr, nullptr, kUnit, kLineSessSchema)) {
+        return nullptr;
+    }
+    return db.release();
+}
+
+int KOVACredDBRecordAdd(sqlite3 *db, const KOVA_CRED *pCred, int *pId) {
+    if (db == nullptr) {
+        return ArgInvalid(kUnit, kLineAddArg, "__null != db");
+    }
+    if (pCred == nullptr) {
+        return ArgInvalid(kUnit, kLineAddArg, "NULL != pCred");
+    }
+    const long now = Now();
+    SqlText sql(sqlite3_mprintf(kCredInsert, now, now, pCred->host.c_str(),
+                                static_cast<long>(pCred->owner), pCred->remote_account.c_str(),
+                                pCred->remote_passwd.c_str(), static_cast<long>(pCred->port),
+                                pCred->protocol.c_str(), pCred->application.c_str(),
+                                pCred->extra_info.c_str(), static_cast<long>(getpid())));
+    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineAddExec)) {
+        return -1;
+    }
+    if (pId != nullptr) {
+        *pId = static_cast<int>(sqlite3_last_insert_rowid(db));
+    }
+    return 0;
+}
+
+int KOVACredDBRecordGet(sqlite3 *db, long id, KOVA_CRED *pCred) {
+    if (db == nullptr) {
+        return ArgInvalid(kUnit, kLineGetArg, "__null != db");
+    }
+    if (pCred == nullptr) {
+        return ArgInvalid(kUnit, kLineGetArg, "NULL != pCred");
+    }
+    SqlText sql(sqlite3_mprintf(kCredSelectById, id));
+    if (!sql || !ExecLogged(db, sql.get(), CredRowFirst, pCred, kUnit, kLineGetExec)) {
+        return -1;
+    }
+    return pCred->filled != 0 ? 1 : 0;
+}
+
+KOVA_CRED *KOVACredDBRecordGetList(sqlite3 *db, const char *szCondition, const char *szOrderBy,
+                                   int blAscending) {
+    if (db == nullptr) {
+        ArgInvalid(kUnit, kLineGetListArg, "__null != db");
+        return nullptr;
+    }
+    SqlText sql =
+        FormatListStatement(kCredSelectAll, " WHERE %q", szCondition, szOrderBy, blAscending);
+    KOVA_CRED *head = nullptr;
+    if (sql) {
+        ExecLogged(db, sql.get(), CredRowAppend, &head, kUnit, kLineGetListExec);
+    }
+    return head;
+}
+
+int KOVACredDBRecordUpdate(sqlite3 *db, long id, const KOVA_CRED *pCred) {
+    if (db == nullptr) {
+        return ArgInvalid(kUnit, kLineUpdateArg, "__null != db");
+    }
+    if (pCred == nullptr) {
+        return ArgInvalid(kUnit, kLineUpdateArg, "NULL != pCred");
+    }
+    const long now = Now();
+    SqlText sql(sqlite3_mprintf(
+        kCredUpdate, now, pCred->host.c_str(), static_cast<long>(pCred->owner),
+        pCred->remote_account.c_str(), pCred->remote_passwd.c_str(), static_cast<long>(pCred->port),
+        pCred->protocol.c_str(), pCred->application.c_str(), pCred->extra_info.c_str(), id));
+    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineUpdateExec)) {
+        return -1;
+    }
+    // The write is verified by finding exactly what was written, mtime included.
+    SqlText check(sqlite3_mprintf(
+        kCredUpdateCheck, id, now, pCred->host.c_str(), static_cast<long>(pCred->owner),
+        pCred->remote_account.c_str(), pCred->remote_passwd.c_str(), static_cast<long>(pCred->port),
+        pCred->protocol.c_str(), pCred->application.c_str(), pCred->extra_info.c_str()));
+    if (!check) {
+        return -1;
+    }
+    KOVA_CRED scratch;
+    // A check that could not run is logged; only a check that ran and found nothing fails.
+    if (ExecLogged(db, check.get(), CredRowFirst, &scratch, kUnit, kLineUpdateCheckExec) &&
+        scratch.filled == 0) {
+        VLIBCErrSetEx(KOVA_ERR_DB_READBACK, kUnit, kLineUpdateReadBack);
+        return -1;
+    }
+    return 0;
+}
+
+int KOVACredDBRecordRemove(sqlite3 *db, long id) {
+    if (db == nullptr) {
+        return ArgInvalid(kUnit, kLineRemoveArg, "__null != db");
+    }
+    // With foreign keys on, a credential that still has a session cannot be deleted.
+    KOVACredSessDBRecordRemove(db, id);
+    SqlText sql(sqlite3_mprintf(kCredDelete, id));
+    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineRemoveExec)) {
+        return -1;
+    }
+    return 0;
+}
+
+int KOVACredSessDBRecordAdd(sqlite3 *db, const KOVA_CRED_SESS *pSess, int *pId) {
+    if (db == nullptr) {
+        return ArgInvalid(kUnit, kLineSessAddArg, "__null != db");
+    }
+    if (pSess == nullptr) {
+        return ArgInvalid(kUnit, kLineSessAddArg, "NULL != pSess");
+    }
+    SqlText sql(sqlite3_mprintf(kSessInsert, Now(), pSess->access_token.c_str(),
+                                pSess->csrf_token.c_str(), pSess->extra_info.c_str()));
+    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineSessAddExec)) {
+        return -1;
+    }
+    if (pId != nullptr) {
+        *pId = static_cast<int>(sqlite3_last_insert_rowid(db));
+    }
+    return 0;
+}
+
+int KOVACredSessDBRecordGet(sqlite3 *db, long id, KOVA_CRED_SESS *pSess) {
+    if (db == nullptr) {
+        return ArgInvalid(kUnit, kLineSessGetArg, "__null != db");
+    }
+    if (pSess == nullptr) {
+        return ArgInvalid(kUnit, kLineSessGetArg, "NULL != pSess");
+    }
+    SqlText sql(sqlite3_mprintf(kSessSelectById, id));
+    if (!sql || !ExecLogged(db, sql.get(), CredSessRowFirst, pSess, kUnit, kLineSessGetExec)) {
+        return -1;
+    }
+    return pSess->filled != 0 ? 1 : 0;
+}
+
+KOVA_CRED_SESS *KOVACredSessDBRecordGetList(sqlite3 *db, const char *szCondition,
+                                            const char *szOrderBy, int blAscending) {
+    if (db == nullptr) {
+        ArgInvalid(kUnit, kLineSessGetListArg, "__null != db");
+        return nullptr;
+    }
+    SqlText sql =
+        FormatListStatement(kSessSelectAll, " WHERE %q ", szCondition, szOrderBy, blAscending);
+    KOVA_CRED_SESS *head = nullptr;
+    if (sql) {
+        ExecLogged(db, sql.get(), CredSessRowAppend, &head, kUnit, kLineSessGetListExec);
+    }
+    return head;
+}
+
+int KOVACredSessDBRecordUpdate(sqlite3 *db, long id, const KOVA_CRED_SESS *pSess) {
+    if (db == nullptr) {
+        return ArgInvalid(kUnit, kLineSessUpdateArg, "__null != db");
+    }
+    if (pSess == nullptr) {
+        return ArgInvalid(kUnit, kLineSessUpdateArg, "NULL != pSess");
+    }
+    SqlText sql(sqlite3_mprintf(kSessReplace, id, Now(), pSess->access_token.c_str(),
+                                pSess->csrf_token.c_str(), pSess->extra_info.c_str()));
+    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineSessUpdateExec)) {
+        return -1;
+    }
+    SqlText check(sqlite3_mprintf(kSessUpdateCheck, id, pSess->access_token.c_str(),
+                                  pSess->csrf_token.c_str(), pSess->extra_info.c_str()));
+    if (!check) {
+        return -1;
+    }
+    KOVA_CRED_SESS scratch;
+    if (ExecLogged(db, check.get(), CredSessRowFirst, &scratch, kUnit, kLineSessUpdateCheckExec) &&
+        scratch.filled == 0) {
+        VLIBCErrSetEx(KOVA_ERR_DB_READBACK, kUnit, kLineSessUpdateReadBack);
+        return -1;
+    }
+    return 0;
+}
+
+int KOVACredSessDBRecordRemove(sqlite3 *db, long id) {
+    if (db == nullptr) {
+        return ArgInvalid(kUnit, kLineSessRemoveArg, "__null != db");
+    }
+    SqlText sql(sqlite3_mprintf(kSessDelete, id));
+    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineSessRemoveExec)) {
+        return -1;
+    }
+    return 0;
+}

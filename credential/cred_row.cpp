@@ -1,0 +1,147 @@
+// Row callbacks of the credential database: result rows of sqlite3_exec become records.
+// SQLite calls them from C, so no exception may pass through them; each returns 0 so that a
+// query is never aborted by a record it could not build.
+#include <stdlib.h>
+#include <string.h>
+
+#include <new>
+#include <string>
+
+#include "credential/cred_internal.h"
+#include "kovacredential/kovacred_db.h"
+
+namespace kova {
+namespace cred {
+namespace {
+
+template <typename Record>
+struct IntColumn {
+    const char *name;
+    int32_t Record::*member;
+};
+
+template <typename Record>
+struct StringColumn {
+    const char *name;
+    std::string Record::*member;
+};
+
+const IntColumn<KOVA_CRED> kCredIntColumns[] = {
+    {"id", &KOVA_CRED::id},       {"ctime", &KOVA_CRED::ctime}, {"mtime", &KOVA_CRED::mtime},
+    {"owner", &KOVA_CRED::owner}, {"port", &KOVA_CRED::port},
+};
+const StringColumn<KOVA_CRED> kCredStringColumns[] = {
+    {"host", &KOVA_CRED::host},
+    {"remote_account", &KOVA_CRED::remote_account},
+    {"remote_passwd", &KOVA_CRED::remote_passwd},
+    {"protocol", &KOVA_CRED::protocol},
+    {"application", &KOVA_CRED::application},
+    {"extra_info", &KOVA_CRED::extra_info},
+};
+const IntColumn<KOVA_CRED_SESS> kSessIntColumns[] = {
+    {"id", &KOVA_CRED_SESS::id},
+};
+const StringColumn<KOVA_CRED_SESS> kSessStringColumns[] = {
+    {"access_token", &KOVA_CRED_SESS::access_token},
+    {"csrf_token", &KOVA_CRED_SESS::csrf_token},
+    {"extra_info", &KOVA_CRED_SESS::extra_info},
+};
+
+// Integer columns are always written by the database layer; a NULL one reads as 0.
+int32_t ColumnInt(const char *text) {
+    return text != nullptr ? static_cast<int32_t>(strtol(text, nullptr, 10)) : 0;
+}
+
+template <typename Record, size_t NInt, size_t NString>
+void RowToRecord(Record *rec, int nCol, char **azVal, char **azCol,
+                 const IntColumn<Record> (&intColumns)[NInt],
+                 const StringColumn<Record> (&stringColumns)[NString]) {
+    for (int i = 0; i < nCol; ++i) {
+        const char *name = azCol[i];
+        bool matched = false;
+        for (const auto &column : intColumns) {
+            if (strcmp(name, column.name) == 0) {
+                rec->*column.member = ColumnInt(azVal[i]);
+                matched = true;
+                break;
+            }
+        }
+        if (matched) {
+            continue;
+        }
+        for (const auto &column : stringColumns) {
+            if (strcmp(name, column.name) == 0) {
+                (rec->*column.member).assign(azVal[i] != nullptr ? azVal[i] : "");
+                break;
+            }
+        }
+    }
+}
+
+template <typename Record, typename CopyFn>
+int RowFirst(void *pArg, int nCol, char **azVal, char **azCol, CopyFn copy) {
+    auto *rec = static_cast<Record *>(pArg);
+    if (rec == nullptr || rec->filled == 1) {
+        return 0;
+    }
+    rec->filled = 1;
+    try {
+        copy(rec, nCol, azVal, azCol);
+    } catch (const std::bad_alloc &) {
+        // The record keeps what was copied before memory ran out.
+    }
+    return 0;
+}
+
+template <typename Record, typename CopyFn>
+int RowAppend(void *pArg, int nCol, char **azVal, char **azCol, CopyFn copy) {
+    auto **head = static_cast<Record **>(pArg);
+    if (head == nullptr) {
+        return 0;
+    }
+    Record *node = new (std::nothrow) Record();
+    if (node == nullptr) {
+        return 0;
+    }
+    node->filled = 1;
+    try {
+        copy(node, nCol, azVal, azCol);
+    } catch (const std::bad_alloc &) {
+        delete node;
+        return 0;
+    }
+    node->next = *head;
+    *head = node;
+    return 0;
+}
+
+}  // namespace
+
+void CredRowToRecord(KOVA_CRED *pCred, int nCol, char **azVal, char **azCol) {
+    RowToRecord(pCred, nCol, azVal, azCol, kCredIntColumns, kCredStringColumns);
+}
+
+void CredSessRowToRecord(KOVA_CRED_SESS *pSess, int nCol, char **azVal, char **azCol) {
+    RowToRecord(pSess, nCol, azVal, azCol, kSessIntColumns, kSessStringColumns);
+}
+
+}  // namespace cred
+}  // namespace kova
+
+int CredRowFirst(void *pArg, int nCol, char **azVal, char **azCol) {
+    return kova::cred::RowFirst<KOVA_CRED>(pArg, nCol, azVal, azCol, kova::cred::CredRowToRecord);
+}
+
+int CredRowAppend(void *pArg, int nCol, char **azVal, char **azCol) {
+    return kova::cred::RowAppend<KOVA_CRED>(pArg, nCol, azVal, azCol, kova::cred::CredRowToRecord);
+}
+
+int CredSessRowFirst(void *pArg, int nCol, char **azVal, char **azCol) {
+    return kova::cred::RowFirst<KOVA_CRED_SESS>(pArg, nCol, azVal, azCol,
+                                                kova::cred::CredSessRowToRecord);
+}
+
+int CredSessRowAppend(void *pArg, int nCol, char **azVal, char **azCol) {
+    return kova::cred::RowAppend<KOVA_CRED_SESS>(pArg, nCol, azVal, azCol,
+                                                 kova::cred::CredSessRowToRecord);
+}

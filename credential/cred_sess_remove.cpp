@@ -1,0 +1,26 @@
+// Removing the session of a credential; the credential stays.
+#include "credential/cred_internal.h"
+#include "kovacredential/kovacred.h"
+#include "platform/kova_log.h"
+
+namespace {
+
+constexpr const char kUnit[] = "cred_sess_remove";
+constexpr int kLineOpen = 14;
+constexpr int kLineRemove = 18;
+
+}  // namespace
+
+int KOVACredSessRemoveByID(long id) {
+    KOVACredRandInit();
+    kova::cred::Database db = kova::cred::OpenDatabase();
+    if (!db) {
+        kova::LogInnerFailure(kUnit, kLineOpen, "Init sqlite failed. ");
+        return -1;
+    }
+    if (KOVACredSessDBRecordRemove(db.get(), id) != 0) {
+        kova::LogInnerFailure(kUnit, kLineRemove, "Remove Cred record failed. id:[%ld]", id);
+        return -1;
+    }
+    return 0;
+}
