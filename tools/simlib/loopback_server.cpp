@@ -12,6 +12,8 @@
 #include <openssl/pem.h>
 #include <openssl/x509.h>
 
+#include <chrono>
+
 namespace kovasim {
 
 namespace {
@@ -206,6 +208,11 @@ bool LoopbackServer::Start() {
     // The socket is bound and listening already, so clients may connect at once; the accept
     // loop picks their connections up from the backlog.
     thread_ = std::thread([this] { server_->listen_after_bind(); });
+    // cpp-httplib's stop() does nothing until the accept loop has started, so a Stop that
+    // came earlier would leave the loop running and hang in join.
+    for (int i = 0; i < 5000 && !server_->is_running(); ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
     return true;
 }
 
