@@ -58,7 +58,14 @@ class BatchCommandTest : public ::testing::Test {
     }
 
     kova_test::TempDir dir_;
-    kovasim::LoopbackServer server_;
+    // More workers than calls: a worker stays with its keep-alive connection while the
+    // manager's run holds it open.
+    static kovasim::LoopbackServer::Options ServerOptions() {
+        kovasim::LoopbackServer::Options options;
+        options.threads = 40;
+        return options;
+    }
+    kovasim::LoopbackServer server_{ServerOptions()};
     std::string out_;
     std::string err_;
 };

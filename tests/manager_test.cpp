@@ -278,7 +278,10 @@ TEST_F(ManagerTest, SilentServerEndsRunThroughTimeout) {
     longer->SetResponseTimeout(2);
     ASSERT_EQ(0, mgr.AddCredRequest(quick));
     ASSERT_EQ(1, mgr.AddCredRequest(longer));
-    ASSERT_EQ(2, mgr.AddCredRequest(NewRequest(Url("/hello"))));
+    // A request without a time-out of its own counts as 120 s, so this one gets one too.
+    CredRequest *answered = NewRequest(Url("/hello"));
+    answered->SetResponseTimeout(1);
+    ASSERT_EQ(2, mgr.AddCredRequest(answered));
 
     EXPECT_FALSE(mgr.Run());
     EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, mgr.GetError());
