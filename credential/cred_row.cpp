@@ -14,15 +14,27 @@ namespace kova {
 namespace cred {
 namespace {
 
+// A column name with its length, so that a row's names are told apart mostly without a call.
+struct ColumnName {
+    template <size_t N>
+    constexpr ColumnName(const char (&text)[N]) : name(text), length(N - 1) {}
+    const char *name;
+    size_t length;
+
+    bool Is(const char *other, size_t otherLength) const {
+        return length == otherLength && name[0] == other[0] && memcmp(name, other, length) == 0;
+    }
+};
+
 template <typename Record>
 struct IntColumn {
-    const char *name;
+    ColumnName name;
     int32_t Record::*member;
 };
 
 template <typename Record>
 struct StringColumn {
-    const char *name;
+    ColumnName name;
     std::string Record::*member;
 };
 
@@ -58,9 +70,10 @@ void RowToRecord(Record *rec, int nCol, char **azVal, char **azCol,
                  const StringColumn<Record> (&stringColumns)[NString]) {
     for (int i = 0; i < nCol; ++i) {
         const char *name = azCol[i];
+        const size_t length = strlen(name);
         bool matched = false;
         for (const auto &column : intColumns) {
-            if (strcmp(name, column.name) == 0) {
+            if (column.name.Is(name, length)) {
                 rec->*column.member = ColumnInt(azVal[i]);
                 matched = true;
                 break;
@@ -70,7 +83,7 @@ void RowToRecord(Record *rec, int nCol, char **azVal, char **azCol,
             continue;
         }
         for (const auto &column : stringColumns) {
-            if (strcmp(name, column.name) == 0) {
+            if (column.name.Is(name, length)) {
                 (rec->*column.member).assign(azVal[i] != nullptr ? azVal[i] : "");
                 break;
             }

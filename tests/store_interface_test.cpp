@@ -1,0 +1,284 @@
+// The credential interface: every operation opens the database, does one thing and closes it.
+#include <unistd.h>
+
+#include <functional>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "store_fixture.h"
+
+namespace {
+
+using namespace store_test;
+
+class InterfaceTest : public StoreTest {
+  protected:
+    int Add(const std::string &host, const std::string &application = "app") {
+        CredPtr cred = MakeCred(host, application);
+        EXPECT_EQ(KOVACredAdd(cred.get()), 0) << kova_test::LogDump();
+        return cred->id;
+    }
+
+    static std::vector<int> Ids(KOVA_CRED *head) {
+        std::vector<int> ids;
+        for (KOVA_CRED *p = head; p != nullptr; p = KOVACredNext(p)) {
+            ids.push_back(p->id);
+        }
+        return ids;
+    }
+};
+
+TEST_F(InterfaceTest, AddStoresTheRowAndTheNewId) {
+    CredPtr cred = MakeCred("nas.example", "backup");
+    EXPECT_EQ(KOVACredAdd(cred.get()), 0);
+    EXPECT_EQ(cred->id, 1);
+    EXPECT_EQ(cred->ctime, 0);  // the row holds the time, the record does not
+    EXPECT_EQ(cred->mtime, 0);
+
+    CredPtr loaded = NewCred();
+    EXPECT_EQ(KOVACredGetByID(1, loaded.get()), 0);
+    EXPECT_EQ(loaded->id, 1);
+    EXPECT_EQ(loaded->filled, 1);
+    EXPECT_EQ(loaded->host, "nas.example");
+    EXPECT_EQ(loaded->remote_passwd, "pw-nas.example");
+    EXPECT_EQ(loaded->application, "backup");
+    EXPECT_GT(loaded->ctime, 0);
+    EXPECT_EQ(loaded->ctime, loaded->mtime);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+}
+
+TEST_F(InterfaceTest, SaveInsertsThenUpdates) {
+    CredPtr cred = MakeCred("first");
+    EXPECT_EQ(KOVACredSave(cred.get()), 0);
+    ASSERT_EQ(cred->id, 1);
+    // Age the row so that the update's new mtime is visible.
+    ASSERT_TRUE(Query("UPDATE credentials SET ctime=100, mtime=100;").empty());
+    cred->host = "second";
+    cred->port = 443;
+    const long before = time(nullptr);
+    EXPECT_EQ(KOVACredSave(cred.get()), 0) << kova_test::LogDump();
+    EXPECT_EQ(cred->id, 1);
+    auto rows = Query("SELECT id, host, port, ctime, mtime FROM credentials;");
+    ASSERT_EQ(rows.size(), 1u);
+    EXPECT_EQ(rows[0][1], "second");
+    EXPECT_EQ(rows[0][2], "443");
+    EXPECT_EQ(rows[0][3], "100");
+    EXPECT_GE(std::stol(rows[0][4]), before);
+}
+
+TEST_F(InterfaceTest, SetOfAMissingIdFailsWithReadBackError) {
+    CredPtr cred = MakeCred("h");
+    EXPECT_EQ(KOVACredSetByID(42, cred.get()), -1);
+    EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_READBACK, "cred_db", 377));
+    EXPECT_EQ(kova_test::LogCount("cred_set:19 Set Cred record failed. id:[42][0x0B00 "
+                                  "cred_db:377]"),
+              1u)
+        << kova_test::LogDump();
+
+    kova_test::ClearLog();
+    cred->id = 42;
+    EXPECT_EQ(KOVACredSave(cred.get()), -1);
+    EXPECT_EQ(
+        kova_test::LogRecords(),
+        (std::vector<std::string>{"cred_set:19 Set Cred record failed. id:[42][0x0B00 cred_db:377]",
+                                  "cred_save:21 Set task failed. [42] [0x0B00 cred_db:377]"}));
+    EXPECT_TRUE(Query("SELECT * FROM credentials;").empty());
+}
+
+TEST_F(InterfaceTest, GetByIdOfAMissingRowSucceedsWithoutFilling) {
+    Add("h");
+    CredPtr cred = NewCred();
+    EXPECT_EQ(KOVACredGetByID(5, cred.get()), 0);
+    EXPECT_EQ(cred->id, -1);
+    EXPECT_EQ(cred->filled, 0);
+    EXPECT_TRUE(kova_test::LogRecords().empty());
+}
+
+TEST_F(InterfaceTest, LoadChecksClearsAndReads) {
+    int id = Add("loaded");
+    CredPtr cred = NewCred();
+    EXPECT_EQ(KOVACredLoad(-2, cred.get()), -1);
+    EXPECT_TRUE(ArgErrorReported("cred_load", 10, "-1 <= id"));
+    kova_test::ClearLog();
+    EXPECT_EQ(KOVACredLoad(-2, nullptr), -1);  // the id is checked first
+    EXPECT_TRUE(ArgErrorReported("cred_load", 10, "-1 <= id"));
+    kova_test::ClearLog();
+    EXPECT_EQ(KOVACredLoad(1, nullptr), -1);
+    EXPECT_TRUE(ArgErrorReported("cred_load", 10, "NULL != pCred"));
+
+    EXPECT_EQ(KOVACredLoad(id, cred.get()), 0);
+    EXPECT_EQ(cred->host, "loaded");
+    // A filled record is not overwritten by another load.
+    int other = Add("other");
+    EXPECT_EQ(KOVACredLoad(other, cred.get()), 0);
+    EXPECT_EQ(cred->host, "loaded");
+
+    // id -1 clears the record and frees its chain.
+    cred->next = KOVACredAlloc();
+    cred->next->next = KOVACredAlloc();
+    EXPECT_EQ(KOVACredLoad(-1, cred.get()), 0);
+    EXPECT_EQ(cred->next, nullptr);
+    EXPECT_EQ(cred->id, -1);
+    EXPECT_EQ(cred->filled, 0);
+    EXPECT_TRUE(cred->host.empty());
+    EXPECT_EQ(KOVACredLoad(other, cred.get()), 0);
+    EXPECT_EQ(cred->host, "other");
+
+    // A load of a missing id leaves members the row would have set.
+    CredPtr partial = NewCred();
+    partial->host = "mine";
+    EXPECT_EQ(KOVACredLoad(99, partial.get()), 0);
+    EXPECT_EQ(partial->host, "mine");
+}
+
+TEST_F(InterfaceTest, ListIsNewestFirstAndFiltered) {
+    for (int i = 1; i <= 5; ++i) {
+        Add("h" + std::to_string(i), i % 2 ? "odd" : "even");
+    }
+    KOVA_CRED *list = nullptr;
+    EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 5);
+    EXPECT_EQ(Ids(list), (std::vector<int>{5, 4, 3, 2, 1}));
+    EXPECT_EQ(list->host, "h5");
+    KOVACredListFree(&list);
+    EXPECT_EQ(list, nullptr);
+
+    char odd[] = "odd";
+    EXPECT_EQ(KOVACredListGet(&list, KOVACredKeepByApplication, odd), 3);
+    EXPECT_EQ(Ids(list), (std::vector<int>{5, 3, 1}));
+    KOVACredListFree(&list);
+
+    // A filter that drops everything leaves the caller's head as it was.
+    KOVA_CRED sentinel;
+    list = &sentinel;
+    auto none = [](KOVA_CRED *, void *) -> int { return 0; };
+    EXPECT_EQ(KOVACredListGet(&list, none, nullptr), 0);
+    EXPECT_EQ(list, &sentinel);
+
+    // The filter sees each record with the caller's argument.
+    struct Seen {
+        std::vector<int> ids;
+    } seen;
+    auto record = [](KOVA_CRED *cred, void *arg) -> int {
+        static_cast<Seen *>(arg)->ids.push_back(cred->id);
+        return cred->id == 2;
+    };
+    list = nullptr;
+    EXPECT_EQ(KOVACredListGet(&list, record, &seen), 1);
+    EXPECT_EQ(seen.ids, (std::vector<int>{5, 4, 3, 2, 1}));
+    EXPECT_EQ(Ids(list), (std::vector<int>{2}));
+    EXPECT_EQ(KOVACredNext(list), nullptr);
+    KOVACredListFree(&list);
+
+    EXPECT_EQ(KOVACredListGet(nullptr, nullptr, nullptr), -1);
+    EXPECT_TRUE(ArgErrorReported("cred_list", 14, "__null != pCredList"));
+}
+
+TEST_F(InterfaceTest, ListOfAnEmptyTableIsZero) {
+    KOVA_CRED *list = nullptr;
+    EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 0);
+    EXPECT_EQ(list, nullptr);
+}
+
+TEST_F(InterfaceTest, LookUpByApplicationFindsTheNewest) {
+    for (int i = 1; i <= 9; ++i) {
+        Add("h" + std::to_string(i), (i == 4 || i == 9) ? "backup" : "app" + std::to_string(i));
+    }
+    EXPECT_EQ(KOVACredIDGetByApplication("backup"), 9);
+    KOVACredRemoveByID(9);
+    EXPECT_EQ(KOVACredIDGetByApplication("backup"), 4);
+    EXPECT_EQ(KOVACredIDGetByApplication("Backup"), -1);  // exact, case-sensitive
+    EXPECT_EQ(KOVACredIDGetByApplication("backu"), -1);
+    EXPECT_EQ(KOVACredIDGetByApplication(""), -1);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+    EXPECT_EQ(KOVACredIDGetByApplication(nullptr), -1);
+    EXPECT_TRUE(ArgErrorReported("cred_get", 44, "__null != szApplication"));
+
+    CredPtr cred = MakeCred("h", "tag");
+    char tag[] = "tag";
+    char other[] = "tag ";
+    EXPECT_EQ(KOVACredKeepByApplication(cred.get(), tag), 1);
+    EXPECT_EQ(KOVACredKeepByApplication(cred.get(), other), 0);
+}
+
+TEST_F(InterfaceTest, LookUpInAnEmptyTable) {
+    EXPECT_EQ(KOVACredIDGetByApplication("x"), -1);
+}
+
+TEST_F(InterfaceTest, RemoveDeletesCredentialAndSession) {
+    int keep = Add("keep");
+    int gone = Add("gone");
+    SessPtr sess = MakeSess(gone, "sid", "tok");
+    ASSERT_EQ(KOVACredSessSave(sess.get()), 0) << kova_test::LogDump();
+    EXPECT_EQ(KOVACredRemoveByID(gone), 0) << kova_test::LogDump();
+    EXPECT_EQ(Query("SELECT id FROM credentials;"), (std::vector<Row>{{std::to_string(keep)}}));
+    EXPECT_TRUE(Query("SELECT * FROM credential_sessions;").empty());
+    SessPtr after = NewSess();
+    EXPECT_EQ(KOVACredSessGetByID(gone, after.get()), 0);
+    EXPECT_EQ(after->id, -1);
+    EXPECT_EQ(KOVACredRemoveByID(1234), 0);
+    EXPECT_EQ(KOVACredRemoveByID(-5), 0);
+}
+
+TEST_F(InterfaceTest, ArgumentErrorsOfTheInterface) {
+    struct Case {
+        int (*call)();
+        std::string file;
+        int line;
+        std::string check;
+    };
+    const Case cases[] = {
+        {[] { return KOVACredGetByID(1, nullptr); }, "cred_get", 10, "__null != pCred"},
+        {[] { return KOVACredSetByID(1, nullptr); }, "cred_set", 10, "__null != pCred"},
+        {[] { return KOVACredAdd(nullptr); }, "cred_add", 11, "__null != pCred"},
+        {[] { return KOVACredSave(nullptr); }, "cred_save", 11, "__null != pCred"},
+    };
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.file);
+        kova_test::ClearLog();
+        EXPECT_EQ(c.call(), -1);
+        EXPECT_TRUE(ArgErrorReported(c.file, c.line, c.check));
+    }
+    // None of them touched the database.
+    EXPECT_NE(access(DbPath().c_str(), F_OK), 0);
+}
+
+TEST_F(InterfaceTest, OpenFailuresNameTheInnerError) {
+    const std::string blocked = db_.dir().File("file");
+    FILE *f = fopen(blocked.c_str(), "w");
+    ASSERT_NE(f, nullptr);
+    fclose(f);
+    setenv("kovacredential_db", (blocked + "/db.sqlite").c_str(), 1);
+    CredPtr cred = MakeCred("h");
+    struct Case {
+        std::function<int()> call;
+        std::string record;
+    };
+    const std::vector<Case> cases = {
+        {[&] { return KOVACredGetByID(1, cred.get()); }, "cred_get:15 Init sqlite failed. "},
+        {[&] { return KOVACredSetByID(1, cred.get()); }, "cred_set:15 Init sqlite failed. "},
+        {[&] { return KOVACredAdd(cred.get()); }, "cred_add:16 Init sqlite failed. "},
+        {[&] {
+             KOVA_CRED *list = nullptr;
+             return KOVACredListGet(&list, nullptr, nullptr);
+         },
+         "cred_list:19 Init sqlite failed. "},
+        {[&] { return KOVACredRemoveByID(1); }, "cred_remove:14 Init sqlite failed. "},
+        {[&] { return KOVACredLoad(3, cred.get()); }, "cred_load:19 get task failed. [3] "},
+        {[&] {
+             cred->id = -1;
+             return KOVACredSave(cred.get());
+         },
+         "cred_save:16 Add task failed. "},
+    };
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.record);
+        kova_test::ClearLog();
+        EXPECT_EQ(c.call(), -1);
+        EXPECT_EQ(kova_test::LogCount(c.record + "[0x0900 cred_db:169]"), 1u)
+            << kova_test::LogDump();
+    }
+}
+
+}  // namespace
