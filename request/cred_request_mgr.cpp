@@ -156,7 +156,12 @@ int CredRequestMgr::AddCredRequest(const std::string &protocol, const std::strin
         // again so that the id can be handed out next time.
         struct DropDescription {
             const KOVA_CRED *cred;
-            ~DropDescription() { CredRequestUtil::RemoveWebAPIDesc(cred); }
+            ~DropDescription() {
+                try {
+                    CredRequestUtil::RemoveWebAPIDesc(cred);
+                } catch (...) {
+                }
+            }
         } dropDescription{&cred};
 
         if (!CredRequestUtil::SetWebAPIURL(&cred, api, version, method, request.get())) {
