@@ -178,6 +178,7 @@ TEST_F(ManagerTest, RemoveRequestKeepsSizeAndIndexes) {
     EXPECT_EQ("", removed->GetResponse());
     Json::Value all = mgr.GetAllResponse();
     ASSERT_EQ(2u, all.size());
+    EXPECT_EQ("", all[0].asString());
     EXPECT_EQ("slow 2", all[1].asString());
 }
 
