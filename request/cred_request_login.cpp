@@ -1,0 +1,107 @@
+// Logging a request in: with a stored credential before the transfer (ProcessWithLogin), or
+// with an account given at run time against the server of the request's URL (Login), logging
+// that session out again, and asking whether the server offers an API.
+#include <exception>
+#include <string>
+
+#include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_util.h"
+#include "kovacredential/kovacred.h"
+#include "kovacredential/kovacredsetter.h"
+#include "platform/kova_log.h"
+#include "request/cred_request_p.h"
+
+namespace KOVA {
+
+namespace {
+
+const char kUnit[] = "cred_request";
+
+template <typename Result, typename Body>
+Result Guarded(int line, Result failure, Body body) {
+    try {
+        return body();
+    } catch (const std::exception &e) {
+        kova::Log("%s:%d Exception: %s", kUnit, line, e.what());
+    } catch (...) {
+        kova::Log("%s:%d Exception", kUnit, line);
+    }
+    return failure;
+}
+
+}  // namespace
+
+constexpr int kLineLoginException = 35;
+
+bool CredRequest::ProcessWithLogin(long credId, bool perform, int retries) {
+    return Guarded(kLineLoginException, false, [&] {
+        KOVA_CRED_SESS session;
+        if (!CredRequestUtil::Login(credId, &session)) {
+            SetError(CRED_REQ_ERR_LOGIN_FAIL);
+            return false;
+        }
+        if (!AddPostParam("_sid", session.access_token)) {
+            return false;
+        }
+        if (!session.csrf_token.empty() && !AddPostParam("KovaToken", session.csrf_token)) {
+            return false;
+        }
+        return Process(perform, retries);
+    });
+}
+
+constexpr int kLineLoginToken = 82;
+
+bool CredRequest::Login(const std::string &account, const std::string &password,
+                        const std::string &url) {
+    return Guarded(kLineLoginException, false, [&] {
+        const std::string target = url.empty() ? GetURL() : url;
+        if (!d->buildCredByURL(target)) {
+            SetError(CRED_REQ_ERR_LOGIN_PARAM);
+            return false;
+        }
+        if (account.empty() || password.empty() ||
+            KOVACredItemSetRemoteAccount(d->cred, account.c_str()) < 0 ||
+            KOVACredItemSetRemotePasswd(d->cred, password.c_str()) < 0) {
+            SetError(CRED_REQ_ERR_LOGIN_PARAM);
+            return false;
+        }
+        if (d->sess == nullptr || !CredRequestUtil::LoginWithOTP(d->cred, "", d->sess, nullptr) ||
+            d->sess->access_token.empty()) {
+            SetError(CRED_REQ_ERR_LOGIN_SESSION);
+            return false;
+        }
+        const std::string sid = d->sess->access_token;
+        if (!AddCookie("id", sid) || !AddGetParam("_sid", sid)) {
+            SetError(CRED_REQ_ERR_LOGIN_SESSION);
+            return false;
+        }
+        if (!d->sess->csrf_token.empty() && !AddGetParam("KovaToken", d->sess->csrf_token)) {
+            kova::Log("%s:%d Add csrf_token fail", kUnit, kLineLoginToken);
+            SetError(CRED_REQ_ERR_LOGIN_SESSION);
+            return false;
+        }
+        return true;
+    });
+}
+
+bool CredRequest::Logout() {
+    return Guarded(kLineLoginException, false, [&] {
+        if (d->cred == nullptr || d->sess == nullptr || d->cred->host.empty() ||
+            d->cred->protocol.empty() || d->sess->access_token.empty()) {
+            return false;
+        }
+        return CredRequestUtil::Logout(d->cred, d->sess);
+    });
+}
+
+bool CredRequest::isAPIValid(const std::string &api) {
+    return Guarded(kLineLoginException, false, [&] {
+        if (!d->buildCredByURL(GetURL())) {
+            return false;
+        }
+        return !CredRequestUtil::GetWebAPIPath(d->cred, api).empty();
+    });
+}
+
+}  // namespace KOVA

@@ -1,0 +1,398 @@
+// Authentication flows of the WebAPI utilities: the URL set-up of a WebAPI call, the redirect
+// probe of plain-HTTP credentials, login (with an optional one-time code) whose session is
+// written back to the store, access tokens and logout.
+#include <stdlib.h>
+#include <strings.h>
+
+#include <exception>
+#include <string>
+
+#include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_util.h"
+#include "kovacredential/kovacred.h"
+#include "platform/json_text.h"
+#include "platform/kova_log.h"
+
+namespace KOVA {
+
+namespace {
+
+const char kUnit[] = "cred_request_util";
+const char kAuthApi[] = "KOVA.API.Auth";
+
+template <typename Result, typename Body>
+Result Guarded(int line, Result failure, Body body) {
+    try {
+        return body();
+    } catch (const std::exception &e) {
+        kova::Log("%s:%d Exception: %s", kUnit, line, e.what());
+    } catch (...) {
+        kova::Log("%s:%d Exception", kUnit, line);
+    }
+    return failure;
+}
+
+std::string Text(const Json::Value &v) {
+    return v.isConvertibleTo(Json::stringValue) ? v.asString() : "";
+}
+
+bool SuccessOf(const Json::Value &answer) {
+    if (!answer.isObject()) {
+        return false;
+    }
+    const Json::Value &v = answer["success"];
+    return v.isConvertibleTo(Json::booleanValue) && v.asBool();
+}
+
+// The response header `name`, compared without regard to case (servers differ in the case
+// they send); null when absent.
+Json::Value HeaderValue(const Json::Value &headers, const std::string &name) {
+    if (!headers.isObject()) {
+        return Json::Value();
+    }
+    if (headers.isMember(name)) {
+        return headers[name];
+    }
+    for (const auto &member : headers.getMemberNames()) {
+        if (strcasecmp(member.c_str(), name.c_str()) == 0) {
+            return headers[member];
+        }
+    }
+    return Json::Value();
+}
+
+std::string Trimmed(const std::string &text) {
+    const char *space = " \t\r\n";
+    size_t start = text.find_first_not_of(space);
+    if (start == std::string::npos) {
+        return "";
+    }
+    return text.substr(start, text.find_last_not_of(space) - start + 1);
+}
+
+}  // namespace
+
+constexpr int kLineAuthException = 75;
+constexpr int kLineUrlBadParam = 80;
+constexpr int kLineUrlEncUrl = 87;
+constexpr int kLineUrlNoPath = 94;
+constexpr int kLineUrlSetUrl = 99;
+constexpr int kLineUrlFormat = 104;
+
+bool CredRequestUtil::SetWebAPIURL(const KOVA_CRED *cred, const std::string &api, int version,
+                                   const std::string &method, KOVA::CredRequest *request) {
+    return Guarded(kLineAuthException, false, [&] {
+        if (cred == nullptr || api.empty() || version <= 0 || method.empty() ||
+            request == nullptr) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLineUrlBadParam);
+            return false;
+        }
+        if (!request->SetEncURL(
+                GetURL(cred->protocol, cred->host, cred->port, "webapi/encryption.cgi"))) {
+            kova::Log("%s:%d Set encryption url fail!", kUnit, kLineUrlEncUrl);
+            return false;
+        }
+        const std::string path = GetWebAPIPath(cred, api);
+        if (path.empty()) {
+            request->SetError(static_cast<CRED_REQ_ERR>(m_errCode));
+            kova::Log("%s:%d GetWebAPIPath fail![%s]", kUnit, kLineUrlNoPath, api.c_str());
+            return false;
+        }
+        if (!request->SetURL(cred->protocol, cred->host, cred->port, "webapi/" + path)) {
+            kova::Log("%s:%d Set URL fail!", kUnit, kLineUrlSetUrl);
+            return false;
+        }
+        std::string format;
+        if (!GetWebAPIRequestFormat(cred, api, format)) {
+            kova::Log("%s:%d GetWebAPIRequestFormat fail![%s]", kUnit, kLineUrlFormat, api.c_str());
+            return false;
+        }
+        request->SetRequestFormat(format);
+        const std::string versionText = std::to_string(version);
+        if (format == "JSON") {
+            return request->AddGetParam("api", api) &&
+                   request->AddGetParam("version", versionText) &&
+                   request->AddGetParam("method", method);
+        }
+        return request->AddPostParam("api", api) && request->AddPostParam("version", versionText) &&
+               request->AddPostParam("method", method);
+    });
+}
+
+constexpr int kLineRedirBadParam = 131;
+constexpr int kLineRedirSetUrl = 142;
+constexpr int kLineRedirHeaderMode = 149;
+constexpr int kLineRedirNoHeaders = 161;
+constexpr int kLineRedirNoLocation = 166;
+constexpr int kLineRedirBadLocation = 172;
+
+bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
+    return Guarded(kLineAuthException, false, [&] {
+        if (cred == nullptr) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLineRedirBadParam);
+            return false;
+        }
+        // Only plain-HTTP credentials can be moved to HTTPS by their server.
+        if (strcasecmp(cred->protocol.c_str(), "http") != 0) {
+            return true;
+        }
+        const std::string path = "webapi/query.cgi";
+        CredRequest request;
+        request.SetFollowLocation(false);
+        if (!request.SetURL(cred->protocol, cred->host, cred->port, path)) {
+            kova::Log("%s:%d SetURL failed. %s %s %ld %s", kUnit, kLineRedirSetUrl,
+                      cred->protocol.c_str(), cred->host.c_str(), static_cast<long>(cred->port),
+                      path.c_str());
+            return false;
+        }
+        request.SetResponseTimeout(30);
+        if (!request.SetRespHeaderToJsonValue(true)) {
+            kova::Log("%s:%d SetRespHeaderToJsonValue to true failed.", kUnit,
+                      kLineRedirHeaderMode);
+            return false;
+        }
+        // Any failure but a redirect is left for the real request to report.
+        if (request.Process(true, 0) || request.GetError() != CRED_REQ_ERR_REDIRECT) {
+            return true;
+        }
+        const Json::Value &headers = request.GetResponseHeader();
+        if (headers.empty()) {
+            kova::Log("%s:%d GetResponseHeader failed", kUnit, kLineRedirNoHeaders);
+            return false;
+        }
+        const Json::Value location = HeaderValue(headers, "Location");
+        if (!location.isString() || Trimmed(location.asString()).empty()) {
+            kova::Log("%s:%d Return 302, but no Location in header.", kUnit, kLineRedirNoLocation);
+            return false;
+        }
+        const std::string target = Trimmed(location.asString());
+        std::string scheme;
+        std::string host;
+        std::string port;
+        if (!ParseURL(target, scheme, host, port)) {
+            kova::Log("%s:%d Can not identify 302 Location: %s.", kUnit, kLineRedirBadLocation,
+                      target.c_str());
+            return false;
+        }
+        cred->protocol = scheme;
+        cred->host = host;
+        cred->port = static_cast<int32_t>(strtol(port.c_str(), nullptr, 10));
+        return true;
+    });
+}
+
+constexpr int kLineLoginBadParam = 196;
+constexpr int kLineLoginRedirect = 200;
+constexpr int kLineLoginSetUrl = 205;
+constexpr int kLineLoginSend = 225;
+constexpr int kLineLoginInvalid = 238;
+constexpr int kLineLoginStore = 248;
+
+bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
+                                   KOVA_CRED_SESS *sess, Json::Value *response) {
+    return Guarded(kLineAuthException, false, [&] {
+        if (cred == nullptr) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLineLoginBadParam);
+            return false;
+        }
+        if (!CheckRedirect(cred)) {
+            kova::Log("%s:%d CheckRedirect failed.", kUnit, kLineLoginRedirect);
+            return false;
+        }
+        CredRequest request;
+        if (!SetWebAPIURL(cred, kAuthApi, 3, "login", &request)) {
+            kova::Log("%s:%d Set URL fail!", kUnit, kLineLoginSetUrl);
+            return false;
+        }
+        Json::Value params(Json::objectValue);
+        params["account"] = cred->remote_account;
+        params["passwd"] = cred->remote_passwd;
+        params["format"] = "sid";
+        if (!cred->application.empty()) {
+            params["session"] = cred->application;
+        }
+        if (!otpCode.empty()) {
+            params["otp_code"] = otpCode;
+        }
+        request.AddPostParam(params);
+        request.SetEncryptParam(true);
+        if (!request.Process(true, 0)) {
+            kova::Log("%s:%d Send login request fail.[%d]", kUnit, kLineLoginSend,
+                      static_cast<int>(request.GetError()));
+            return false;
+        }
+        Json::Value answer;
+        const bool parsed = kova::JsonFromString(request.GetResponse(), answer);
+        if (response != nullptr) {
+            *response = answer;
+        }
+        if (!parsed || !SuccessOf(answer) || !answer["data"].isObject()) {
+            request.SetError(CRED_REQ_ERR_INVALID_RESPONSE);
+            kova::Log("%s:%d Login response is invalid", kUnit, kLineLoginInvalid);
+            return false;
+        }
+        KOVA_CRED_SESS local;
+        local.filled = 1;
+        local.access_token = Text(answer["data"]["sid"]);
+        local.csrf_token = Text(answer["data"]["kovatoken"]);
+        if (cred->id >= 0 && KOVACredSessSetByID(cred->id, &local) < 0) {
+            kova::Log("%s:%d Set cred_sess fail. id=%ld", kUnit, kLineLoginStore,
+                      static_cast<long>(cred->id));
+            return false;
+        }
+        if (sess != nullptr) {
+            sess->next = local.next;
+            sess->filled = local.filled;
+            sess->id = local.id;
+            sess->access_token = local.access_token;
+            sess->csrf_token = local.csrf_token;
+            sess->extra_info = local.extra_info;
+        }
+        return true;
+    });
+}
+
+bool CredRequestUtil::Login(KOVA_CRED *cred, KOVA_CRED_SESS *sess) {
+    return LoginWithOTP(cred, "", sess, nullptr);
+}
+
+constexpr int kLineLoginIdMissing = 278;
+
+bool CredRequestUtil::Login(long id, KOVA_CRED_SESS *sess) {
+    return Guarded(kLineAuthException, false, [&] {
+        KOVA_CRED cred;
+        if (KOVACredGetByID(id, &cred) < 0 || cred.filled == 0) {
+            kova::Log("%s:%d Cannot find id[%ld] in database", kUnit, kLineLoginIdMissing, id);
+            return false;
+        }
+        return Login(&cred, sess);
+    });
+}
+
+constexpr int kLineTokenBadParam = 292;
+constexpr int kLineTokenNoSess = 297;
+constexpr int kLineTokenLogin = 305;
+constexpr int kLineTokenUnfilled = 312;
+
+bool CredRequestUtil::GetAccessToken(long id, KOVA_CRED_SESS *sess) {
+    return Guarded(kLineAuthException, false, [&] {
+        if (sess == nullptr) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLineTokenBadParam);
+            return false;
+        }
+        if (KOVACredSessGetByID(id, sess) < 0) {
+            kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenNoSess, id);
+            return false;
+        }
+        // A stored session is trusted as it is; the server is not asked whether it still lives.
+        if (sess->filled) {
+            return true;
+        }
+        if (!Login(id, sess)) {
+            kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenLogin, id);
+            return false;
+        }
+        if (sess->filled) {
+            return true;
+        }
+        kova::Log("%s:%d Cannot get access token from database", kUnit, kLineTokenUnfilled);
+        return false;
+    });
+}
+
+bool CredRequestUtil::GetAccessToken(KOVA_CRED *cred, KOVA_CRED_SESS *sess) {
+    return Guarded(kLineAuthException, false, [&] {
+        if (cred == nullptr || sess == nullptr) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLineTokenBadParam);
+            return false;
+        }
+        const long id = cred->id;
+        if (KOVACredSessGetByID(id, sess) < 0) {
+            kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenNoSess, id);
+            return false;
+        }
+        if (sess->filled) {
+            return true;
+        }
+        if (!Login(cred, sess)) {
+            kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenLogin, id);
+            return false;
+        }
+        if (sess->filled) {
+            return true;
+        }
+        kova::Log("%s:%d Cannot get access token from database", kUnit, kLineTokenUnfilled);
+        return false;
+    });
+}
+
+constexpr int kLineLogoutBadParam = 350;
+constexpr int kLineLogoutRedirect = 354;
+constexpr int kLineLogoutSetUrl = 359;
+constexpr int kLineLogoutSend = 368;
+constexpr int kLineLogoutInvalid = 377;
+
+bool CredRequestUtil::Logout(KOVA_CRED *cred, const std::string &sid) {
+    return Guarded(kLineAuthException, false, [&] {
+        if (cred == nullptr || sid.empty()) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLineLogoutBadParam);
+            return false;
+        }
+        if (!CheckRedirect(cred)) {
+            kova::Log("%s:%d CheckRedirect failed.", kUnit, kLineLogoutRedirect);
+            return false;
+        }
+        CredRequest request;
+        if (!SetWebAPIURL(cred, kAuthApi, 1, "logout", &request)) {
+            kova::Log("%s:%d Set URL fail!", kUnit, kLineLogoutSetUrl);
+            return false;
+        }
+        Json::Value params(Json::objectValue);
+        params["_sid"] = sid;
+        request.AddPostParam(params);
+        request.AddCookie("id", sid);
+        if (!request.Process(true, 0)) {
+            kova::Log("%s:%d Send logout request fail.[%d]", kUnit, kLineLogoutSend,
+                      static_cast<int>(request.GetError()));
+            return false;
+        }
+        Json::Value answer;
+        if (kova::JsonFromString(request.GetResponse(), answer) && SuccessOf(answer)) {
+            return true;
+        }
+        request.SetError(CRED_REQ_ERR_INVALID_RESPONSE);
+        kova::Log("%s:%d Logout response is invalid", kUnit, kLineLogoutInvalid);
+        return false;
+    });
+}
+
+bool CredRequestUtil::Logout(KOVA_CRED *cred, KOVA_CRED_SESS *sess) {
+    return Guarded(kLineAuthException, false, [&] {
+        if (cred == nullptr || sess == nullptr) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLineLogoutBadParam);
+            return false;
+        }
+        return Logout(cred, sess->access_token);
+    });
+}
+
+constexpr int kLineLogoutNoCred = 398;
+constexpr int kLineLogoutNoSess = 403;
+
+bool CredRequestUtil::Logout(long id) {
+    return Guarded(kLineAuthException, false, [&] {
+        KOVA_CRED cred;
+        if (KOVACredGetByID(id, &cred) < 0 || cred.filled == 0) {
+            kova::Log("%s:%d Cannot find id[%ld] in cred", kUnit, kLineLogoutNoCred, id);
+            return false;
+        }
+        KOVA_CRED_SESS sess;
+        if (KOVACredSessGetByID(id, &sess) < 0 || sess.filled == 0) {
+            kova::Log("%s:%d Cannot find id[%ld] in sess", kUnit, kLineLogoutNoSess, id);
+            return false;
+        }
+        return Logout(&cred, &sess);
+    });
+}
+
+}  // namespace KOVA

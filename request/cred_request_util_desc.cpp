@@ -1,0 +1,248 @@
+// The per-credential cache of WebAPI descriptions: one "KOVA.API.Info" query per credential
+// id, kept in CredRequestUtil::m_jsData["webapiDesc"][<id>], answering which CGI path serves
+// an API and which request format it expects.
+//
+// The cache is read with jsoncpp's inserting subscript on purpose: a look-up of an API the
+// server does not list leaves a null member under that name, so the next look-up finds it
+// empty and queries the server again.
+#include <exception>
+#include <string>
+
+#include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_util.h"
+#include "platform/json_text.h"
+#include "platform/kova_log.h"
+
+namespace KOVA {
+
+namespace {
+
+const char kUnit[] = "cred_request_util";
+
+template <typename Result, typename Body>
+Result Guarded(int line, Result failure, Body body) {
+    try {
+        return body();
+    } catch (const std::exception &e) {
+        kova::Log("%s:%d Exception: %s", kUnit, line, e.what());
+    } catch (...) {
+        kova::Log("%s:%d Exception", kUnit, line);
+    }
+    return failure;
+}
+
+// A credential id as the cache names it: through a JSON integer, so -1 is "-1".
+std::string CacheKey(long id) {
+    return Json::Value(static_cast<Json::Int64>(id)).asString();
+}
+
+// The "webapiDesc" object, inserted when absent. A cache that someone replaced with a
+// non-object is started afresh rather than thrown on.
+Json::Value &DescRoot() {
+    Json::Value &data = CredRequestUtil::m_jsData;
+    if (!data.isNull() && !data.isObject()) {
+        data = Json::Value(Json::objectValue);
+    }
+    Json::Value &root = data["webapiDesc"];
+    if (!root.isNull() && !root.isObject()) {
+        root = Json::Value(Json::objectValue);
+    }
+    return root;
+}
+
+// Whether the credential's entry holds a non-empty description of `api`.
+bool ApiCached(const std::string &key, const std::string &api) {
+    Json::Value &root = DescRoot();
+    if (!root.isObject() || !root.isMember(key)) {
+        return false;
+    }
+    const Json::Value &entry = root[key];
+    return entry.isObject() && entry.isMember(api) && !entry[api].empty();
+}
+
+// The cached description of `api` through the inserting subscript (a missing API leaves a
+// null member); null when the entry is not an object at all.
+Json::Value &ApiEntry(const std::string &key, const std::string &api) {
+    static Json::Value none;
+    none = Json::Value();
+    Json::Value &entry = DescRoot()[key];
+    if (!entry.isNull() && !entry.isObject()) {
+        return none;
+    }
+    return entry[api];
+}
+
+std::string TextMember(const Json::Value &object, const char *name) {
+    if (!object.isObject()) {
+        return "";
+    }
+    const Json::Value &v = object[name];
+    return v.isConvertibleTo(Json::stringValue) ? v.asString() : "";
+}
+
+bool SuccessOf(const Json::Value &answer) {
+    if (!answer.isObject()) {
+        return false;
+    }
+    const Json::Value &v = answer["success"];
+    return v.isConvertibleTo(Json::booleanValue) && v.asBool();
+}
+
+}  // namespace
+
+constexpr int kLineDescBadParam = 61;
+constexpr int kLineDescSetUrl = 68;
+constexpr int kLineDescCredError = 80;
+constexpr int kLineDescInvalid = 86;
+constexpr int kLineDescFail = 90;
+constexpr int kLineDescException = 96;
+
+bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
+    return Guarded(kLineDescException, false, [&] {
+        if (cred == nullptr) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLineDescBadParam);
+            return false;
+        }
+        const std::string key = CacheKey(cred->id);
+        const std::string path = "webapi/query.cgi";
+        CredRequest request;
+        if (!request.SetURL(cred->protocol, cred->host, cred->port, path)) {
+            kova::Log("%s:%d SetURL failed. %s %s %ld %s", kUnit, kLineDescSetUrl,
+                      cred->protocol.c_str(), cred->host.c_str(), static_cast<long>(cred->port),
+                      path.c_str());
+            return false;
+        }
+        Json::Value params(Json::objectValue);
+        params["api"] = "KOVA.API.Info";
+        params["version"] = 1;
+        params["method"] = "query";
+        request.AddPostParam(params);
+        request.SetResponseTimeout(30);
+        request.SetEncoding(true);
+        if (!request.Process(true, 0)) {
+            kova::Log("%s:%d Cred Error:[%s][%d]", kUnit, kLineDescCredError,
+                      request.GetURL().c_str(), static_cast<int>(request.GetError()));
+            m_errCode = CRED_REQ_ERR_QUERY_FAIL;
+            return false;
+        }
+        Json::Value answer;
+        if (!kova::JsonFromString(request.GetResponse(), answer)) {
+            kova::Log("%s:%d Query response is invalid", kUnit, kLineDescInvalid);
+            return false;
+        }
+        if (!SuccessOf(answer)) {
+            kova::Log("%s:%d Query request fail!", kUnit, kLineDescFail);
+            return false;
+        }
+        DescRoot()[key] = answer["data"];
+        return true;
+    });
+}
+
+void CredRequestUtil::RemoveWebAPIDesc(const KOVA_CRED *cred) {
+    Guarded(kLineDescException, 0, [&] {
+        if (cred != nullptr) {
+            Json::Value &root = DescRoot();
+            if (root.isObject()) {
+                root.removeMember(CacheKey(cred->id));
+            }
+        }
+        return 0;
+    });
+}
+
+bool CredRequestUtil::IsCredIdCached(long id) {
+    return Guarded(kLineDescException, false, [&] {
+        Json::Value &root = DescRoot();
+        return root.isObject() && root.isMember(CacheKey(id));
+    });
+}
+
+constexpr int kLinePathBadParam = 141;
+constexpr int kLinePathNoDesc = 148;
+constexpr int kLinePathNoApi = 154;
+
+std::string CredRequestUtil::GetWebAPIPath(const KOVA_CRED *cred, const std::string &api) {
+    return Guarded(kLineDescException, std::string(), [&]() -> std::string {
+        if (cred == nullptr) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLinePathBadParam);
+            return "";
+        }
+        const std::string key = CacheKey(cred->id);
+        if (!ApiCached(key, api) && !GetWebAPIDesc(cred)) {
+            kova::Log("%s:%d cannot get cgi path from id=[%s]", kUnit, kLinePathNoDesc,
+                      key.c_str());
+            return "";
+        }
+        Json::Value desc = ApiEntry(key, api);
+        if (desc.empty()) {
+            kova::Log("%s:%d No such api: %s", kUnit, kLinePathNoApi, api.c_str());
+            m_errCode = CRED_REQ_ERR_NO_SUCH_API;
+            return "";
+        }
+        return TextMember(desc, "path");
+    });
+}
+
+constexpr int kLinePathIdMissing = 172;
+
+std::string CredRequestUtil::GetWebAPIPath(long id, const std::string &api) {
+    return Guarded(kLineDescException, std::string(), [&]() -> std::string {
+        KOVA_CRED cred;
+        if (KOVACredGetByID(id, &cred) < 0 || cred.filled == 0) {
+            kova::Log("%s:%d cannot get cgi path from id=[%ld]", kUnit, kLinePathIdMissing, id);
+            return "";
+        }
+        return GetWebAPIPath(&cred, api);
+    });
+}
+
+constexpr int kLineFormatBadParam = 186;
+constexpr int kLineFormatNoDesc = 192;
+
+bool CredRequestUtil::GetWebAPIRequestFormat(const KOVA_CRED *cred, const std::string &api,
+                                             std::string &format) {
+    return Guarded(kLineDescException, false, [&] {
+        if (cred == nullptr) {
+            kova::Log("%s:%d Bad parameters", kUnit, kLineFormatBadParam);
+            return false;
+        }
+        const std::string key = CacheKey(cred->id);
+        if (!ApiCached(key, api) && !GetWebAPIDesc(cred)) {
+            kova::Log("%s:%d Cannot find api[%s] description", kUnit, kLineFormatNoDesc,
+                      api.c_str());
+            return false;
+        }
+        // An API the server does not list gives "" here, not a failure.
+        format = TextMember(ApiEntry(key, api), "requestFormat");
+        return true;
+    });
+}
+
+constexpr int kLineFormatFailed = 207;
+
+std::string CredRequestUtil::GetWebAPIRequestFormat(const KOVA_CRED *cred, const std::string &api) {
+    return Guarded(kLineDescException, std::string(), [&]() -> std::string {
+        std::string format;
+        if (!GetWebAPIRequestFormat(cred, api, format)) {
+            kova::Log("%s:%d GetWebAPIRequestFormat failed", kUnit, kLineFormatFailed);
+            return "";
+        }
+        return format;
+    });
+}
+
+constexpr int kLineFormatIdMissing = 221;
+
+std::string CredRequestUtil::GetWebAPIRequestFormat(long id, const std::string &api) {
+    return Guarded(kLineDescException, std::string(), [&]() -> std::string {
+        KOVA_CRED cred;
+        if (KOVACredGetByID(id, &cred) < 0 || cred.filled == 0) {
+            kova::Log("%s:%d Cannot find id[%ld] in database", kUnit, kLineFormatIdMissing, id);
+            return "";
+        }
+        return GetWebAPIRequestFormat(&cred, api);
+    });
+}
+
+}  // namespace KOVA
