@@ -1,0 +1,480 @@
+// Login, access tokens, redirect probing and logout against the in-process simulator, which
+// opens the RSA and AES envelopes and checks every parameter it finds inside.
+#include <string.h>
+
+#include <string>
+
+#include "kovacredential/kovaplatform.h"
+#include "webapi_fixture.h"
+
+namespace kova_test {
+namespace {
+
+using KOVA::CredRequest;
+using KOVA::CredRequestUtil;
+
+class WebApiAuthTest : public WebApiTest {
+  protected:
+    static std::string SessionIdStored(int id) {
+        KOVA_CRED_SESS sess;
+        EXPECT_EQ(0, KOVACredSessGetByID(id, &sess));
+        return sess.filled ? sess.access_token : "";
+    }
+    // The last request that reached the login/logout CGI.
+    static kovasim::RecordedRequest LastAuthRequest() {
+        kovasim::RecordedRequest last;
+        for (const auto &r : Server().Requests()) {
+            if (r.path == "/webapi/auth.cgi") {
+                last = r;
+            }
+        }
+        return last;
+    }
+};
+
+TEST_F(WebApiAuthTest, LoginSendsEveryParameterInsideTheRsaEnvelopeAndStoresTheSession) {
+    int id = StoreCred("admin", "secret", "backup");
+    KOVA_CRED cred;
+    ASSERT_EQ(0, KOVACredGetByID(id, &cred));
+    KOVA_CRED_SESS sess;
+    Json::Value response;
+
+    ASSERT_TRUE(CredRequestUtil::LoginWithOTP(&cred, "", &sess, &response)) << LogDump();
+
+    kovasim::WebApiSim::LoginRecord login = Sim().LastLogin();
+    EXPECT_EQ("rsa", login.envelope);
+    EXPECT_TRUE(login.success);
+    std::map<std::string, std::string> expected = {
+        {"account", "admin"},     {"passwd", "secret"}, {"format", "sid"},  {"session", "backup"},
+        {"api", "KOVA.API.Auth"}, {"version", "3"},     {"method", "login"}};
+    EXPECT_EQ(expected, login.params);
+
+    // Nothing but the envelope travelled in clear.
+    kovasim::RecordedRequest wire = LastAuthRequest();
+    EXPECT_TRUE(wire.HasParam(Sim().CipherKey()));
+    EXPECT_FALSE(wire.HasParam("passwd"));
+    EXPECT_FALSE(wire.HasParam("account"));
+    EXPECT_EQ(std::string::npos, wire.body.find("secret"));
+
+    const std::string sid = response["data"]["sid"].asString();
+    EXPECT_FALSE(sid.empty());
+    EXPECT_TRUE(Sim().SessionValid(sid));
+    EXPECT_EQ(sid, sess.access_token);
+    EXPECT_EQ(response["data"]["kovatoken"].asString(), sess.csrf_token);
+    EXPECT_EQ(1, sess.filled);
+
+    KOVA_CRED_SESS stored;
+    ASSERT_EQ(0, KOVACredSessGetByID(id, &stored));
+    EXPECT_EQ(1, stored.filled);
+    EXPECT_EQ(sid, stored.access_token);
+    EXPECT_EQ(sess.csrf_token, stored.csrf_token);
+}
+
+TEST_F(WebApiAuthTest, EmptyApplicationAndOneTimeCodeAreNotSent) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    KOVA_CRED_SESS sess;
+    ASSERT_TRUE(CredRequestUtil::Login(&cred, &sess)) << LogDump();
+    kovasim::WebApiSim::LoginRecord login = Sim().LastLogin();
+    EXPECT_EQ(0u, login.params.count("session"));
+    EXPECT_EQ(0u, login.params.count("otp_code"));
+    // An unstored credential keeps its session in memory only.
+    KOVA_CRED_SESS *list = nullptr;
+    EXPECT_EQ(0, KOVACredSessListGet(&list, nullptr, nullptr));
+    KOVACredSessListFree(&list);
+}
+
+TEST_F(WebApiAuthTest, OneTimeCodeIsRequiredCheckedAndSent) {
+    int id = StoreCred("otpuser", "secret");
+    KOVA_CRED cred;
+    ASSERT_EQ(0, KOVACredGetByID(id, &cred));
+    KOVA_CRED_SESS sess;
+    Json::Value response;
+
+    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "", &sess, &response));
+    EXPECT_EQ(kovasim::WebApiSim::kErrOtpRequired, response["error"]["code"].asInt());
+    EXPECT_TRUE(LogHas("Login response is invalid")) << LogDump();
+
+    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "654321", &sess, &response));
+    EXPECT_EQ(kovasim::WebApiSim::kErrOtpWrong, response["error"]["code"].asInt());
+    EXPECT_EQ("654321", Sim().LastLogin().params["otp_code"]);
+    EXPECT_EQ("", SessionIdStored(id));
+
+    ASSERT_TRUE(CredRequestUtil::LoginWithOTP(&cred, "123456", &sess, &response)) << LogDump();
+    EXPECT_EQ("123456", Sim().LastLogin().params["otp_code"]);
+    EXPECT_EQ(sess.access_token, SessionIdStored(id));
+}
+
+TEST_F(WebApiAuthTest, WrongPasswordStoresNothing) {
+    int id = StoreCred("admin", "wrong");
+    KOVA_CRED_SESS sess;
+    EXPECT_FALSE(CredRequestUtil::Login(static_cast<long>(id), &sess));
+    EXPECT_EQ(kovasim::WebApiSim::kErrWrongPassword, Sim().LastLogin().error);
+    EXPECT_TRUE(LogHas("Login response is invalid")) << LogDump();
+    EXPECT_EQ(0, sess.filled);
+    EXPECT_EQ("", SessionIdStored(id));
+
+    EXPECT_FALSE(CredRequestUtil::Login(4242L, &sess));
+    EXPECT_TRUE(LogHas("Cannot find id[4242] in database")) << LogDump();
+    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(nullptr, "", &sess, nullptr));
+    EXPECT_TRUE(LogHas("Bad parameters"));
+}
+
+int SimTokenProvider(char *token, size_t tokenSize, char *key, size_t keySize) {
+    snprintf(token, tokenSize, "%s", "tok-0123456789");
+    snprintf(key, keySize, "%s", "aes-pass-phrase");
+    return 0;
+}
+
+int WrongKeyProvider(char *token, size_t tokenSize, char *key, size_t keySize) {
+    snprintf(token, tokenSize, "%s", "tok-0123456789");
+    snprintf(key, keySize, "%s", "not-the-phrase");
+    return 0;
+}
+
+class WebApiAesTest : public WebApiAuthTest {
+  protected:
+    void SetUp() override {
+        WebApiAuthTest::SetUp();
+        Sim().SetAesSecret("tok-0123456789", "aes-pass-phrase");
+    }
+    void TearDown() override {
+        KOVACloudServiceHxtokenSetProvider(nullptr);
+        WebApiAuthTest::TearDown();
+    }
+};
+
+TEST_F(WebApiAesTest, ParametersTravelInTheAesEnvelope) {
+    KOVACloudServiceHxtokenSetProvider(&SimTokenProvider);
+    KOVA_CRED cred;
+    FillCred(cred);
+    KOVA_CRED_SESS sess;
+    sess.access_token = "S1";
+    Json::Value params;
+    params["color"] = "blue & green";
+    CredRequest request;
+    ASSERT_TRUE(CredRequest::CreateWebAPIRequest(&request, &cred, &sess, "KOVA.Demo.Echo", 1,
+                                                 "echo", params));
+    ASSERT_TRUE(request.SetEncryptMode(KOVA::CRED_REQ_CRYPTO_AES));
+    ASSERT_TRUE(request.Process(true, 0)) << LogDump();
+
+    Json::Value answer = ParseBody(request.GetResponse());
+    ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
+    EXPECT_EQ("aes", answer["data"]["envelope"].asString());
+    EXPECT_EQ("blue & green", answer["data"]["params"]["color"].asString());
+    EXPECT_EQ("S1", answer["data"]["params"]["_sid"].asString());
+    kovasim::RecordedRequest wire = Server().Last();
+    EXPECT_TRUE(wire.HasParam("__tXeTrEhPiC"));
+    EXPECT_EQ("\"tok-0123456789\"", wire.Param("__nEkOtReHpIc"));
+    EXPECT_FALSE(wire.HasParam("color"));
+}
+
+TEST_F(WebApiAesTest, LoginThroughTheAesEnvelope) {
+    KOVACloudServiceHxtokenSetProvider(&SimTokenProvider);
+    KOVA_CRED cred;
+    FillCred(cred);
+    CredRequest request;
+    ASSERT_TRUE(CredRequestUtil::SetWebAPIURL(&cred, "KOVA.API.Auth", 3, "login", &request));
+    request.AddPostParam("account", "admin");
+    request.AddPostParam("passwd", "secret");
+    ASSERT_TRUE(request.SetEncryptMode(KOVA::CRED_REQ_CRYPTO_AES));
+    ASSERT_TRUE(request.Process(true, 0));
+    Json::Value answer = ParseBody(request.GetResponse());
+    ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
+    EXPECT_TRUE(Sim().SessionValid(answer["data"]["sid"].asString()));
+    EXPECT_EQ("aes", Sim().LastLogin().envelope);
+    EXPECT_EQ("admin", Sim().LastLogin().params["account"]);
+}
+
+TEST_F(WebApiAesTest, WrongKeyIsABadEnvelope) {
+    KOVACloudServiceHxtokenSetProvider(&WrongKeyProvider);
+    KOVA_CRED cred;
+    FillCred(cred);
+    KOVA_CRED_SESS sess;
+    CredRequest request;
+    ASSERT_TRUE(CredRequest::CreateWebAPIRequest(&request, &cred, &sess, "KOVA.Demo.Echo", 1,
+                                                 "echo", Json::Value()));
+    ASSERT_TRUE(request.SetEncryptMode(KOVA::CRED_REQ_CRYPTO_AES));
+    ASSERT_TRUE(request.Process(true, 0));
+    Json::Value answer = ParseBody(request.GetResponse());
+    EXPECT_FALSE(answer["success"].asBool());
+    EXPECT_EQ(kovasim::WebApiSim::kErrBadEnvelope, answer["error"]["code"].asInt());
+}
+
+TEST_F(WebApiAuthTest, StaleCiphertokenIsRefused) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    Sim().SetTokenWindow(-1);  // every server time is already too old
+    Json::Value response;
+    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "", nullptr, &response));
+    Sim().SetTokenWindow(300);
+    EXPECT_EQ(kovasim::WebApiSim::kErrStaleToken, response["error"]["code"].asInt());
+}
+
+TEST_F(WebApiAuthTest, AccessTokenReusesTheStoredSessionWithoutTraffic) {
+    int id = StoreCred();
+    KOVA_CRED_SESS first;
+    size_t logins = Sim().Hits("KOVA.API.Auth");
+    ASSERT_TRUE(CredRequestUtil::GetAccessToken(static_cast<long>(id), &first)) << LogDump();
+    EXPECT_EQ(logins + 1, Sim().Hits("KOVA.API.Auth"));
+    EXPECT_EQ(first.access_token, SessionIdStored(id));
+
+    Server().ClearRecords();
+    KOVA_CRED_SESS again;
+    ASSERT_TRUE(CredRequestUtil::GetAccessToken(static_cast<long>(id), &again));
+    EXPECT_EQ(first.access_token, again.access_token);
+    EXPECT_EQ(first.csrf_token, again.csrf_token);
+    KOVA_CRED cred;
+    ASSERT_EQ(0, KOVACredGetByID(id, &cred));
+    KOVA_CRED_SESS byRecord;
+    ASSERT_TRUE(CredRequestUtil::GetAccessToken(&cred, &byRecord));
+    EXPECT_EQ(first.access_token, byRecord.access_token);
+    EXPECT_EQ(0u, Server().RequestCount());
+
+    EXPECT_FALSE(CredRequestUtil::GetAccessToken(static_cast<long>(id), nullptr));
+    EXPECT_FALSE(CredRequestUtil::GetAccessToken(nullptr, &byRecord));
+    EXPECT_EQ(2u, LogCount("Bad parameters"));
+}
+
+TEST_F(WebApiAuthTest, AccessTokenFailsWhenTheLoginFails) {
+    int id = StoreCred("admin", "wrong");
+    KOVA_CRED_SESS sess;
+    EXPECT_FALSE(CredRequestUtil::GetAccessToken(static_cast<long>(id), &sess));
+    EXPECT_TRUE(LogHas("Cannot get access token from id=[" + std::to_string(id) + "]"))
+        << LogDump();
+}
+
+TEST_F(WebApiAuthTest, LogoutSendsSidAndCookieAndEndsTheSession) {
+    int id = StoreCred();
+    KOVA_CRED_SESS sess;
+    ASSERT_TRUE(CredRequestUtil::Login(static_cast<long>(id), &sess));
+    ASSERT_TRUE(Sim().SessionValid(sess.access_token));
+
+    ASSERT_TRUE(CredRequestUtil::Logout(static_cast<long>(id))) << LogDump();
+    kovasim::RecordedRequest wire = LastAuthRequest();
+    EXPECT_EQ(sess.access_token, wire.Param("_sid"));
+    EXPECT_EQ("logout", wire.Param("method"));
+    EXPECT_EQ("1", wire.Param("version"));
+    EXPECT_EQ("id=" + sess.access_token, wire.Header("Cookie"));
+    EXPECT_FALSE(Sim().SessionValid(sess.access_token));
+    // The stored session is left for the caller to remove.
+    EXPECT_EQ(sess.access_token, SessionIdStored(id));
+
+    // A second logout of the same session is refused by the server.
+    KOVA_CRED cred;
+    ASSERT_EQ(0, KOVACredGetByID(id, &cred));
+    EXPECT_FALSE(CredRequestUtil::Logout(&cred, &sess));
+    EXPECT_TRUE(LogHas("Logout response is invalid")) << LogDump();
+}
+
+TEST_F(WebApiAuthTest, LogoutRefusesMissingInputs) {
+    int id = StoreCred();
+    EXPECT_FALSE(CredRequestUtil::Logout(static_cast<long>(id)));
+    EXPECT_TRUE(LogHas("Cannot find id[" + std::to_string(id) + "] in sess")) << LogDump();
+    EXPECT_FALSE(CredRequestUtil::Logout(777L));
+    EXPECT_TRUE(LogHas("Cannot find id[777] in cred"));
+    KOVA_CRED cred;
+    FillCred(cred);
+    EXPECT_FALSE(CredRequestUtil::Logout(&cred, std::string()));
+    EXPECT_FALSE(CredRequestUtil::Logout(&cred, static_cast<KOVA_CRED_SESS *>(nullptr)));
+    EXPECT_EQ(2u, LogCount("Bad parameters"));
+    EXPECT_EQ(0u, Server().RequestCount());
+}
+
+// Login and logout answers that cannot be used.
+class WebApiBadAnswerTest : public WebApiAuthTest,
+                            public ::testing::WithParamInterface<const char *> {};
+
+TEST_P(WebApiBadAnswerTest, IsAnInvalidResponse) {
+    const std::string body = GetParam();
+    kovasim::LoopbackServer bad;
+    bad.Route("*", "/webapi/auth.cgi", [body](const httplib::Request &, httplib::Response &res) {
+        res.set_content(body, "application/json");
+    });
+    Sim().Install(bad);  // discovery and encryption from the simulator
+    ASSERT_TRUE(bad.Start());
+    KOVA_CRED cred;
+    FillCred(cred);
+    cred.port = bad.Port();
+    cred.id = 99;  // not stored: nothing to write back
+    KOVA_CRED_SESS sess;
+    Json::Value response(Json::objectValue);
+    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "", &sess, &response));
+    EXPECT_TRUE(LogHas("Login response is invalid")) << LogDump();
+    EXPECT_EQ(0, sess.filled);
+    EXPECT_EQ(ParseBody(body), response);
+
+    // A logout needs nothing but "success" true.
+    Json::Value answer = ParseBody(body);
+    const bool logoutUsable =
+        answer.isObject() && answer["success"].isBool() && answer["success"].asBool();
+    ClearLog();
+    EXPECT_EQ(logoutUsable, CredRequestUtil::Logout(&cred, "SID"));
+    EXPECT_EQ(!logoutUsable, LogHas("Logout response is invalid")) << LogDump();
+}
+
+INSTANTIATE_TEST_SUITE_P(Answers, WebApiBadAnswerTest,
+                         ::testing::Values("<html>login</html>", "{\"success\":false}",
+                                           "{\"success\":true}", "{\"success\":\"yes\"}",
+                                           "{\"success\":true,\"data\":\"sid\"}", "[1,2]", ""));
+
+TEST_F(WebApiAuthTest, LoginTransferFailureIsReported) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    CredRequestUtil::GetWebAPIDesc(&cred);  // cached, so only the login itself fails
+    kovasim::LoopbackServer failing;
+    failing.Route("*", "/webapi/.*",
+                  [](const httplib::Request &, httplib::Response &res) { res.status = 503; });
+    ASSERT_TRUE(failing.Start());
+    // Same id, other server: the description comes from the cache.
+    cred.port = failing.Port();
+    EXPECT_FALSE(CredRequestUtil::Login(&cred, nullptr));
+    EXPECT_TRUE(LogHas("Send login request fail.[13]")) << LogDump();
+}
+
+class WebApiRedirectTest : public WebApiAuthTest {
+  protected:
+    void SetUp() override {
+        WebApiAuthTest::SetUp();
+        kovasim::LoopbackServer::Options tls;
+        tls.https = true;
+        https_ = std::make_unique<kovasim::LoopbackServer>(tls);
+        Sim().Install(*https_);
+        ASSERT_TRUE(https_->Start());
+        redirect_ = std::make_unique<kovasim::LoopbackServer>();
+        kovasim::WebApiSim::InstallRedirect(*redirect_, https_->Port());
+        ASSERT_TRUE(redirect_->Start());
+    }
+    void TearDown() override {
+        redirect_.reset();
+        https_.reset();
+        WebApiAuthTest::TearDown();
+    }
+    std::unique_ptr<kovasim::LoopbackServer> https_;
+    std::unique_ptr<kovasim::LoopbackServer> redirect_;
+};
+
+TEST_F(WebApiRedirectTest, PlainHttpCredentialFollowsTheServersRedirect) {
+    for (const char *protocol : {"http", "Http", "HTTP"}) {
+        KOVA_CRED cred;
+        FillCred(cred);
+        cred.protocol = protocol;
+        cred.port = redirect_->Port();
+        redirect_->ClearRecords();
+        ASSERT_TRUE(CredRequestUtil::CheckRedirect(&cred)) << protocol << LogDump();
+        EXPECT_EQ("https", cred.protocol);
+        EXPECT_EQ("127.0.0.1", cred.host);
+        EXPECT_EQ(https_->Port(), cred.port);
+        ASSERT_EQ(1u, redirect_->RequestCount());
+        EXPECT_EQ("/webapi/query.cgi", redirect_->Last().path);
+    }
+}
+
+TEST_F(WebApiRedirectTest, HttpsCredentialsAreNeverProbed) {
+    for (const char *protocol : {"https", "HTTPS", "Https"}) {
+        KOVA_CRED cred;
+        FillCred(cred);
+        cred.protocol = protocol;
+        cred.port = redirect_->Port();
+        EXPECT_TRUE(CredRequestUtil::CheckRedirect(&cred));
+        EXPECT_EQ(protocol, cred.protocol);
+        EXPECT_EQ(redirect_->Port(), cred.port);
+    }
+    EXPECT_EQ(0u, redirect_->RequestCount());
+    EXPECT_FALSE(CredRequestUtil::CheckRedirect(nullptr));
+}
+
+TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTarget) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    cred.port = redirect_->Port();
+    KOVA_CRED_SESS sess;
+    ASSERT_TRUE(CredRequestUtil::Login(&cred, &sess)) << LogDump();
+    EXPECT_TRUE(Sim().SessionValid(sess.access_token));
+    EXPECT_EQ("https", cred.protocol);
+    EXPECT_EQ(https_->Port(), cred.port);
+    EXPECT_EQ(1u, https_->CountPath("/webapi/auth.cgi"));
+}
+
+TEST_F(WebApiRedirectTest, RefusedProbeLetsTheRequestReportItsOwnError) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    {
+        kovasim::LoopbackServer closed;
+        ASSERT_TRUE(closed.Start());
+        cred.port = closed.Port();
+    }
+    int port = cred.port;
+    EXPECT_TRUE(CredRequestUtil::CheckRedirect(&cred));
+    EXPECT_EQ("http", cred.protocol);
+    EXPECT_EQ(port, cred.port);
+    EXPECT_FALSE(CredRequestUtil::Login(&cred, nullptr));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, CredRequestUtil::m_errCode);
+}
+
+TEST_F(WebApiRedirectTest, RedirectWithoutUsableLocationFails) {
+    kovasim::LoopbackServer odd;
+    odd.Route("*", "/webapi/query.cgi", [](const httplib::Request &req, httplib::Response &res) {
+        res.status = 302;
+        if (req.has_header("X-Unused")) {
+            return;
+        }
+        res.set_header("X-Note", "no location");
+    });
+    odd.Route("*", "/bad/.*",
+              [](const httplib::Request &, httplib::Response &res) { res.status = 302; });
+    ASSERT_TRUE(odd.Start());
+    KOVA_CRED cred;
+    FillCred(cred);
+    cred.port = odd.Port();
+    EXPECT_FALSE(CredRequestUtil::CheckRedirect(&cred));
+    EXPECT_TRUE(LogHas("Return 302, but no Location in header.")) << LogDump();
+    EXPECT_FALSE(CredRequestUtil::Login(&cred, nullptr));
+    EXPECT_TRUE(LogHas("CheckRedirect failed.")) << LogDump();
+
+    kovasim::LoopbackServer unparsable;
+    unparsable.Route("*", "/webapi/query.cgi",
+                     [](const httplib::Request &, httplib::Response &res) {
+                         res.set_redirect("https://[fe80::1", 302);
+                     });
+    ASSERT_TRUE(unparsable.Start());
+    cred.port = unparsable.Port();
+    EXPECT_FALSE(CredRequestUtil::CheckRedirect(&cred));
+    EXPECT_TRUE(LogHas("Can not identify 302 Location: https://[fe80::1.")) << LogDump();
+}
+
+TEST_F(WebApiAuthTest, SetWebApiUrlPlacesStandardParametersByFormat) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    CredRequest json;
+    ASSERT_TRUE(CredRequestUtil::SetWebAPIURL(&cred, "KOVA.Demo.Json", 1, "get", &json));
+    EXPECT_EQ("JSON", json.GetRequestFormat());
+    EXPECT_EQ("http://127.0.0.1:" + std::to_string(Server().Port()) + "/webapi/entry.cgi",
+              json.GetURL());
+    ASSERT_TRUE(json.Process(true, 0));
+    kovasim::RecordedRequest wire = Server().Last();
+    EXPECT_NE(std::string::npos, wire.query.find("api="));
+    EXPECT_NE(std::string::npos, wire.query.find("method="));
+    EXPECT_EQ(std::string::npos, wire.body.find("api="));
+    EXPECT_TRUE(ParseBody(json.GetResponse())["success"].asBool()) << json.GetResponse();
+
+    CredRequest plain;
+    ASSERT_TRUE(CredRequestUtil::SetWebAPIURL(&cred, "KOVA.Demo.Echo", 2, "echo", &plain));
+    EXPECT_EQ("", plain.GetRequestFormat());
+    ASSERT_TRUE(plain.Process(true, 0));
+    wire = Server().Last();
+    EXPECT_EQ("", wire.query);
+    EXPECT_EQ("KOVA.Demo.Echo", wire.Param("api"));
+    EXPECT_EQ("2", wire.Param("version"));
+    EXPECT_EQ("echo", wire.Param("method"));
+
+    CredRequest unknown;
+    EXPECT_FALSE(CredRequestUtil::SetWebAPIURL(&cred, "KOVA.No.Such", 1, "x", &unknown));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NO_SUCH_API, unknown.GetError());
+    EXPECT_TRUE(LogHas("GetWebAPIPath fail![KOVA.No.Such]")) << LogDump();
+    EXPECT_FALSE(CredRequestUtil::SetWebAPIURL(&cred, "KOVA.Demo.Echo", 0, "x", &unknown));
+    EXPECT_FALSE(CredRequestUtil::SetWebAPIURL(nullptr, "KOVA.Demo.Echo", 1, "x", &unknown));
+}
+
+}  // namespace
+}  // namespace kova_test

@@ -1,0 +1,353 @@
+// WebAPI request factories and the request's own login, checked on the wire of the
+// in-process simulator.
+#include <stdio.h>
+
+#include <memory>
+#include <set>
+#include <string>
+
+#include "webapi_fixture.h"
+
+namespace kova_test {
+namespace {
+
+using KOVA::CredRequest;
+using KOVA::CredRequestUtil;
+
+struct FileCloser {
+    void operator()(FILE *f) const { fclose(f); }
+};
+using File = std::unique_ptr<FILE, FileCloser>;
+
+File StreamWith(const std::string &text) {
+    File f(tmpfile());
+    fputs(text.c_str(), f.get());
+    rewind(f.get());
+    return f;
+}
+
+std::set<std::string> ParamNames(const kovasim::RecordedRequest &r) {
+    std::set<std::string> names;
+    for (const auto &p : r.params) {
+        names.insert(p.first);
+    }
+    return names;
+}
+
+class WebApiFactoryTest : public WebApiTest {
+  protected:
+    std::string EntryUrl() const { return Server().BaseUrl() + "/webapi/entry.cgi"; }
+};
+
+TEST_F(WebApiFactoryTest, RecordFormSendsSessionAsPostCookieAndTokenInQuery) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    KOVA_CRED_SESS sess;
+    sess.access_token = "S1";
+    sess.csrf_token = "T1";
+    Json::Value params;
+    params["x"] = "1";
+    std::unique_ptr<CredRequest> request(
+        CredRequest::CreateWebAPIRequest(&cred, &sess, "KOVA.Demo.Echo", 2, "echo", params));
+    ASSERT_TRUE(request) << LogDump();
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError());
+    ASSERT_TRUE(request->Process(true, 0));
+
+    kovasim::RecordedRequest wire = Server().Last();
+    EXPECT_EQ("/webapi/entry.cgi", wire.path);
+    EXPECT_EQ("POST", wire.method);
+    // The token is appended behind the (here empty) encoded query parameters.
+    EXPECT_EQ("&KovaToken=T1", wire.query);
+    EXPECT_EQ("T1", wire.Param("KovaToken"));
+    EXPECT_EQ("id=S1", wire.Header("Cookie"));
+    EXPECT_EQ((std::set<std::string>{"KovaToken", "_sid", "api", "method", "version", "x"}),
+              ParamNames(wire));
+    EXPECT_EQ("S1", wire.Param("_sid"));
+    EXPECT_NE(std::string::npos, wire.body.find("_sid=S1"));
+    Json::Value answer = ParseBody(request->GetResponse());
+    EXPECT_EQ("1", answer["data"]["params"]["x"].asString());
+}
+
+TEST_F(WebApiFactoryTest, EmptySessionStillSendsSidButNoCookieOrToken) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    KOVA_CRED_SESS sess;
+    CredRequest request;
+    ASSERT_TRUE(CredRequest::CreateWebAPIRequest(&request, &cred, &sess, "KOVA.Demo.Echo", 1,
+                                                 "echo", Json::Value()));
+    ASSERT_TRUE(request.Process(true, 0));
+    kovasim::RecordedRequest wire = Server().Last();
+    EXPECT_TRUE(wire.HasParam("_sid"));
+    EXPECT_EQ("", wire.Param("_sid"));
+    EXPECT_FALSE(wire.HasHeader("Cookie"));
+    EXPECT_EQ("", wire.query);
+    EXPECT_EQ((std::set<std::string>{"_sid", "api", "method", "version"}), ParamNames(wire));
+}
+
+TEST_F(WebApiFactoryTest, JsonFormatApiGetsJsonEncodedValues) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    KOVA_CRED_SESS sess;
+    Json::Value params;
+    params["count"] = 5;
+    params["name"] = "kova";
+    std::unique_ptr<CredRequest> request(
+        CredRequest::CreateWebAPIRequest(&cred, &sess, "KOVA.Demo.Json", 1, "get", params));
+    ASSERT_TRUE(request);
+    EXPECT_EQ("JSON", request->GetRequestFormat());
+    ASSERT_TRUE(request->Process(true, 0));
+    Json::Value answer = ParseBody(request->GetResponse());
+    ASSERT_TRUE(answer["success"].asBool()) << request->GetResponse();
+    EXPECT_TRUE(answer["data"]["params"]["count"].isInt());
+    EXPECT_EQ(5, answer["data"]["params"]["count"].asInt());
+    EXPECT_EQ("kova", answer["data"]["params"]["name"].asString());
+}
+
+TEST_F(WebApiFactoryTest, FillFormErrorCodes) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    KOVA_CRED_SESS sess;
+    EXPECT_FALSE(CredRequest::CreateWebAPIRequest(nullptr, &cred, &sess, "KOVA.Demo.Echo", 1,
+                                                  "echo", Json::Value()));
+    EXPECT_EQ(1u, LogCount("cred_request:"));
+
+    struct Case {
+        const KOVA_CRED *cred;
+        const KOVA_CRED_SESS *sess;
+        const char *api;
+        int version;
+        const char *method;
+    } cases[] = {{&cred, &sess, "KOVA.Demo.Echo", 0, "echo"},
+                 {&cred, &sess, "KOVA.Demo.Echo", -3, "echo"},
+                 {&cred, &sess, "", 1, "echo"},
+                 {&cred, &sess, "KOVA.Demo.Echo", 1, ""},
+                 {nullptr, &sess, "KOVA.Demo.Echo", 1, "echo"},
+                 {&cred, nullptr, "KOVA.Demo.Echo", 1, "echo"}};
+    for (const auto &c : cases) {
+        CredRequest request;
+        EXPECT_FALSE(CredRequest::CreateWebAPIRequest(&request, c.cred, c.sess, c.api, c.version,
+                                                      c.method, Json::Value()));
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, request.GetError());
+        EXPECT_EQ(nullptr, CredRequest::CreateWebAPIRequest(c.cred, c.sess, c.api, c.version,
+                                                            c.method, Json::Value()));
+    }
+    EXPECT_EQ(13u, LogCount("Bad parameters")) << LogDump();
+    EXPECT_EQ(6u, LogCount("Create CredRequest fail"));
+    EXPECT_EQ(0u, Server().RequestCount());
+
+    // A failed API look-up leaves the utilities' error in the request.
+    CredRequest unknown;
+    EXPECT_FALSE(CredRequest::CreateWebAPIRequest(&unknown, &cred, &sess, "KOVA.No.Such", 1, "x",
+                                                  Json::Value()));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NO_SUCH_API, unknown.GetError());
+    EXPECT_TRUE(LogHas("SetWebAPIURL fail")) << LogDump();
+
+    // Parameters that are not an object are refused after the URL is set.
+    CredRequest badParams;
+    Json::Value list(Json::arrayValue);
+    list.append(1);
+    EXPECT_FALSE(CredRequest::CreateWebAPIRequest(&badParams, &cred, &sess, "KOVA.Demo.Echo", 1,
+                                                  "echo", list));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, badParams.GetError());
+
+    // Success clears an error the request carried in.
+    CredRequest reused;
+    reused.SetError(KOVA::CRED_REQ_ERR_HTTP_CLIENT);
+    EXPECT_TRUE(CredRequest::CreateWebAPIRequest(&reused, &cred, &sess, "KOVA.Demo.Echo", 1, "echo",
+                                                 Json::Value()));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, reused.GetError());
+}
+
+TEST_F(WebApiFactoryTest, UnreachableServerLeavesQueryFailure) {
+    KOVA_CRED cred;
+    FillCred(cred);
+    {
+        kovasim::LoopbackServer closed;
+        ASSERT_TRUE(closed.Start());
+        cred.port = closed.Port();
+    }
+    KOVA_CRED_SESS sess;
+    CredRequest request;
+    EXPECT_FALSE(CredRequest::CreateWebAPIRequest(&request, &cred, &sess, "KOVA.Demo.Echo", 1,
+                                                  "echo", Json::Value()));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, request.GetError());
+}
+
+TEST_F(WebApiFactoryTest, CredentialIdFormLogsInOnceAndReusesTheSession) {
+    int id = StoreCred();
+    size_t logins = Sim().Hits("KOVA.API.Auth");
+    std::unique_ptr<CredRequest> first(
+        CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Session", 1, "whoami", Json::Value()));
+    ASSERT_TRUE(first) << LogDump();
+    EXPECT_EQ(logins + 1, Sim().Hits("KOVA.API.Auth"));
+    ASSERT_TRUE(first->Process(true, 0));
+    Json::Value answer = ParseBody(first->GetResponse());
+    ASSERT_TRUE(answer["success"].asBool()) << first->GetResponse();
+    EXPECT_EQ("admin", answer["data"]["account"].asString());
+
+    std::unique_ptr<CredRequest> second(
+        CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Session", 1, "whoami", Json::Value()));
+    ASSERT_TRUE(second);
+    EXPECT_EQ(logins + 1, Sim().Hits("KOVA.API.Auth"));
+    ASSERT_TRUE(second->Process(true, 0));
+    EXPECT_TRUE(ParseBody(second->GetResponse())["success"].asBool());
+
+    EXPECT_EQ(nullptr,
+              CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Echo", 0, "echo", Json::Value()));
+    EXPECT_TRUE(LogHas("Bad parameters"));
+}
+
+TEST_F(WebApiFactoryTest, CredentialIdFormFailsForUnknownIdOrFailedLogin) {
+    EXPECT_EQ(nullptr,
+              CredRequest::CreateWebAPIRequest(999L, "KOVA.Demo.Echo", 1, "echo", Json::Value()));
+    EXPECT_TRUE(LogHas("GetAccessToken fail")) << LogDump();
+
+    ClearLog();
+    int id = StoreCred("admin", "wrong");
+    EXPECT_EQ(nullptr,
+              CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Echo", 1, "echo", Json::Value()));
+    EXPECT_TRUE(LogHas("GetAccessToken fail")) << LogDump();
+}
+
+TEST_F(WebApiFactoryTest, RelayRequestReadsItsBodyFromTheStreams) {
+    int id = StoreCred();
+    File in = StreamWith("IN-BODY");
+    File out = StreamWith("OUT-BODY");
+    Json::Value headers;
+    headers["X-Relay"] = "yes";
+    std::unique_ptr<CredRequest> both(CredRequest::CreateRelayRequest(
+        id, "KOVA.Demo.Echo", 1, "echo", headers, in.get(), out.get()));
+    ASSERT_TRUE(both) << LogDump();
+    both->Process(true, 0);
+    kovasim::RecordedRequest wire = Server().Last();
+    EXPECT_EQ("OUT-BODY", wire.body);
+    EXPECT_EQ("yes", wire.Header("X-Relay"));
+    EXPECT_NE(std::string::npos, wire.Header("Cookie").find("id="));
+
+    rewind(in.get());
+    std::unique_ptr<CredRequest> onlyIn(CredRequest::CreateRelayRequest(
+        id, "KOVA.Demo.Echo", 1, "echo", Json::Value(), in.get(), nullptr));
+    ASSERT_TRUE(onlyIn);
+    onlyIn->Process(true, 0);
+    EXPECT_EQ("IN-BODY", Server().Last().body);
+    EXPECT_FALSE(Server().Last().HasHeader("X-Relay"));
+
+    Json::Value notHeaders(Json::arrayValue);
+    notHeaders.append("X-A: 1");
+    EXPECT_EQ(nullptr, CredRequest::CreateRelayRequest(id, "KOVA.Demo.Echo", 1, "echo", notHeaders,
+                                                       nullptr, nullptr));
+    EXPECT_EQ(nullptr,
+              CredRequest::CreateRelayRequest(id, "", 1, "echo", headers, nullptr, nullptr));
+    EXPECT_EQ(2u, LogCount("Bad parameters")) << LogDump();
+}
+
+TEST_F(WebApiFactoryTest, ProcessWithLoginAttachesAFreshSession) {
+    CredRequest unknown;
+    unknown.SetURL(EntryUrl());
+    EXPECT_FALSE(unknown.ProcessWithLogin(999, true, 0));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_FAIL, unknown.GetError());
+    EXPECT_EQ(0u, Server().RequestCount());
+    EXPECT_EQ(nullptr, unknown.GetCurlHandler());
+
+    int id = StoreCred();
+    CredRequest request;
+    request.SetURL(EntryUrl());
+    request.AddPostParam("api", "KOVA.Demo.Session");
+    request.AddPostParam("version", "1");
+    request.AddPostParam("method", "whoami");
+    ASSERT_TRUE(request.ProcessWithLogin(id, true, 0)) << LogDump();
+    Json::Value answer = ParseBody(request.GetResponse());
+    ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
+    EXPECT_EQ("admin", answer["data"]["account"].asString());
+    kovasim::RecordedRequest wire = Server().Last();
+    EXPECT_TRUE(wire.HasParam("KovaToken"));
+    EXPECT_EQ("", wire.query);
+}
+
+TEST_F(WebApiFactoryTest, RequestLoginAndLogout) {
+    CredRequest empty;
+    EXPECT_FALSE(empty.Login("", "pw", ""));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, empty.GetError());
+
+    CredRequest badUrl;
+    EXPECT_FALSE(badUrl.Login("admin", "secret", "https://[fe80::1"));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, badUrl.GetError());
+    EXPECT_TRUE(LogHas("parseURL Failed: https://[fe80::1")) << LogDump();
+
+    CredRequest noAccount;
+    noAccount.SetURL(EntryUrl());
+    EXPECT_FALSE(noAccount.Login("", "secret"));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, noAccount.GetError());
+
+    CredRequest wrong;
+    wrong.SetURL(EntryUrl());
+    EXPECT_FALSE(wrong.Login("admin", "nope"));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_SESSION, wrong.GetError());
+    EXPECT_FALSE(wrong.Logout());
+
+    CredRequest request;
+    request.SetURL(EntryUrl());
+    request.AddPostParam("api", "KOVA.Demo.Session");
+    request.AddPostParam("version", "1");
+    request.AddPostParam("method", "whoami");
+    ASSERT_TRUE(request.Login("admin", "secret")) << LogDump();
+    ASSERT_TRUE(request.Process(true, 0));
+    Json::Value answer = ParseBody(request.GetResponse());
+    ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
+    kovasim::RecordedRequest wire = Server().Last();
+    const std::string sid = wire.Param("_sid");
+    EXPECT_NE(std::string::npos, wire.query.find("_sid=" + sid));
+    EXPECT_NE(std::string::npos, wire.query.find("KovaToken="));
+    EXPECT_EQ("id=" + sid, wire.Header("Cookie"));
+    EXPECT_TRUE(Sim().SessionValid(sid));
+
+    EXPECT_TRUE(request.Logout()) << LogDump();
+    EXPECT_FALSE(Sim().SessionValid(sid));
+}
+
+TEST_F(WebApiFactoryTest, ApiValidityUsesTheRequestsUrl) {
+    CredRequest request;
+    request.SetURL(EntryUrl());
+    EXPECT_TRUE(request.isAPIValid("KOVA.Demo.Echo"));
+    EXPECT_FALSE(request.isAPIValid("KOVA.No.Such"));
+    EXPECT_TRUE(CredRequestUtil::IsCredIdCached(-1));
+    // An API the server does not list is never cached, so asking for it queries again.
+    EXPECT_EQ(2u, PathCount("/webapi/query.cgi"));
+    EXPECT_TRUE(request.isAPIValid("KOVA.Demo.Echo"));
+    EXPECT_EQ(2u, PathCount("/webapi/query.cgi"));
+
+    CredRequest noUrl;
+    EXPECT_FALSE(noUrl.isAPIValid("KOVA.Demo.Echo"));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, noUrl.GetError());
+
+    // A port that is not a number becomes 0; the build itself succeeds.
+    CredRequest oddPort;
+    oddPort.SetURL("http://127.0.0.1:abc/webapi/entry.cgi");
+    CredRequestUtil::m_jsData = Json::Value();
+    EXPECT_FALSE(oddPort.isAPIValid("KOVA.Demo.Echo"));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, oddPort.GetError());
+    EXPECT_TRUE(LogHas("127.0.0.1:0/webapi/query.cgi")) << LogDump();
+}
+
+TEST_F(WebApiFactoryTest, SetWebApiRequestUsesTheRequestsOwnCredential) {
+    CredRequest request;
+    request.SetURL(EntryUrl());
+    ASSERT_TRUE(request.Login("admin", "secret"));
+    Json::Value params;
+    params["a"] = "b";
+    ASSERT_TRUE(request.SetWebAPIRequest("KOVA.Demo.Echo", 1, "echo", params)) << LogDump();
+    ASSERT_TRUE(request.Process(true, 0));
+    Json::Value answer = ParseBody(request.GetResponse());
+    ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
+    EXPECT_EQ("b", answer["data"]["params"]["a"].asString());
+    EXPECT_EQ("KOVA.Demo.Echo", answer["data"]["api"].asString());
+
+    CredRequest fresh;
+    EXPECT_FALSE(fresh.SetWebAPIRequest("KOVA.Demo.Echo", 0, "echo", params));
+    EXPECT_FALSE(fresh.SetWebAPIRequest("", 1, "echo", params));
+    EXPECT_EQ(2u, LogCount("Bad parameters"));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, fresh.GetError());
+}
+
+}  // namespace
+}  // namespace kova_test

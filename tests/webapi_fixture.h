@@ -1,0 +1,97 @@
+// Shared set-up of the WebAPI tests: one in-process simulator per test program (its RSA key
+// is made once), a fresh temporary credential database, an empty description cache and empty
+// log and request records for every test.
+#ifndef KOVA_TESTS_WEBAPI_FIXTURE_H
+#define KOVA_TESTS_WEBAPI_FIXTURE_H
+
+#include <memory>
+#include <string>
+
+#include <gtest/gtest.h>
+
+#include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_util.h"
+#include "kovacredential/kovacred.h"
+#include "kovacredential/kovacredsetter.h"
+#include "platform/json_text.h"
+#include "simlib/loopback_server.h"
+#include "simlib/webapi_sim.h"
+#include "support/interpose.h"
+#include "support/temp_dir.h"
+
+namespace kova_test {
+
+class WebApiTest : public ::testing::Test {
+  protected:
+    static void SetUpTestSuite() {
+        sim_ = new kovasim::WebApiSim();
+        kovasim::LoopbackServer::Options options;
+        options.threads = 32;
+        server_ = new kovasim::LoopbackServer(options);
+        sim_->Install(*server_);
+        ASSERT_TRUE(server_->Start()) << server_->Error();
+    }
+    static void TearDownTestSuite() {
+        server_->Stop();
+        delete server_;
+        delete sim_;
+        server_ = nullptr;
+        sim_ = nullptr;
+    }
+
+    void SetUp() override {
+        KOVA::CredRequestUtil::m_jsData = Json::Value();
+        KOVA::CredRequestUtil::m_errCode = 0;
+        db_ = std::make_unique<TempDatabase>();
+        server_->ClearRecords();
+        ClearLog();
+    }
+    void TearDown() override { db_.reset(); }
+
+    static kovasim::WebApiSim &Sim() { return *sim_; }
+    static kovasim::LoopbackServer &Server() { return *server_; }
+
+    // A credential record for the simulator (not stored).
+    static void FillCred(KOVA_CRED &cred, const std::string &account = "admin",
+                         const std::string &password = "secret",
+                         const std::string &application = "") {
+        cred.protocol = "http";
+        cred.host = "127.0.0.1";
+        cred.port = Server().Port();
+        cred.remote_account = account;
+        cred.remote_passwd = password;
+        cred.application = application;
+    }
+
+    // Stores a credential for the simulator; returns its id.
+    static int StoreCred(const std::string &account = "admin",
+                         const std::string &password = "secret",
+                         const std::string &application = "") {
+        KOVA_CRED cred;
+        FillCred(cred, account, password, application);
+        EXPECT_EQ(0, KOVACredAdd(&cred));
+        EXPECT_GT(cred.id, 0);
+        return cred.id;
+    }
+
+    // Requests that reached `path` and named `api` (wire parameters or the simulator's
+    // records).
+    static size_t PathCount(const std::string &path) { return Server().CountPath(path); }
+
+    static Json::Value ParseBody(const std::string &body) {
+        Json::Value v;
+        kova::JsonFromString(body, v);
+        return v;
+    }
+
+    std::unique_ptr<TempDatabase> db_;
+    static kovasim::WebApiSim *sim_;
+    static kovasim::LoopbackServer *server_;
+};
+
+inline kovasim::WebApiSim *WebApiTest::sim_ = nullptr;
+inline kovasim::LoopbackServer *WebApiTest::server_ = nullptr;
+
+}  // namespace kova_test
+
+#endif  // KOVA_TESTS_WEBAPI_FIXTURE_H
