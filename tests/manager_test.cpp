@@ -1,0 +1,356 @@
+// The request manager with plain requests against loopback servers: ownership and slots,
+// concurrent runs, set-up failures, silent and refusing servers, and the socket callback.
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <memory>
+#include <string>
+#include <thread>
+
+#include <gtest/gtest.h>
+
+#include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_mgr.h"
+#include "simlib/loopback_server.h"
+#include "support/interpose.h"
+
+namespace {
+
+using KOVA::CredRequest;
+using KOVA::CredRequestMgr;
+using Clock = std::chrono::steady_clock;
+
+// A loopback socket that listens but never accepts: connections complete in the kernel and
+// then hear nothing.
+class SilentListener {
+  public:
+    SilentListener() {
+        fd_ = socket(AF_INET, SOCK_STREAM, 0);
+        sockaddr_in addr{};
+        addr.sin_family = AF_INET;
+        addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        socklen_t len = sizeof(addr);
+        if (fd_ >= 0 && bind(fd_, reinterpret_cast<sockaddr *>(&addr), sizeof(addr)) == 0 &&
+            listen(fd_, 16) == 0 &&
+            getsockname(fd_, reinterpret_cast<sockaddr *>(&addr), &len) == 0) {
+            port_ = ntohs(addr.sin_port);
+        }
+    }
+    ~SilentListener() {
+        if (fd_ >= 0) {
+            close(fd_);
+        }
+    }
+    int Port() const { return port_; }
+
+  private:
+    int fd_ = -1;
+    int port_ = 0;
+};
+
+// A loopback port that nobody listens on: bound once to learn a free number, then released.
+int RefusingPort() {
+    int fd = socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in addr{};
+    addr.sin_family = AF_INET;
+    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t len = sizeof(addr);
+    int port = 0;
+    if (fd >= 0 && bind(fd, reinterpret_cast<sockaddr *>(&addr), sizeof(addr)) == 0 &&
+        getsockname(fd, reinterpret_cast<sockaddr *>(&addr), &len) == 0) {
+        port = ntohs(addr.sin_port);
+    }
+    if (fd >= 0) {
+        close(fd);
+    }
+    return port;
+}
+
+class ManagerTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        kovasim::LoopbackServer::Options options;
+        options.threads = 32;
+        server_ = std::make_unique<kovasim::LoopbackServer>(options);
+        server_->Route("*", "/hello", [](const httplib::Request &, httplib::Response &res) {
+            res.set_content("hello", "text/plain");
+        });
+        // Answers after 300 ms with "slow <n>", n taken from the query.
+        server_->Route("*", "/slow", [](const httplib::Request &req, httplib::Response &res) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(300));
+            res.set_content("slow " + req.get_param_value("n"), "text/plain");
+        });
+        ASSERT_TRUE(server_->Start()) << server_->Error();
+        kova_test::ClearLog();
+    }
+    void TearDown() override { server_->Stop(); }
+
+    std::string Url(const std::string &target) const { return server_->BaseUrl() + target; }
+
+    // A new request for `url`, owned by the caller.
+    static CredRequest *NewRequest(const std::string &url) {
+        auto *request = new CredRequest();
+        EXPECT_TRUE(request->SetURL(url)) << url;
+        return request;
+    }
+
+    std::unique_ptr<kovasim::LoopbackServer> server_;
+};
+
+TEST_F(ManagerTest, EmptyManagerRunsSuccessfully) {
+    CredRequestMgr mgr;
+    EXPECT_TRUE(mgr.IsEmpty());
+    EXPECT_EQ(0, mgr.Size());
+    EXPECT_TRUE(mgr.Run());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+    EXPECT_TRUE(mgr.IsEmpty());
+    EXPECT_EQ(Json::Value(Json::arrayValue), mgr.GetAllResponse());
+    EXPECT_EQ(0u, server_->RequestCount());
+}
+
+TEST_F(ManagerTest, BadIndexesGiveErrorOne) {
+    CredRequestMgr mgr;
+    CredRequest *request = NewRequest(Url("/hello"));
+    ASSERT_EQ(0, mgr.AddCredRequest(request));
+
+    EXPECT_EQ(nullptr, mgr.GetRequest(-1));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
+
+    mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
+    EXPECT_EQ(nullptr, mgr.GetRequest(mgr.Size()));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
+
+    mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
+    EXPECT_EQ("", mgr.GetResponse(1));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
+
+    mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
+    EXPECT_EQ(nullptr, mgr.RemoveRequest(-1));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
+    EXPECT_EQ(request, mgr.GetRequest(0));
+
+    // The manager never clears its error by itself.
+    EXPECT_EQ(request, mgr.GetRequest(0));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
+}
+
+TEST_F(ManagerTest, AddingAssignsConsecutiveIndexes) {
+    CredRequestMgr mgr;
+    CredRequest *first = NewRequest(Url("/hello"));
+    CredRequest *second = NewRequest(Url("/hello"));
+    CredRequest *third = NewRequest(Url("/hello"));
+    EXPECT_EQ(0, mgr.AddCredRequest(first));
+    EXPECT_EQ(1, mgr.AddCredRequest(second));
+    EXPECT_EQ(2, mgr.AddCredRequest(third));
+    EXPECT_EQ(3, mgr.Size());
+    EXPECT_FALSE(mgr.IsEmpty());
+    EXPECT_EQ(first, mgr.GetRequest(0));
+    EXPECT_EQ(second, mgr.GetRequest(1));
+    EXPECT_EQ(third, mgr.GetRequest(2));
+
+    mgr.Clear();
+    EXPECT_TRUE(mgr.IsEmpty());
+    EXPECT_EQ(0, mgr.Size());
+    EXPECT_EQ(0, mgr.AddCredRequest(NewRequest(Url("/hello"))));
+}
+
+TEST_F(ManagerTest, RemoveRequestKeepsSizeAndIndexes) {
+    CredRequestMgr mgr;
+    CredRequest *first = NewRequest(Url("/hello"));
+    CredRequest *second = NewRequest(Url("/slow?n=2"));
+    ASSERT_EQ(0, mgr.AddCredRequest(first));
+    ASSERT_EQ(1, mgr.AddCredRequest(second));
+
+    std::unique_ptr<CredRequest> removed(mgr.RemoveRequest(0));
+    EXPECT_EQ(first, removed.get());
+    EXPECT_EQ(2, mgr.Size());
+    EXPECT_EQ(nullptr, mgr.GetRequest(0));
+    EXPECT_EQ(second, mgr.GetRequest(1));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+
+    // The removed request is not run; the one still held is.
+    EXPECT_TRUE(mgr.Run());
+    EXPECT_EQ(1u, server_->RequestCount());
+    EXPECT_EQ("slow 2", mgr.GetResponse(1));
+    EXPECT_EQ("", removed->GetResponse());
+    Json::Value all = mgr.GetAllResponse();
+    ASSERT_EQ(2u, all.size());
+    EXPECT_EQ("", all[0].asString());
+    EXPECT_EQ("slow 2", all[1].asString());
+}
+
+TEST_F(ManagerTest, InvalidAddFormsCreateNoRequest) {
+    CredRequestMgr mgr;
+    EXPECT_EQ(-1, mgr.AddCredRequest(static_cast<CredRequest *>(nullptr)));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
+
+    std::string host = "127.0.0.1";
+    int port = server_->Port();
+    struct Case {
+        const char *what;
+        std::string protocol, host;
+        int port;
+        std::string api;
+        int version;
+        std::string method;
+    } cases[] = {
+        {"port -1", "http", host, -1, "KOVA.API.Info", 1, "query"},
+        {"version 0", "http", host, port, "KOVA.API.Info", 0, "query"},
+        {"empty protocol", "", host, port, "KOVA.API.Info", 1, "query"},
+        {"empty host", "http", "", port, "KOVA.API.Info", 1, "query"},
+        {"empty api", "http", host, port, "", 1, "query"},
+        {"empty method", "http", host, port, "KOVA.API.Info", 1, ""},
+    };
+    for (const Case &c : cases) {
+        mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
+        EXPECT_EQ(-1, mgr.AddCredRequest(c.protocol, c.host, c.port, "sid", c.api, c.version,
+                                         c.method, Json::Value()))
+            << c.what;
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError()) << c.what;
+    }
+    EXPECT_EQ(0, mgr.Size());
+    EXPECT_EQ(0u, server_->RequestCount());
+}
+
+TEST_F(ManagerTest, DelayedRequestsRunConcurrentlyInAddingOrder) {
+    constexpr int kCount = 10;
+    CredRequestMgr mgr;
+    for (int i = 0; i < kCount; ++i) {
+        ASSERT_EQ(i, mgr.AddCredRequest(NewRequest(Url("/slow?n=" + std::to_string(i)))));
+    }
+    auto start = Clock::now();
+    EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+    double seconds = std::chrono::duration<double>(Clock::now() - start).count();
+    // One after another they would take 3 s.
+    EXPECT_LT(seconds, 2.0);
+    EXPECT_EQ(static_cast<size_t>(kCount), server_->CountPath("/slow"));
+
+    Json::Value all = mgr.GetAllResponse();
+    ASSERT_TRUE(all.isArray());
+    ASSERT_EQ(static_cast<Json::ArrayIndex>(kCount), all.size());
+    for (int i = 0; i < kCount; ++i) {
+        EXPECT_EQ("slow " + std::to_string(i), all[i].asString());
+        EXPECT_EQ("slow " + std::to_string(i), mgr.GetResponse(i));
+        // libcurl does not call the socket callback from a perform-driven loop, so nothing
+        // marks the requests.
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetRequest(i)->GetError());
+    }
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+}
+
+TEST_F(ManagerTest, SecondRunStartsFromEmptyResponses) {
+    CredRequestMgr mgr;
+    ASSERT_EQ(0, mgr.AddCredRequest(NewRequest(Url("/hello"))));
+    ASSERT_EQ(1, mgr.AddCredRequest(NewRequest(Url("/slow?n=1"))));
+    ASSERT_TRUE(mgr.Run());
+    ASSERT_TRUE(mgr.Run()) << kova_test::LogDump();
+    EXPECT_EQ(4u, server_->RequestCount());
+    EXPECT_EQ("hello", mgr.GetResponse(0));
+    EXPECT_EQ("slow 1", mgr.GetResponse(1));
+}
+
+TEST_F(ManagerTest, RequestWithFailedSetUpIsLeftOut) {
+    CredRequestMgr mgr;
+    ASSERT_EQ(0, mgr.AddCredRequest(NewRequest(Url("/hello"))));
+    auto *noUrl = new CredRequest();
+    ASSERT_EQ(1, mgr.AddCredRequest(noUrl));
+    ASSERT_EQ(2, mgr.AddCredRequest(NewRequest(Url("/slow?n=2"))));
+
+    EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+    EXPECT_EQ(2u, server_->RequestCount());
+    EXPECT_EQ("hello", mgr.GetResponse(0));
+    EXPECT_EQ("", mgr.GetResponse(1));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NO_URL, noUrl->GetError());
+    EXPECT_EQ("slow 2", mgr.GetResponse(2));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+}
+
+TEST_F(ManagerTest, SilentServerEndsRunThroughTimeout) {
+    SilentListener silent;
+    ASSERT_NE(0, silent.Port());
+    std::string silentUrl = "http://127.0.0.1:" + std::to_string(silent.Port()) + "/never";
+    CredRequestMgr mgr;
+    CredRequest *quick = NewRequest(silentUrl);
+    quick->SetResponseTimeout(1);
+    CredRequest *longer = NewRequest(silentUrl);
+    longer->SetResponseTimeout(2);
+    ASSERT_EQ(0, mgr.AddCredRequest(quick));
+    ASSERT_EQ(1, mgr.AddCredRequest(longer));
+    // A request without a time-out of its own counts as 120 s, so this one gets one too.
+    CredRequest *answered = NewRequest(Url("/hello"));
+    answered->SetResponseTimeout(1);
+    ASSERT_EQ(2, mgr.AddCredRequest(answered));
+
+    EXPECT_FALSE(mgr.Run());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, mgr.GetError());
+    // The wait is the largest response time-out of the requests.
+    EXPECT_EQ(1u,
+              kova_test::LogCount("cred_request_mgr:339 curlHandlerProcess select timeout(2): "))
+        << kova_test::LogDump();
+    EXPECT_FALSE(kova_test::LogHas("Exceed max retries times!"));
+    // The answering server was served in the same run.
+    EXPECT_EQ("hello", mgr.GetResponse(2));
+    EXPECT_EQ("", mgr.GetResponse(0));
+}
+
+TEST_F(ManagerTest, RefusedConnectionDoesNotStopTheOthers) {
+    int port = RefusingPort();
+    ASSERT_NE(0, port);
+    CredRequestMgr mgr;
+    ASSERT_EQ(0, mgr.AddCredRequest(NewRequest("http://127.0.0.1:" + std::to_string(port) + "/")));
+    ASSERT_EQ(1, mgr.AddCredRequest(NewRequest(Url("/slow?n=1"))));
+
+    EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+    EXPECT_EQ("", mgr.GetResponse(0));
+    EXPECT_EQ("slow 1", mgr.GetResponse(1));
+    long status = -1;
+    ASSERT_NE(nullptr, mgr.GetRequest(0)->GetCurlHandler());
+    curl_easy_getinfo(mgr.GetRequest(0)->GetCurlHandler(), CURLINFO_RESPONSE_CODE, &status);
+    EXPECT_EQ(0, status);
+}
+
+class SocketCallbackTest : public ManagerTest {};
+
+TEST_F(SocketCallbackTest, RemoveEventMarksTheHeldRequest) {
+    CredRequestMgr mgr;
+    CredRequest *first = NewRequest(Url("/hello"));
+    CredRequest *second = NewRequest(Url("/hello"));
+    ASSERT_EQ(0, mgr.AddCredRequest(first));
+    ASSERT_EQ(1, mgr.AddCredRequest(second));
+    ASSERT_TRUE(first->Process(false, 0));
+    ASSERT_TRUE(second->Process(false, 0));
+    ASSERT_NE(nullptr, second->GetCurlHandler());
+
+    EXPECT_EQ(0, CredRequestMgr::SocketCallback(second->GetCurlHandler(), CURL_SOCKET_BAD,
+                                                CURL_POLL_REMOVE, &mgr, nullptr));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, second->GetError());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, first->GetError());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+}
+
+TEST_F(SocketCallbackTest, OtherEventsAndUnknownHandlesChangeNothing) {
+    CredRequestMgr mgr;
+    CredRequest *request = NewRequest(Url("/hello"));
+    ASSERT_EQ(0, mgr.AddCredRequest(request));
+    ASSERT_TRUE(request->Process(false, 0));
+    CURL *easy = request->GetCurlHandler();
+    ASSERT_NE(nullptr, easy);
+
+    for (int what : {CURL_POLL_NONE, CURL_POLL_IN, CURL_POLL_OUT, CURL_POLL_INOUT}) {
+        EXPECT_EQ(0, CredRequestMgr::SocketCallback(easy, CURL_SOCKET_BAD, what, &mgr, nullptr));
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError()) << what;
+    }
+
+    std::unique_ptr<CURL, void (*)(CURL *)> stranger(curl_easy_init(), curl_easy_cleanup);
+    ASSERT_TRUE(stranger);
+    EXPECT_EQ(0, CredRequestMgr::SocketCallback(stranger.get(), CURL_SOCKET_BAD, CURL_POLL_REMOVE,
+                                                &mgr, nullptr));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+}
+
+}  // namespace
