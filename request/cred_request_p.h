@@ -3,6 +3,7 @@
 #ifndef KOVA_REQUEST_CRED_REQUEST_P_H
 #define KOVA_REQUEST_CRED_REQUEST_P_H
 
+#include <stdint.h>
 #include <stdio.h>
 
 #include <string>
@@ -16,7 +17,7 @@
 namespace KOVA {
 
 class CredRequestPrivate {
-public:
+  public:
     explicit CredRequestPrivate(CredRequest *owner);
     ~CredRequestPrivate();
     CredRequestPrivate(const CredRequestPrivate &) = delete;
@@ -55,11 +56,22 @@ public:
                                          Json::Value *headers);
     static size_t WriteHeaderToStdout(char *data, size_t size, size_t nmemb,
                                       const Json::Value *message);
-    static int DebugCallback(void *handle, curl_infotype type, char *data, size_t size,
-                             void *user);
+    static int DebugCallback(void *handle, curl_infotype type, char *data, size_t size, void *user);
 
     // Fills protocol, host and port of the request's own credential from `url`.
     bool buildCredByURL(const std::string &url);
+
+    // Sets one libcurl option; a failure sets CRED_REQ_ERR_CURL_INTERNAL and logs it.
+    template <typename T>
+    bool SetOption(CURLoption option, T value);
+
+    // The request-stream limit, shared by every request of the process: SetReqStreamSize sets
+    // it, constructing a request clears `reqStreamLimited`, and ReadFromStream consumes it.
+    static bool reqStreamLimited;
+    static uint32_t reqStreamRemaining;
+    // Set the first time a response header reaches standard output; never cleared, so the
+    // standard-output mode's message line is written once per process.
+    static bool headerMessageShown;
 
     // Fields, in this order.
     KOVA_CRED *cred;

@@ -1,0 +1,349 @@
+// KOVA::CredRequest settings: the request settings document, its low-level operations and the
+// public setters and getters built on them.
+#include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_util.h"
+#include "request/cred_request_p.h"
+
+namespace KOVA {
+
+bool CredRequestPrivate::reqStreamLimited = false;
+uint32_t CredRequestPrivate::reqStreamRemaining = 0;
+bool CredRequestPrivate::headerMessageShown = false;
+
+namespace {
+
+const Json::Value kNull;
+
+// jsoncpp and std::string may throw (bad_alloc, Json::LogicError on a type mismatch); nothing
+// may leave the library, so public operations run their body through this guard.
+template <typename Fn, typename R>
+R Guarded(Fn &&fn, R onError) {
+    try {
+        return fn();
+    } catch (...) {
+        return onError;
+    }
+}
+
+}  // namespace
+
+CredRequestPrivate::CredRequestPrivate(CredRequest *ownerRequest)
+    : cred(KOVACredAlloc()), sess(KOVACredSessAlloc()), owner(ownerRequest) {
+    reqStreamLimited = false;
+}
+
+CredRequestPrivate::~CredRequestPrivate() {
+    if (headers != nullptr) {
+        curl_slist_free_all(headers);
+        headers = nullptr;
+    }
+    if (curl != nullptr) {
+        curl_easy_cleanup(curl);
+        curl = nullptr;
+    }
+    if (form != nullptr) {
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wdeprecated-declarations"
+        curl_formfree(form);  // the multipart form is built with the form API
+#pragma GCC diagnostic pop
+        form = nullptr;
+    }
+    if (cred != nullptr) {
+        KOVACredFree(cred);
+        cred = nullptr;
+    }
+    if (sess != nullptr) {
+        KOVACredSessFree(sess);
+        sess = nullptr;
+    }
+}
+
+bool CredRequestPrivate::SetData(const std::string &key, const std::string &name,
+                                 const std::string &value) {
+    if (key.empty() || name.empty()) {
+        error = CRED_REQ_ERR_BAD_PARAM;
+        return false;
+    }
+    Json::Value &slot = settings[key];
+    if (slot.isNull()) {
+        slot = Json::Value(Json::objectValue);
+    } else if (!slot.isObject()) {
+        error = CRED_REQ_ERR_BAD_PARAM;
+        return false;
+    }
+    slot[name] = value;
+    return true;
+}
+
+bool CredRequestPrivate::SetData(const std::string &key, const Json::Value &members) {
+    if (key.empty() || !members.isObject()) {
+        error = CRED_REQ_ERR_BAD_PARAM;
+        return false;
+    }
+    if (members.empty()) {
+        return true;
+    }
+    Json::Value &slot = settings[key];
+    if (slot.isNull()) {
+        slot = Json::Value(Json::objectValue);
+    } else if (!slot.isObject()) {
+        error = CRED_REQ_ERR_BAD_PARAM;
+        return false;
+    }
+    for (auto it = members.begin(); it != members.end(); ++it) {
+        slot[it.name()] = *it;
+    }
+    return true;
+}
+
+bool CredRequestPrivate::SetRawData(const std::string &key, const Json::Value &value) {
+    if (key.empty() || value.empty()) {
+        error = CRED_REQ_ERR_BAD_PARAM;
+        return false;
+    }
+    settings[key] = value;
+    return true;
+}
+
+const Json::Value &CredRequestPrivate::GetData(const std::string &key, const std::string &name,
+                                               const Json::Value &fallback) const {
+    if (key.empty()) {
+        return settings;
+    }
+    const Json::Value *slot = settings.find(key.data(), key.data() + key.size());
+    if (slot == nullptr) {
+        return fallback;
+    }
+    if (name.empty()) {
+        return *slot;
+    }
+    if (!slot->isObject()) {
+        return fallback;
+    }
+    const Json::Value *member = slot->find(name.data(), name.data() + name.size());
+    return member != nullptr ? *member : fallback;
+}
+
+bool CredRequestPrivate::HasData(const std::string &key) const {
+    return settings.isMember(key);
+}
+
+bool CredRequestPrivate::HasRawData(const std::string &key) const {
+    return settings.isMember(key);
+}
+
+bool CredRequestPrivate::HasData(const std::string &key, const std::string &name) const {
+    const Json::Value *slot = settings.find(key.data(), key.data() + key.size());
+    return slot != nullptr && slot->isObject() && slot->isMember(name);
+}
+
+// ---- KOVA::CredRequest ----
+
+CredRequest::CredRequest() : d(new CredRequestPrivate(this)) {}
+
+CredRequest::~CredRequest() {
+    delete d;
+}
+
+bool CredRequest::SetURL(const std::string &url) {
+    return Guarded([&] { return d->SetRawData("URL", Json::Value(url)); }, false);
+}
+
+bool CredRequest::SetURL(const std::string &scheme, const std::string &host, int port,
+                         const std::string &path) {
+    return Guarded([&] { return SetURL(CredRequestUtil::GetURL(scheme, host, port, path)); },
+                   false);
+}
+
+bool CredRequest::SetEncURL(const std::string &url) {
+    return Guarded([&] { return d->SetRawData("EncURL", Json::Value(url)); }, false);
+}
+
+std::string CredRequest::GetURL() {
+    return Guarded(
+        [&] {
+            const Json::Value &url = d->GetData("URL", "", kNull);
+            return url.isString() ? url.asString() : std::string();
+        },
+        std::string());
+}
+
+bool CredRequest::AddHeader(const Json::Value &headers) {
+    return Guarded([&] { return d->SetData("Header", headers); }, false);
+}
+
+bool CredRequest::AddHeader(const std::string &name, const std::string &value) {
+    return Guarded([&] { return d->SetData("Header", name, value); }, false);
+}
+
+bool CredRequest::AddCookie(const std::string &name, const std::string &value) {
+    return Guarded([&] { return d->SetData("Cookie", name, value); }, false);
+}
+
+bool CredRequest::AddGetParam(const Json::Value &params) {
+    return Guarded([&] { return d->SetData("GetParam", params); }, false);
+}
+
+bool CredRequest::AddGetParam(const std::string &name, const std::string &value) {
+    return Guarded([&] { return d->SetData("GetParam", name, value); }, false);
+}
+
+bool CredRequest::AddPostParam(const Json::Value &params) {
+    return Guarded([&] { return d->SetData("PostParam", params); }, false);
+}
+
+bool CredRequest::AddPostParam(const std::string &name, const std::string &value) {
+    return Guarded([&] { return d->SetData("PostParam", name, value); }, false);
+}
+
+bool CredRequest::AddRawParam(const std::string &body) {
+    return Guarded([&] { return d->SetRawData("RawParam", Json::Value(body)); }, false);
+}
+
+bool CredRequest::SetReqStream(FILE *stream) {
+    if (stream == nullptr) {
+        d->error = CRED_REQ_ERR_BAD_PARAM;
+        return false;
+    }
+    d->reqStream = stream;
+    return true;
+}
+
+bool CredRequest::SetReqStreamSize(unsigned int size) {
+    CredRequestPrivate::reqStreamLimited = true;
+    CredRequestPrivate::reqStreamRemaining = size;
+    return true;
+}
+
+bool CredRequest::SetUploadFile(const char *field, const char *path) {
+    if (field == nullptr || path == nullptr) {
+        d->error = CRED_REQ_ERR_BAD_PARAM;
+        return false;
+    }
+    return Guarded([&] { return d->SetData("File", field, path); }, false);
+}
+
+void CredRequest::SetSSLVerify(void (*fn)(void *, void *, void *), void *data) {
+    d->sslCtxFn = fn;
+    d->sslCtxData = data;
+}
+
+void CredRequest::SetHTTPSVerify(bool verify) {
+    Guarded([&] { return d->SetRawData("VerifySSL", Json::Value(verify)); }, false);
+}
+
+bool CredRequest::SetRespHeaderToJsonValue(bool on) {
+    return Guarded([&] { return d->SetData("RespHeader", "MODE", on ? "JSON" : ""); }, false);
+}
+
+bool CredRequest::SetRespHeaderToStdout(bool on, const std::string &message) {
+    return Guarded(
+        [&] {
+            if (!message.empty() && !d->SetData("RespHeader", "MESSAGE", message)) {
+                return false;
+            }
+            return d->SetData("RespHeader", "MODE", on ? "STDOUT" : "");
+        },
+        false);
+}
+
+bool CredRequest::SetRespStream(FILE *stream, size_t (*fn)(char *, size_t, size_t, void *)) {
+    if (stream == nullptr) {
+        d->error = CRED_REQ_ERR_BAD_PARAM;
+        return false;
+    }
+    d->respStream = stream;
+    if (fn != nullptr) {
+        d->respWriteFn = fn;
+    }
+    return true;
+}
+
+void CredRequest::SetRequestFormat(const std::string &format) {
+    Guarded([&] { return d->SetRawData("Format", Json::Value(format)); }, false);
+}
+
+std::string CredRequest::GetRequestFormat() {
+    return Guarded(
+        [&] {
+            const Json::Value &format = d->GetData("Format", "", kNull);
+            return format.isString() ? format.asString() : std::string();
+        },
+        std::string());
+}
+
+bool CredRequest::SetDefaultTimeout(long seconds) {
+    if (seconds <= 0) {
+        return false;
+    }
+    d->defaultTimeout = seconds;
+    return true;
+}
+
+long CredRequest::GetDefaultTimeout() const {
+    return d->defaultTimeout;
+}
+
+bool CredRequest::SetResponseTimeout(long seconds) {
+    return Guarded(
+        [&] { return d->SetRawData("RespTime", Json::Value(static_cast<Json::Int64>(seconds))); },
+        false);
+}
+
+long CredRequest::GetResponseTimeout() {
+    constexpr long kUnsetResponseTimeout = 120;
+    return Guarded(
+        [&] {
+            const Json::Value &value = d->GetData("RespTime", "", kNull);
+            if (!value.isIntegral()) {
+                return kUnsetResponseTimeout;
+            }
+            return static_cast<long>(value.asInt64());
+        },
+        kUnsetResponseTimeout);
+}
+
+bool CredRequest::SetEncryptParam(bool /*encrypt*/) {
+    // Selects the RSA envelope whatever the argument; SetEncryptMode(0) switches back.
+    return Guarded(
+        [&] { return d->SetRawData("Crypto", Json::Value(static_cast<int>(CRED_REQ_CRYPTO_RSA))); },
+        false);
+}
+
+bool CredRequest::SetEncryptMode(KOVA::_tag_CRED_REQ_CRYPTO mode) {
+    if (static_cast<int>(mode) > CRED_REQ_CRYPTO_AES) {
+        return false;
+    }
+    return Guarded([&] { return d->SetRawData("Crypto", Json::Value(static_cast<int>(mode))); },
+                   false);
+}
+
+void CredRequest::SetFollowLocation(bool follow) {
+    d->followLocation = follow;
+}
+
+void CredRequest::SetEncoding(bool encoding) {
+    d->encoding = encoding;
+}
+
+KOVA::_tag_CRED_REQ_ERR CredRequest::GetError() {
+    return d->error;
+}
+
+void CredRequest::SetError(KOVA::_tag_CRED_REQ_ERR error) {
+    d->error = error;
+}
+
+CURL *CredRequest::GetCurlHandler() {
+    return d->curl;
+}
+
+std::string CredRequest::GetResponse() {
+    return Guarded([&] { return d->response; }, std::string());
+}
+
+const Json::Value &CredRequest::GetResponseHeader() {
+    return d->GetResponseHeader();
+}
+
+}  // namespace KOVA

@@ -1,0 +1,136 @@
+// Execution of KOVA::CredRequest: the transfer with bounded retries and the mapping of every
+// libcurl result and HTTP status to one request error.
+#include <stdio.h>
+#include <unistd.h>
+
+#include "kovacredential/cred_request_util.h"
+#include "platform/kova_log.h"
+#include "request/cred_request_p.h"
+
+namespace KOVA {
+
+namespace {
+
+constexpr const char kUnit[] = "cred_request";
+
+// Resolve failures and time-outs are worth a pause before the next attempt; other failures
+// are retried at once.
+bool PausesBeforeRetry(CURLcode rc) {
+    return rc == CURLE_COULDNT_RESOLVE_PROXY || rc == CURLE_COULDNT_RESOLVE_HOST ||
+           rc == CURLE_OPERATION_TIMEDOUT;
+}
+
+// Empties the response stream so that the next attempt does not append to a partial body.
+bool RewindResponseStream(FILE *stream) {
+    if (ftruncate(fileno(stream), 0) != 0) {
+        return false;
+    }
+    fseek(stream, 0, SEEK_SET);
+    return true;
+}
+
+}  // namespace
+
+constexpr int kLineInitFailed = 47;
+constexpr int kLineCurlError = 98;
+constexpr int kLineResponseCode = 110;
+constexpr int kLineHttpError = 117;
+
+bool CredRequest::Process(bool perform, int retries) {
+    try {
+        if (!d->InitCurlHandler()) {
+            kova::Log("%s:%d (pid=%d)InitCurlHandler failed", kUnit, kLineInitFailed,
+                      static_cast<int>(getpid()));
+            return false;
+        }
+        d->response.clear();
+        if (!perform) {
+            return true;
+        }
+
+        const int attempts = retries + 1 > 1 ? retries + 1 : 1;
+        CURLcode rc = CURLE_OK;
+        for (int attempt = 1; attempt <= attempts; ++attempt) {
+            rc = curl_easy_perform(d->curl);
+            if (rc == CURLE_OK) {
+                break;
+            }
+            if (PausesBeforeRetry(rc)) {
+                if (attempt == attempts) {
+                    break;
+                }
+                if (d->respStream != nullptr && !RewindResponseStream(d->respStream)) {
+                    break;
+                }
+                sleep(1);
+            }
+        }
+
+        const int code = static_cast<int>(rc);
+        if (code != CURLE_OK) {
+            switch (code) {
+                case CURLE_COULDNT_RESOLVE_PROXY:
+                case CURLE_COULDNT_RESOLVE_HOST:
+                    d->error = CRED_REQ_ERR_RESOLVE;
+                    return false;
+                case CURLE_OPERATION_TIMEDOUT:
+                    d->error = CRED_REQ_ERR_TIMEOUT;
+                    return false;
+                case CURLE_COULDNT_CONNECT:
+                case CURLE_RECV_ERROR:
+                    d->error = CRED_REQ_ERR_CONNECT;
+                    break;
+                case CURLE_SSL_CONNECT_ERROR:
+                    d->error = CRED_REQ_ERR_SSL_CONNECT;
+                    break;
+                case CURLE_SEND_ERROR:
+                case CURLE_AGAIN:
+                    d->error = CRED_REQ_ERR_SEND;
+                    break;
+                default:  // every other result, and results newer than this library knows
+                    d->error = CRED_REQ_ERR_CURL_OTHER;
+                    break;
+            }
+            kova::Log("%s:%d (pid=%d)CURL Error(%d): %s", kUnit, kLineCurlError,
+                      static_cast<int>(getpid()), code, curl_easy_strerror(rc));
+            return false;
+        }
+
+        long status = 0;
+        CURLcode info = curl_easy_getinfo(d->curl, CURLINFO_RESPONSE_CODE, &status);
+        if (info != CURLE_OK) {
+            d->error = CRED_REQ_ERR_CURL_INTERNAL;
+            kova::Log("%s:%d CURL Error(%d): %s", kUnit, kLineResponseCode, static_cast<int>(info),
+                      curl_easy_strerror(info));
+            return false;
+        }
+        if (status >= 400 && status <= 599) {
+            kova::Log("%s:%d (pid=%d)HTTP Error(%ld)", kUnit, kLineHttpError,
+                      static_cast<int>(getpid()), status);
+            d->error = status <= 499 ? CRED_REQ_ERR_HTTP_CLIENT : CRED_REQ_ERR_HTTP_SERVER;
+            return false;
+        }
+        switch (status) {
+            case 200:
+                return true;
+            case 304:
+                d->error = CRED_REQ_ERR_NOT_MODIFIED;
+                return false;
+            case 302:
+                d->error = CRED_REQ_ERR_REDIRECT;
+                return false;
+            default:
+                d->error = CRED_REQ_ERR_HTTP_UNEXPECTED;
+                return false;
+        }
+    } catch (...) {
+        d->error = CRED_REQ_ERR_UNKNOWN;
+        return false;
+    }
+}
+
+bool CredRequest::isURLValid(const std::string &url) {
+    return CredRequestUtil::TestURL(url);
+}
+
+}  // namespace KOVA

@@ -1,0 +1,362 @@
+// Transfer set-up of KOVA::CredRequest: the settings document becomes one configured libcurl
+// easy handle, plus the body, header and trace callbacks that handle uses.
+#include <stdlib.h>
+
+#include <stdexcept>
+
+#include "platform/json_text.h"
+#include "platform/kova_log.h"
+#include "request/cred_request_p.h"
+
+namespace KOVA {
+
+namespace {
+
+constexpr const char kUnit[] = "cred_request";
+constexpr const char kUserAgent[] = "Velantix-23739";
+constexpr const char kDebugEnv[] = "kovacredential_debug";
+
+const Json::Value kNull;
+
+// The text a JSON value is sent as: a string as it stands, anything else in compact JSON.
+std::string ValueText(const Json::Value &value) {
+    if (value.isString()) {
+        return value.asString();
+    }
+    return value.isNull() ? std::string() : kova::JsonToString(value);
+}
+
+// The caller's TLS context callback returns nothing, while libcurl reads a CURLcode from its
+// SSL context function; this adapter calls it with the caller's data and reports success.
+CURLcode SslCtxAdapter(CURL *curl, void *sslCtx, void *user) {
+    const auto *p = static_cast<const CredRequestPrivate *>(user);
+    p->sslCtxFn(curl, sslCtx, p->sslCtxData);
+    return CURLE_OK;
+}
+
+}  // namespace
+
+constexpr int kLineSetOptionFail = 48;
+
+template <typename T>
+bool CredRequestPrivate::SetOption(CURLoption option, T value) {
+    CURLcode rc = curl_easy_setopt(curl, option, value);
+    if (rc != CURLE_OK) {
+        error = CRED_REQ_ERR_CURL_INTERNAL;
+        kova::Log("%s:%d CURL Error(%d): %s", kUnit, kLineSetOptionFail, static_cast<int>(rc),
+                  curl_easy_strerror(rc));
+        return false;
+    }
+    return true;
+}
+
+constexpr int kLineFormAddFail = 181;
+
+bool CredRequestPrivate::InitCurlHandler() {
+    // The document is read once per request: later changes do not reach an existing handle.
+    if (curl != nullptr) {
+        return true;
+    }
+    curl = curl_easy_init();
+    if (curl == nullptr) {
+        error = CRED_REQ_ERR_CURL_INTERNAL;
+        return false;
+    }
+    const Json::Value &urlValue = GetData("URL", "", kNull);
+    if (!urlValue.isString()) {
+        error = CRED_REQ_ERR_NO_URL;
+        return false;
+    }
+    std::string url = urlValue.asString();
+
+    // A multipart upload carries the session id in the query string.
+    if (HasData("File") && HasData("PostParam", "_sid")) {
+        std::string sid = ValueText(settings["PostParam"]["_sid"]);
+        if (!SetData("GetParam", "_sid", sid)) {
+            return false;
+        }
+        settings["PostParam"].removeMember("_sid");
+    }
+    if (HasData("GetParam")) {
+        url += url.find('?') == std::string::npos ? "?" : "&";
+        url += GetParamString(settings["GetParam"]);
+    }
+
+    if (!SetOption(CURLOPT_URL, url.c_str())) {
+        return false;
+    }
+    if (followLocation && !SetOption(CURLOPT_FOLLOWLOCATION, 1L)) {
+        return false;
+    }
+    if (encoding && !SetOption(CURLOPT_ACCEPT_ENCODING, "")) {
+        return false;
+    }
+    if (getenv(kDebugEnv) != nullptr) {
+        if (!SetOption(CURLOPT_VERBOSE, 1L) ||
+            !SetOption(CURLOPT_DEBUGFUNCTION, &CredRequestPrivate::DebugCallback)) {
+            return false;
+        }
+    }
+    if (!SetOption(CURLOPT_POSTREDIR, static_cast<long>(CURL_REDIR_POST_ALL)) ||
+        !SetOption(CURLOPT_AUTOREFERER, 1L) || !SetOption(CURLOPT_USERAGENT, kUserAgent)) {
+        return false;
+    }
+
+    // Certificate and host checks are off unless asked for; a TLS context callback forces them.
+    const Json::Value &verify = GetData("VerifySSL", "", kNull);
+    if (sslCtxFn != nullptr) {
+        if (!SetOption(CURLOPT_SSL_VERIFYPEER, 1L) || !SetOption(CURLOPT_SSL_VERIFYHOST, 1L) ||
+            !SetOption(CURLOPT_SSL_CTX_FUNCTION, &SslCtxAdapter) ||
+            !SetOption(CURLOPT_SSL_CTX_DATA, static_cast<void *>(this))) {
+            return false;
+        }
+    } else if (verify.isBool() && verify.asBool()) {
+        if (!SetOption(CURLOPT_SSL_VERIFYPEER, 1L) || !SetOption(CURLOPT_SSL_VERIFYHOST, 1L)) {
+            return false;
+        }
+    } else {
+        if (!SetOption(CURLOPT_SSL_VERIFYPEER, 0L) || !SetOption(CURLOPT_SSL_VERIFYHOST, 0L)) {
+            return false;
+        }
+    }
+
+    const Json::Value &respTime = GetData("RespTime", "", kNull);
+    const long lowSpeedTime =
+        respTime.isIntegral() ? static_cast<long>(respTime.asInt64()) : defaultTimeout;
+    if (!SetOption(CURLOPT_TCP_KEEPALIVE, 1L) || !SetOption(CURLOPT_TCP_KEEPIDLE, defaultTimeout) ||
+        !SetOption(CURLOPT_TCP_KEEPINTVL, defaultTimeout) ||
+        !SetOption(CURLOPT_LOW_SPEED_LIMIT, 1L) ||
+        !SetOption(CURLOPT_LOW_SPEED_TIME, lowSpeedTime) ||
+        !SetOption(CURLOPT_CONNECTTIMEOUT, defaultTimeout) || !SetOption(CURLOPT_NOSIGNAL, 1L)) {
+        return false;
+    }
+
+    if (GetData("Cookie", "", kNull).isObject()) {
+        std::string cookies = GetCookies();
+        if (!SetOption(CURLOPT_COOKIE, cookies.c_str())) {
+            return false;
+        }
+    }
+
+    // An empty Expect header stops libcurl from waiting for an interim 100 answer; it is sent
+    // only together with the caller's own headers.
+    const Json::Value &headerObj = GetData("Header", "", kNull);
+    if (headerObj.isObject()) {
+        struct curl_slist *list = curl_slist_append(nullptr, "Expect:");
+        if (list == nullptr) {
+            error = CRED_REQ_ERR_CURL_INTERNAL;
+            return false;
+        }
+        headers = list;
+        for (auto it = headerObj.begin(); it != headerObj.end(); ++it) {
+            std::string line = it.name() + ": " + ValueText(*it);
+            list = curl_slist_append(headers, line.c_str());
+            if (list == nullptr) {
+                error = CRED_REQ_ERR_CURL_INTERNAL;
+                return false;
+            }
+            headers = list;
+        }
+        if (!SetOption(CURLOPT_HTTPHEADER, headers)) {
+            return false;
+        }
+    }
+
+    // Request body: raw text, else a multipart upload, else the request stream, else the form
+    // parameters; without any of them the request is a GET.
+    const Json::Value &fileObj = GetData("File", "", kNull);
+    if (HasData("RawParam")) {
+        const std::string body = ValueText(settings["RawParam"]);
+        if (!SetOption(CURLOPT_POST, 1L) || !SetOption(CURLOPT_COPYPOSTFIELDS, body.c_str())) {
+            return false;
+        }
+    } else if (fileObj.isObject()) {
+        struct curl_httppost *last = nullptr;
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wdeprecated-declarations"
+        // The multipart form is built with the form API, which the servers' upload handling
+        // was written against.
+        const Json::Value fields =
+            GetParamJsonObj(HasData("PostParam") ? settings["PostParam"] : kNull);
+        if (fields.isObject()) {
+            for (auto it = fields.begin(); it != fields.end(); ++it) {
+                const std::string name = it.name();
+                const std::string value = ValueText(*it);
+                CURLFORMcode rc = curl_formadd(&form, &last, CURLFORM_COPYNAME, name.c_str(),
+                                               CURLFORM_COPYCONTENTS, value.c_str(), CURLFORM_END);
+                if (rc != CURL_FORMADD_OK) {
+                    error = CRED_REQ_ERR_CURL_INTERNAL;
+                    kova::Log("%s:%d CURL Error(%d)", kUnit, kLineFormAddFail,
+                              static_cast<int>(rc));
+                    return false;
+                }
+            }
+        }
+        for (auto it = fileObj.begin(); it != fileObj.end(); ++it) {
+            const std::string field = it.name();
+            const std::string path = ValueText(*it);
+            CURLFORMcode rc = curl_formadd(&form, &last, CURLFORM_COPYNAME, field.c_str(),
+                                           CURLFORM_FILE, path.c_str(), CURLFORM_END);
+            if (rc != CURL_FORMADD_OK) {
+                error = CRED_REQ_ERR_CURL_INTERNAL;
+                kova::Log("%s:%d CURL Error(%d)", kUnit, kLineFormAddFail, static_cast<int>(rc));
+                return false;
+            }
+        }
+        if (!SetOption(CURLOPT_HTTPPOST, form)) {
+            return false;
+        }
+#pragma GCC diagnostic pop
+    } else if (reqStream != nullptr) {
+        if (!SetOption(CURLOPT_POST, 1L) ||
+            !SetOption(CURLOPT_READFUNCTION, &CredRequestPrivate::ReadFromStream) ||
+            !SetOption(CURLOPT_READDATA, reqStream)) {
+            return false;
+        }
+    } else if (HasData("PostParam")) {
+        const std::string body = GetParamString(settings["PostParam"]);
+        if (!SetOption(CURLOPT_POST, 1L) || !SetOption(CURLOPT_COPYPOSTFIELDS, body.c_str())) {
+            return false;
+        }
+    }
+
+    if (GetData("RespHeader", "", kNull).isObject()) {
+        Json::Value &respHeaderSettings = settings["RespHeader"];
+        const Json::Value &mode = GetData("RespHeader", "MODE", kNull);
+        const std::string modeText = mode.isString() ? mode.asString() : std::string();
+        if (modeText == "STDOUT") {
+            const Json::Value *message = &respHeaderSettings["MESSAGE"];
+            if (!SetOption(CURLOPT_HEADERFUNCTION, &CredRequestPrivate::WriteHeaderToStdout) ||
+                !SetOption(CURLOPT_HEADERDATA, message)) {
+                return false;
+            }
+        } else if (modeText == "JSON") {
+            if (!SetOption(CURLOPT_HEADERFUNCTION, &CredRequestPrivate::WriteHeaderToJsonValue) ||
+                !SetOption(CURLOPT_HEADERDATA, &respHeader)) {
+                return false;
+            }
+        }
+    }
+
+    if (respStream != nullptr) {
+        if (!SetOption(CURLOPT_WRITEFUNCTION, &CredRequestPrivate::WriteToStream) ||
+            !SetOption(CURLOPT_WRITEDATA, respStream)) {
+            return false;
+        }
+    } else {
+        if (!SetOption(CURLOPT_WRITEFUNCTION, &CredRequestPrivate::WriteToStrBuf) ||
+            !SetOption(CURLOPT_WRITEDATA, &response)) {
+            return false;
+        }
+    }
+    if (respWriteFn != nullptr && !SetOption(CURLOPT_WRITEFUNCTION, respWriteFn)) {
+        return false;
+    }
+    return true;
+}
+
+size_t CredRequestPrivate::WriteToStrBuf(char *data, size_t size, size_t nmemb, std::string *out) {
+    const size_t total = size * nmemb;
+    try {
+        out->append(data, total);
+    } catch (...) {
+        return 0;  // aborts the transfer (CURLE_WRITE_ERROR) instead of throwing into libcurl
+    }
+    return total;
+}
+
+size_t CredRequestPrivate::WriteToStream(char *data, size_t size, size_t nmemb, FILE *stream) {
+    return fwrite(data, size, nmemb, stream);
+}
+
+size_t CredRequestPrivate::ReadFromStream(char *buffer, size_t size, size_t nmemb, FILE *stream) {
+    size_t n = nmemb;
+    if (reqStreamLimited) {
+        if (reqStreamRemaining == 0) {
+            return 0;
+        }
+        if (size != 0 && reqStreamRemaining < size * nmemb) {
+            n = reqStreamRemaining / size;
+        }
+    }
+    const size_t read = fread(buffer, size, n, stream);
+    if (read < n) {
+        return read;
+    }
+    if (reqStreamLimited) {
+        reqStreamRemaining -= static_cast<uint32_t>(read * size);
+    }
+    return read;
+}
+
+constexpr int kLineHeaderNoValue = 307;
+
+size_t CredRequestPrivate::WriteHeaderToJsonValue(char *data, size_t size, size_t nmemb,
+                                                  Json::Value *headers) {
+    const size_t total = size * nmemb;
+    try {
+        std::string line(data, total);
+        const size_t colon = line.find(':');
+        if (colon == std::string::npos) {
+            return total;  // the status line and the blank line that ends the headers
+        }
+        try {
+            // One blank after the colon and the closing CR LF are assumed; a header with no
+            // value runs past the end of the line and is reported instead of stored.
+            line = line.substr(0, total - 2);
+            const std::string name = line.substr(0, colon);
+            const std::string value = line.substr(colon + 2);
+            (*headers)[name] = value;
+        } catch (const std::out_of_range &e) {
+            kova::Log("%s:%d HTTP header has no value:%s", kUnit, kLineHeaderNoValue, e.what());
+        }
+    } catch (...) {
+        // Out of memory: the header is dropped, the transfer goes on.
+    }
+    return total;
+}
+
+size_t CredRequestPrivate::WriteHeaderToStdout(char *data, size_t size, size_t nmemb,
+                                               const Json::Value *message) {
+    const size_t total = size * nmemb;
+    if (!headerMessageShown) {
+        headerMessageShown = true;
+        if (message != nullptr && message->isString()) {
+            const char *begin = nullptr;
+            const char *end = nullptr;
+            if (message->getString(&begin, &end) && end != begin) {
+                fwrite(begin, 1, static_cast<size_t>(end - begin), stdout);
+                fwrite("\r\n", 1, 2, stdout);
+            }
+        }
+    }
+    const std::string_view line(data, total);
+    if (line.find(':') != std::string_view::npos &&
+        line.find("Transfer-Encoding:") == std::string_view::npos) {
+        return fwrite(data, size, nmemb, stdout);
+    }
+    if (line == "\r\n") {
+        return fwrite(data, size, nmemb, stdout);
+    }
+    return total;
+}
+
+constexpr int kLineDebugTrace = 360;
+
+int CredRequestPrivate::DebugCallback(void * /*handle*/, curl_infotype type, char *data,
+                                      size_t size, void * /*user*/) {
+    static const char *const kPrefixes[] = {
+        "=> TEXT",      "<= Recv header",   "=> Send header",   "<= Recv data",
+        "=> Send data", "<= Recv SSL data", "=> Send SSL data",
+    };
+    const int index = static_cast<int>(type);
+    if (index < 0 || index > 6) {
+        return 0;
+    }
+    // libcurl's trace data is not NUL-terminated; the record holds exactly `size` bytes.
+    const int length = size > 1 << 20 ? 1 << 20 : static_cast<int>(size);
+    kova::Log("%s:%d %s\n%.*s", kUnit, kLineDebugTrace, kPrefixes[index], length, data);
+    return 0;
+}
+
+}  // namespace KOVA
