@@ -67,6 +67,9 @@ std::string CredRequestFarlinkPrivate::GlobalServerName() {
     return HostFromEnv("kovacredential_farlink_global", KOVA_DEFAULT_FARLINK_GLOBAL);
 }
 
+// Line number carried by the record of an unsupported service id.
+const int kUnsupportedServiceIdLine = 64;
+
 void CredRequestFarlinkPrivate::SetServiceId(const std::string &id) {
     // The id is kept even when it is not supported: later requests send it as it stands.
     serviceId = id;
@@ -75,7 +78,8 @@ void CredRequestFarlinkPrivate::SetServiceId(const std::string &id) {
     } else if (id == "zon_https" || id == "zon_portal_https") {
         serviceProtocol = "https";
     } else {
-        kova::Log("%s:%d Service id[%s] is not supported", kLogUnit, __LINE__, id.c_str());
+        kova::Log("%s:%d Service id[%s] is not supported", kLogUnit, kUnsupportedServiceIdLine,
+                  id.c_str());
     }
 }
 
@@ -84,9 +88,13 @@ void CredRequestFarlinkPrivate::SetHTTPS(bool https, bool verify) {
     verifyHTTPS = verify;
 }
 
-void CredRequestFarlinkPrivate::SetServerName(const std::string &name) { serverName = name; }
+void CredRequestFarlinkPrivate::SetServerName(const std::string &name) {
+    serverName = name;
+}
 
-void CredRequestFarlinkPrivate::SetTimeout(long seconds) { timeout = seconds; }
+void CredRequestFarlinkPrivate::SetTimeout(long seconds) {
+    timeout = seconds;
+}
 
 void CredRequestFarlinkPrivate::SetServerId(const std::string &id) {
     if (id == serverId) {
@@ -114,8 +122,7 @@ void CredRequestFarlinkPrivate::Clear() {
 
 // ---- Errors.
 
-void CredRequestFarlinkPrivate::SetError(KOVA::_tag_CRED_REQ_ERR code,
-                                         const Json::Value &detail) {
+void CredRequestFarlinkPrivate::SetError(KOVA::_tag_CRED_REQ_ERR code, const Json::Value &detail) {
     error = code;
     errorDetail = detail;
 }
@@ -207,26 +214,40 @@ bool CredRequestFarlinkPrivate::SendFarlinkRequest(const Json::Value &body, Json
 
 CredRequestFarlink::CredRequestFarlink() : d(new CredRequestFarlinkPrivate(this)) {}
 
-CredRequestFarlink::~CredRequestFarlink() { delete d; }
-
-void CredRequestFarlink::SetHTTPS(bool https, bool verify) { d->SetHTTPS(https, verify); }
-
-void CredRequestFarlink::SetServerName(const std::string &name) { d->SetServerName(name); }
-
-void CredRequestFarlink::SetTimeout(long seconds) { d->SetTimeout(seconds); }
-
-void CredRequestFarlink::SetServerId(const std::string &serverId) { d->SetServerId(serverId); }
-
-void CredRequestFarlink::SetServiceId(const std::string &serviceId) {
-    d->SetServiceId(serviceId);
+CredRequestFarlink::~CredRequestFarlink() {
+    delete d;
 }
 
-KOVA::_tag_CRED_REQ_ERR CredRequestFarlink::GetError() { return d->GetError(); }
+void CredRequestFarlink::SetHTTPS(bool https, bool verify) {
+    d->SetHTTPS(https, verify);
+}
 
-Json::Value CredRequestFarlink::GetErrors() { return d->GetErrors(); }
+void CredRequestFarlink::SetServerName(const std::string &name) {
+    FarlinkGuarded([&] { d->SetServerName(name); });
+}
+
+void CredRequestFarlink::SetTimeout(long seconds) {
+    d->SetTimeout(seconds);
+}
+
+void CredRequestFarlink::SetServerId(const std::string &serverId) {
+    FarlinkGuarded([&] { d->SetServerId(serverId); });
+}
+
+void CredRequestFarlink::SetServiceId(const std::string &serviceId) {
+    FarlinkGuarded([&] { d->SetServiceId(serviceId); });
+}
+
+KOVA::_tag_CRED_REQ_ERR CredRequestFarlink::GetError() {
+    return d->GetError();
+}
+
+Json::Value CredRequestFarlink::GetErrors() {
+    return FarlinkGuarded([&] { return d->GetErrors(); }, Json::Value());
+}
 
 void CredRequestFarlink::SetError(KOVA::_tag_CRED_REQ_ERR error, const Json::Value &detail) {
-    d->SetError(error, detail);
+    FarlinkGuarded([&] { d->SetError(error, detail); });
 }
 
 }  // namespace KOVA

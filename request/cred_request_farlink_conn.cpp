@@ -94,14 +94,14 @@ bool CredRequestFarlinkPrivate::GetAvailableDirectConnInfo(const Json::Value &se
     Json::Value list(Json::arrayValue);
     if (Has(server, "interface") && port > 0 && server["interface"].isArray()) {
         for (const Json::Value &nic : server["interface"]) {
-            list.append(Candidate(serviceProtocol, Has(nic, "ip") ? nic["ip"] : Json::Value(),
-                                  port));
+            list.append(
+                Candidate(serviceProtocol, Has(nic, "ip") ? nic["ip"] : Json::Value(), port));
         }
     }
     if (Has(server, "external") && extPort > 0) {
         const Json::Value &external = server["external"];
-        list.append(Candidate(serviceProtocol,
-                              Has(external, "ip") ? external["ip"] : Json::Value(), extPort));
+        list.append(Candidate(serviceProtocol, Has(external, "ip") ? external["ip"] : Json::Value(),
+                              extPort));
     }
     if (Has(server, "ddns") && extPort > 0) {
         list.append(Candidate(serviceProtocol, server["ddns"], extPort));
@@ -142,44 +142,52 @@ bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tun
 
 bool CredRequestFarlink::GetAvailableConnInfo(const Json::Value &serverInfo,
                                               Json::Value &candidate) {
-    if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
-        d->SetError(CRED_REQ_ERR_NO_CONN_INFO, serverInfo);
-        return false;
-    }
-    if (d->GetAvailableDirectConnInfo(serverInfo, candidate)) {
-        return true;
-    }
-    // The tunnel is asked of the site that gave the server information.
-    Json::Value tunnelAnswer;
-    if (!RequestTunnel(tunnelAnswer)) {
-        return false;
-    }
-    return d->GetAvailableRelayConnInfo(tunnelAnswer, candidate);
+    return FarlinkGuarded(
+        [&]() -> bool {
+            if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
+                d->SetError(CRED_REQ_ERR_NO_CONN_INFO, serverInfo);
+                return false;
+            }
+            if (d->GetAvailableDirectConnInfo(serverInfo, candidate)) {
+                return true;
+            }
+            // The tunnel is asked of the site that gave the server information.
+            Json::Value tunnelAnswer;
+            if (!RequestTunnel(tunnelAnswer)) {
+                return false;
+            }
+            return d->GetAvailableRelayConnInfo(tunnelAnswer, candidate);
+        },
+        false);
 }
 
 namespace {
 
 // One whole look-up with a client of its own: the HTTPS service first, then the plain one.
-bool ResolveServer(const std::string &serverId, const char *httpsService,
-                   const char *plainService, Json::Value &candidate, Json::Value *errors) {
-    CredRequestFarlink client;
-    if (serverId.empty()) {
-        client.SetError(CRED_REQ_ERR_NO_SERVER_ID);
-    } else {
-        client.SetServerId(serverId);
-        for (const char *service : {httpsService, plainService}) {
-            client.SetServiceId(service);
-            Json::Value info;
-            if (client.GetAvailableServerInfo(info) &&
-                client.GetAvailableConnInfo(info, candidate)) {
-                return true;
+bool ResolveServer(const std::string &serverId, const char *httpsService, const char *plainService,
+                   Json::Value &candidate, Json::Value *errors) {
+    return FarlinkGuarded(
+        [&]() -> bool {
+            CredRequestFarlink client;
+            if (serverId.empty()) {
+                client.SetError(CRED_REQ_ERR_NO_SERVER_ID);
+            } else {
+                client.SetServerId(serverId);
+                for (const char *service : {httpsService, plainService}) {
+                    client.SetServiceId(service);
+                    Json::Value info;
+                    if (client.GetAvailableServerInfo(info) &&
+                        client.GetAvailableConnInfo(info, candidate)) {
+                        return true;
+                    }
+                }
             }
-        }
-    }
-    if (errors != nullptr) {
-        *errors = client.GetErrors();
-    }
-    return false;
+            if (errors != nullptr) {
+                *errors = client.GetErrors();
+            }
+            return false;
+        },
+        false);
 }
 
 }  // namespace

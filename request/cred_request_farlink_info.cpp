@@ -26,95 +26,131 @@ Json::Value ServerCommand(const char *command, const std::string &serverId,
     return document;
 }
 
+// Points the client at another directory host for the object's lifetime.
+class ServerNameScope {
+  public:
+    ServerNameScope(CredRequestFarlinkPrivate &client, const std::string &name)
+        : client_(client), kept_(client.GetServerName()) {
+        client_.SetServerName(name);
+    }
+    ~ServerNameScope() { client_.serverName.swap(kept_); }
+    ServerNameScope(const ServerNameScope &) = delete;
+    ServerNameScope &operator=(const ServerNameScope &) = delete;
+
+  private:
+    CredRequestFarlinkPrivate &client_;
+    std::string kept_;
+};
+
 }  // namespace
 
 CredRequest *CredRequestFarlink::GetServerInfo() {
-    if (d->GetServerId().empty()) {
-        d->SetError(CRED_REQ_ERR_NO_SERVER_ID, Json::Value());
-        return nullptr;
-    }
-    Json::Value document = ServerCommand("get_server_info", d->GetServerId(), d->GetServiceId());
-    CredRequest *request = d->CreateFarlinkRequest(document);
-    if (request == nullptr) {
-        d->SetError(CRED_REQ_ERR_UNKNOWN, document);
-    }
-    return request;
+    return FarlinkGuarded(
+        [&]() -> CredRequest * {
+            if (d->GetServerId().empty()) {
+                d->SetError(CRED_REQ_ERR_NO_SERVER_ID, Json::Value());
+                return nullptr;
+            }
+            Json::Value document =
+                ServerCommand("get_server_info", d->GetServerId(), d->GetServiceId());
+            CredRequest *request = d->CreateFarlinkRequest(document);
+            if (request == nullptr) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, document);
+            }
+            return request;
+        },
+        static_cast<CredRequest *>(nullptr));
 }
 
 bool CredRequestFarlink::GetServerInfo(Json::Value &info) {
-    std::unique_ptr<CredRequest> request(GetServerInfo());
-    if (!request) {
-        d->SetError(CRED_REQ_ERR_UNKNOWN, Json::Value());
-        return false;
-    }
-    if (!request->Process(true, 0)) {
-        d->SetError(CRED_REQ_ERR_UNKNOWN, static_cast<int>(request->GetError()));
-        return false;
-    }
-    std::string text = request->GetResponse();
-    if (!d->CheckResponse(text, &info)) {
-        d->SetError(CRED_REQ_ERR_SERVER_ERRNO, text);
-        return false;
-    }
-    return true;
+    return FarlinkGuarded(
+        [&]() -> bool {
+            std::unique_ptr<CredRequest> request(GetServerInfo());
+            if (!request) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, Json::Value());
+                return false;
+            }
+            if (!request->Process(true, 0)) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, static_cast<int>(request->GetError()));
+                return false;
+            }
+            std::string text = request->GetResponse();
+            if (!d->CheckResponse(text, &info)) {
+                d->SetError(CRED_REQ_ERR_SERVER_ERRNO, text);
+                return false;
+            }
+            return true;
+        },
+        false);
 }
 
 bool CredRequestFarlink::GetSiteList(Json::Value &answer) {
-    // The site list always comes from the global directory host; the configured server name
-    // is put back on every path.
-    const std::string kept = d->GetServerName();
-    d->SetServerName(CredRequestFarlinkPrivate::GlobalServerName());
-    Json::Value document = Command("get_site_list");
-    bool ok = false;
-    if (!d->SendFarlinkRequest(document, answer)) {
-        d->SetError(CRED_REQ_ERR_UNKNOWN, document);
-    } else if (!CredRequestFarlinkPrivate::IsSuccessAnswer(answer)) {
-        d->SetError(CRED_REQ_ERR_SERVER_ERRNO, answer);
-    } else {
-        ok = true;
-    }
-    d->SetServerName(kept);
-    return ok;
+    return FarlinkGuarded(
+        [&]() -> bool {
+            // The site list always comes from the global directory host; the configured
+            // server name is put back on every path.
+            ServerNameScope global(*d, CredRequestFarlinkPrivate::GlobalServerName());
+            Json::Value document = Command("get_site_list");
+            if (!d->SendFarlinkRequest(document, answer)) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, document);
+                return false;
+            }
+            if (!CredRequestFarlinkPrivate::IsSuccessAnswer(answer)) {
+                d->SetError(CRED_REQ_ERR_SERVER_ERRNO, answer);
+                return false;
+            }
+            return true;
+        },
+        false);
 }
 
 bool CredRequestFarlink::GetAvailableServerInfo(Json::Value &info) {
-    Json::Value list;
-    if (!GetSiteList(list)) {
-        return false;
-    }
-    const Json::Value *sites = list.find("sites", "sites" + 5);
-    if (sites == nullptr || !sites->isArray()) {
-        return false;
-    }
-    info = Json::Value();
-    for (const Json::Value &site : *sites) {
-        // A failing site leaves its error recorded until a later one overwrites it; the
-        // server name stays at the site that answered so that a tunnel goes there too.
-        d->SetServerName(site.isString() ? site.asString() : std::string());
-        Json::Value candidate;
-        if (GetServerInfo(candidate)) {
-            info.swap(candidate);
-            break;
-        }
-    }
-    return !info.empty();
+    return FarlinkGuarded(
+        [&]() -> bool {
+            Json::Value list;
+            if (!GetSiteList(list)) {
+                return false;
+            }
+            const Json::Value *sites = list.find("sites", "sites" + 5);
+            if (sites == nullptr || !sites->isArray()) {
+                return false;
+            }
+            info = Json::Value();
+            for (const Json::Value &site : *sites) {
+                // A failing site leaves its error recorded until a later one overwrites it; the
+                // server name stays at the site that answered so that a tunnel goes there too.
+                d->SetServerName(site.isString() ? site.asString() : std::string());
+                Json::Value candidate;
+                if (GetServerInfo(candidate)) {
+                    info.swap(candidate);
+                    break;
+                }
+            }
+            return !info.empty();
+        },
+        false);
 }
 
 bool CredRequestFarlink::RequestTunnel(Json::Value &answer) {
-    if (d->GetServerId().empty()) {
-        d->SetError(CRED_REQ_ERR_BAD_PARAM, Json::Value());
-        return false;
-    }
-    Json::Value document = ServerCommand("request_tunnel", d->GetServerId(), d->GetServiceId());
-    if (!d->SendFarlinkRequest(document, answer)) {
-        d->SetError(CRED_REQ_ERR_UNKNOWN, document);
-        return false;
-    }
-    if (!CredRequestFarlinkPrivate::IsSuccessAnswer(answer)) {
-        d->SetError(CRED_REQ_ERR_SERVER_ERRNO, answer);
-        return false;
-    }
-    return true;
+    return FarlinkGuarded(
+        [&]() -> bool {
+            if (d->GetServerId().empty()) {
+                d->SetError(CRED_REQ_ERR_BAD_PARAM, Json::Value());
+                return false;
+            }
+            Json::Value document =
+                ServerCommand("request_tunnel", d->GetServerId(), d->GetServiceId());
+            if (!d->SendFarlinkRequest(document, answer)) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, document);
+                return false;
+            }
+            if (!CredRequestFarlinkPrivate::IsSuccessAnswer(answer)) {
+                d->SetError(CRED_REQ_ERR_SERVER_ERRNO, answer);
+                return false;
+            }
+            return true;
+        },
+        false);
 }
 
 }  // namespace KOVA

@@ -13,8 +13,27 @@
 
 namespace KOVA {
 
+// Runs `fn` and turns any exception (out of memory in string or JSON handling, a JSON value of
+// an unexpected type) into `onError`, so that none leaves the library.
+template <typename Fn, typename R>
+R FarlinkGuarded(Fn &&fn, R onError) {
+    try {
+        return fn();
+    } catch (...) {
+        return onError;
+    }
+}
+
+template <typename Fn>
+void FarlinkGuarded(Fn &&fn) {
+    try {
+        fn();
+    } catch (...) {
+    }
+}
+
 class CredRequestFarlinkPrivate {
-public:
+  public:
     explicit CredRequestFarlinkPrivate(CredRequestFarlink *owner);
     ~CredRequestFarlinkPrivate();
     CredRequestFarlinkPrivate(const CredRequestFarlinkPrivate &) = delete;

@@ -26,7 +26,7 @@ Json::Value Parse(const std::string &text) {
 // Host 0 is the global directory, hosts 1 to 3 are sites; the environment points the client's
 // default and global directory hosts at hosts 1 and 0.
 class RelayCommandsTest : public ::testing::Test {
-protected:
+  protected:
     RelayCommandsTest() : directory_(4) {}
 
     void SetUp() override {

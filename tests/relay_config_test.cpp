@@ -21,7 +21,7 @@ using KOVA::CredRequestFarlinkPrivate;
 
 // Sets (or, with nullptr, unsets) an environment variable for the object's lifetime.
 class ScopedEnv {
-public:
+  public:
     ScopedEnv(const char *name, const char *value) : name_(name) {
         const char *old = getenv(name);
         hadOld_ = old != nullptr;
@@ -30,7 +30,7 @@ public:
     }
     ~ScopedEnv() { hadOld_ ? setenv(name_.c_str(), old_.c_str(), 1) : unsetenv(name_.c_str()); }
 
-private:
+  private:
     std::string name_;
     bool hadOld_;
     std::string old_;
@@ -46,9 +46,10 @@ TEST(RelayConfig, ServiceIdsSelectTheirProtocol) {
     CredRequestFarlinkPrivate client(nullptr);
     EXPECT_EQ(client.GetServiceId(), "zon");
     EXPECT_EQ(client.GetServiceProtocol(), "http");
-    const std::pair<const char *, const char *> table[] = {
-        {"zon_https", "https"}, {"zon", "http"}, {"zon_portal_https", "https"},
-        {"zon_portal", "http"}};
+    const std::pair<const char *, const char *> table[] = {{"zon_https", "https"},
+                                                           {"zon", "http"},
+                                                           {"zon_portal_https", "https"},
+                                                           {"zon_portal", "http"}};
     for (const auto &row : table) {
         client.SetServiceId(row.first);
         EXPECT_EQ(client.GetServiceId(), row.first);
@@ -64,8 +65,7 @@ TEST(RelayConfig, UnsupportedServiceIdIsKeptWithTheOldProtocolAndLogged) {
     client.SetServiceId("ftp");
     EXPECT_EQ(client.GetServiceId(), "ftp");
     EXPECT_EQ(client.GetServiceProtocol(), "https");
-    ASSERT_EQ(kova_test::LogCount("Service id[ftp] is not supported"), 1u)
-        << kova_test::LogDump();
+    ASSERT_EQ(kova_test::LogCount("Service id[ftp] is not supported"), 1u) << kova_test::LogDump();
     EXPECT_EQ(kova_test::LogRecords().back().rfind("cred_request_farlink_conn:", 0), 0u)
         << kova_test::LogDump();
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
@@ -106,13 +106,11 @@ TEST(RelayConfig, EmptyServerIdClearsTheDigestWith401) {
 TEST(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuild) {
     {
         ScopedEnv unset("kovacredential_farlink_server", nullptr);
-        EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(),
-                  KOVA_DEFAULT_FARLINK_SERVER);
+        EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
     }
     {
         ScopedEnv empty("kovacredential_farlink_server", "");
-        EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(),
-                  KOVA_DEFAULT_FARLINK_SERVER);
+        EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
     }
     ScopedEnv server("kovacredential_farlink_server", "dir.example");
     ScopedEnv global("kovacredential_farlink_global", "global.example");

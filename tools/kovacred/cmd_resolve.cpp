@@ -33,11 +33,10 @@ struct ResolveOptions {
 void RunResolve(const ResolveOptions &options) {
     Json::Value candidate;
     Json::Value errors;
-    bool found = options.portal
-                     ? KOVA::CredRequestFarlink::GetConnInfoPortal(options.serverId, candidate,
-                                                                   &errors)
-                     : KOVA::CredRequestFarlink::GetConnInfo(options.serverId, candidate,
-                                                             &errors);
+    bool found =
+        options.portal
+            ? KOVA::CredRequestFarlink::GetConnInfoPortal(options.serverId, candidate, &errors)
+            : KOVA::CredRequestFarlink::GetConnInfo(options.serverId, candidate, &errors);
     if (found) {
         printf("%s\n", CompactJson(candidate).c_str());
         return;

@@ -112,7 +112,9 @@ bool BindNotPermitted(const LoopbackServer &server) {
 
 RelaySim::RelaySim() : config_(Json::objectValue) {}
 
-RelaySim::RelaySim(const Json::Value &config) : RelaySim() { Configure(config); }
+RelaySim::RelaySim(const Json::Value &config) : RelaySim() {
+    Configure(config);
+}
 
 bool RelaySim::Configure(const Json::Value &config, std::string *error) {
     const char *problem = nullptr;
@@ -141,28 +143,28 @@ Json::Value RelaySim::Config() const {
 
 void RelaySim::Install(LoopbackServer &server) {
     const std::string site = server.Host();
-    server.Route("*", "/+Serv\\.php", [this, site](const httplib::Request &req,
-                                                   httplib::Response &res) {
-        RelayHit hit;
-        hit.site = site;
-        hit.method = req.method;
-        hit.body = req.body;
-        if (ParseJson(req.body, hit.request) && hit.request.isObject() &&
-            hit.request["command"].isString()) {
-            hit.command = hit.request["command"].asString();
-        }
-        hit.answer = Answer(site, req.body);
-        res.set_content(hit.answer, "application/json");
-        std::lock_guard<std::mutex> lock(mutex_);
-        hits_.push_back(std::move(hit));
-    });
+    server.Route("*", "/+Serv\\.php",
+                 [this, site](const httplib::Request &req, httplib::Response &res) {
+                     RelayHit hit;
+                     hit.site = site;
+                     hit.method = req.method;
+                     hit.body = req.body;
+                     if (ParseJson(req.body, hit.request) && hit.request.isObject() &&
+                         hit.request["command"].isString()) {
+                         hit.command = hit.request["command"].asString();
+                     }
+                     hit.answer = Answer(site, req.body);
+                     res.set_content(hit.answer, "application/json");
+                     std::lock_guard<std::mutex> lock(mutex_);
+                     hits_.push_back(std::move(hit));
+                 });
 }
 
 std::string RelaySim::Answer(const std::string &site, const std::string &body) const {
     Json::Value request;
     bool parsed = ParseJson(body, request) && request.isObject();
-    std::string command = parsed && request["command"].isString()
-                              ? request["command"].asString() : std::string();
+    std::string command =
+        parsed && request["command"].isString() ? request["command"].asString() : std::string();
     Json::Value config = Config();
     for (const Json::Value &rule : config["answers"]) {
         if ((rule.isMember("site") && rule["site"].asString() != site) ||
@@ -192,10 +194,10 @@ Json::Value RelaySim::ServerAnswer(const std::string &site, const Json::Value &r
     if (command != "get_server_info" && command != "request_tunnel") {
         return Failure(3, "unknown command");
     }
-    const std::string serverId = request["serverID"].isString() ? request["serverID"].asString()
-                                                                : std::string();
-    const std::string serviceId = request["id"].isString() ? request["id"].asString()
-                                                           : std::string();
+    const std::string serverId =
+        request["serverID"].isString() ? request["serverID"].asString() : std::string();
+    const std::string serviceId =
+        request["id"].isString() ? request["id"].asString() : std::string();
     for (const Json::Value &server : config["servers"]) {
         if (server["serverID"].asString() != serverId || !KnownAt(server, site)) {
             continue;

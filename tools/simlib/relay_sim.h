@@ -76,16 +76,16 @@ bool BindNotPermitted(const LoopbackServer &server);
 
 // One directory command as it reached the simulator.
 struct RelayHit {
-    std::string site;      // host of the directory server that received it
-    std::string method;    // HTTP method
-    std::string command;   // "command" member; "" when the body is not such a document
-    std::string body;      // the raw request body
-    Json::Value request;   // the body parsed (null when it is not JSON)
-    std::string answer;    // the text answered
+    std::string site;     // host of the directory server that received it
+    std::string method;   // HTTP method
+    std::string command;  // "command" member; "" when the body is not such a document
+    std::string body;     // the raw request body
+    Json::Value request;  // the body parsed (null when it is not JSON)
+    std::string answer;   // the text answered
 };
 
 class RelaySim {
-public:
+  public:
     RelaySim();
     explicit RelaySim(const Json::Value &config);
     RelaySim(const RelaySim &) = delete;
@@ -110,7 +110,7 @@ public:
     size_t HitCount() const;
     void ClearHits();
 
-private:
+  private:
     Json::Value ServerAnswer(const std::string &site, const Json::Value &request) const;
 
     mutable std::mutex mutex_;
@@ -122,7 +122,7 @@ private:
 // ProcessLoopbackAddress(first), (first + 1), ...: the directory hosts of a test or benchmark,
 // host 0 usually standing for the global directory and the others for its sites.
 class RelayDirectory {
-public:
+  public:
     explicit RelayDirectory(int hosts, int first = 0, int port = 80);
     RelayDirectory(const RelayDirectory &) = delete;
     RelayDirectory &operator=(const RelayDirectory &) = delete;
@@ -139,7 +139,7 @@ public:
     LoopbackServer &Server(int i) { return *servers_.at(i); }
     RelaySim &Sim() { return sim_; }
 
-private:
+  private:
     RelaySim sim_;
     std::vector<std::unique_ptr<LoopbackServer>> servers_;
     std::string error_;
@@ -153,7 +153,7 @@ void InstallPingPong(LoopbackServer &server, const std::string &serverId);
 // A TCP port on `host` that refuses connections: bound, never listening, and held for the
 // object's lifetime so that no other socket takes it.
 class RefusedPort {
-public:
+  public:
     explicit RefusedPort(const std::string &host = "127.0.0.1");
     ~RefusedPort();
     RefusedPort(const RefusedPort &) = delete;
@@ -161,7 +161,7 @@ public:
     int Port() const { return port_; }
     const std::string &Host() const { return host_; }
 
-private:
+  private:
     std::string host_;
     int fd_ = -1;
     int port_ = 0;
