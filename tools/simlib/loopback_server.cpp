@@ -206,6 +206,11 @@ bool LoopbackServer::Start() {
     // The socket is bound and listening already, so clients may connect at once; the accept
     // loop picks their connections up from the backlog.
     thread_ = std::thread([this] { server_->listen_after_bind(); });
+    // cpp-httplib's stop() does nothing until the accept loop has marked itself running, so a
+    // Stop right after Start would leave the loop (and the join) running forever.
+    while (!server_->is_running()) {
+        std::this_thread::yield();
+    }
     return true;
 }
 
