@@ -22,6 +22,9 @@ bool PausesBeforeRetry(CURLcode rc) {
 
 // Empties the response stream so that the next attempt does not append to a partial body.
 bool RewindResponseStream(FILE *stream) {
+    // Buffered bytes of the failed attempt are flushed first: written after the truncation,
+    // they would land behind a hole at their old offset.
+    fflush(stream);
     if (ftruncate(fileno(stream), 0) != 0) {
         return false;
     }

@@ -5,7 +5,11 @@
 #include <strings.h>
 #include <arpa/inet.h>
 #include <netinet/in.h>
+#include <poll.h>
 #include <sys/socket.h>
+#include <unistd.h>
+
+#include <chrono>
 
 #include <openssl/bn.h>
 #include <openssl/evp.h>
@@ -206,10 +210,10 @@ bool LoopbackServer::Start() {
     // The socket is bound and listening already, so clients may connect at once; the accept
     // loop picks their connections up from the backlog.
     thread_ = std::thread([this] { server_->listen_after_bind(); });
-    // cpp-httplib's stop() does nothing until the accept loop has marked itself running, so a
-    // Stop right after Start would leave the loop (and the join) running forever.
-    while (!server_->is_running()) {
-        std::this_thread::yield();
+    // A stop issued before the accept loop runs would be lost (and Stop would wait forever), so
+    // Start returns only once the loop is up.
+    for (int i = 0; i < 500 && !server_->is_running(); ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
     return true;
 }
@@ -296,6 +300,129 @@ RecordedRequest LoopbackServer::Last() const {
 void LoopbackServer::ClearRecords() {
     std::lock_guard<std::mutex> lock(mutex_);
     records_.clear();
+}
+
+RawServer::RawServer(Handler handler, const std::string &host)
+    : handler_(std::move(handler)), host_(host) {}
+
+RawServer::~RawServer() {
+    Stop();
+}
+
+bool RawServer::Start() {
+    if (listenFd_ >= 0) {
+        return true;
+    }
+    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0) {
+        return false;
+    }
+    int one = 1;
+    setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof(one));
+    struct sockaddr_in addr = {};
+    addr.sin_family = AF_INET;
+    addr.sin_port = 0;
+    if (inet_pton(AF_INET, host_.c_str(), &addr.sin_addr) != 1 ||
+        bind(fd, reinterpret_cast<struct sockaddr *>(&addr), sizeof(addr)) != 0 ||
+        listen(fd, 16) != 0) {
+        close(fd);
+        return false;
+    }
+    socklen_t len = sizeof(addr);
+    getsockname(fd, reinterpret_cast<struct sockaddr *>(&addr), &len);
+    port_ = ntohs(addr.sin_port);
+    listenFd_ = fd;
+    stopping_ = false;
+    thread_ = std::thread([this] { Serve(); });
+    return true;
+}
+
+void RawServer::Stop() {
+    if (listenFd_ < 0) {
+        return;
+    }
+    stopping_ = true;
+    if (thread_.joinable()) {
+        thread_.join();
+    }
+    close(listenFd_);
+    listenFd_ = -1;
+}
+
+std::string RawServer::BaseUrl() const {
+    return "http://" + host_ + ":" + std::to_string(port_);
+}
+
+void RawServer::Serve() {
+    while (!stopping_) {
+        struct pollfd pfd = {listenFd_, POLLIN, 0};
+        if (poll(&pfd, 1, 50) <= 0) {
+            continue;
+        }
+        int fd = accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC);
+        if (fd < 0) {
+            continue;
+        }
+        Connection conn(fd, accepted_++, &stopping_);
+        // Reads the head for at most two seconds; the body, if any, is left unread.
+        const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(2);
+        char buf[4096];
+        while (conn.head_.find("\r\n\r\n") == std::string::npos && !stopping_ &&
+               std::chrono::steady_clock::now() < deadline) {
+            struct pollfd cfd = {fd, POLLIN, 0};
+            if (poll(&cfd, 1, 50) <= 0) {
+                continue;
+            }
+            ssize_t n = recv(fd, buf, sizeof(buf), 0);
+            if (n <= 0) {
+                break;
+            }
+            conn.head_.append(buf, static_cast<size_t>(n));
+        }
+        size_t end = conn.head_.find("\r\n\r\n");
+        if (end != std::string::npos) {
+            conn.head_.resize(end + 4);
+        }
+        if (handler_) {
+            handler_(conn);
+        }
+        shutdown(fd, SHUT_RDWR);
+        close(fd);
+    }
+}
+
+bool RawServer::Connection::Send(const std::string &bytes) {
+    size_t sent = 0;
+    while (sent < bytes.size()) {
+        ssize_t n = send(fd_, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
+        if (n <= 0) {
+            return false;
+        }
+        sent += static_cast<size_t>(n);
+    }
+    return true;
+}
+
+bool RawServer::Connection::WaitForClose(int ms) {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
+    char buf[4096];
+    while (!*stopping_ && std::chrono::steady_clock::now() < deadline) {
+        struct pollfd pfd = {fd_, POLLIN, 0};
+        if (poll(&pfd, 1, 10) <= 0) {
+            continue;
+        }
+        if (recv(fd_, buf, sizeof(buf), 0) <= 0) {
+            return true;
+        }
+    }
+    return false;
+}
+
+void RawServer::Connection::Pause(int ms) {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
+    while (!*stopping_ && std::chrono::steady_clock::now() < deadline) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
 }
 
 }  // namespace kovasim

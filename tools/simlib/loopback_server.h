@@ -108,6 +108,59 @@ private:
     Handler fallback_;
 };
 
+// A plain TCP server on a loopback address for answers an HTTP library would not give: bodies
+// cut off, stalls, malformed header lines. Connections are served one after another; for each,
+// the request head (through the blank line) is read and the handler writes what it likes.
+class RawServer {
+  public:
+    class Connection {
+      public:
+        // Writes all bytes; false once the peer has gone.
+        bool Send(const std::string &bytes);
+        // Waits up to `ms` milliseconds; returns early when the server stops.
+        void Pause(int ms);
+        // Waits up to `ms` milliseconds for the peer to close the connection; true if it did.
+        bool WaitForClose(int ms);
+        // The request head as received (request line and headers).
+        const std::string &Head() const { return head_; }
+        // 0 for the first connection the server accepted, 1 for the next, ...
+        int Index() const { return index_; }
+
+      private:
+        friend class RawServer;
+        Connection(int fd, int index, const std::atomic<bool> *stopping)
+            : fd_(fd), index_(index), stopping_(stopping) {}
+        int fd_;
+        int index_;
+        const std::atomic<bool> *stopping_;
+        std::string head_;
+    };
+    using Handler = std::function<void(Connection &)>;
+
+    explicit RawServer(Handler handler, const std::string &host = "127.0.0.1");
+    ~RawServer();
+    RawServer(const RawServer &) = delete;
+    RawServer &operator=(const RawServer &) = delete;
+
+    bool Start();
+    void Stop();
+    int Port() const { return port_; }
+    std::string BaseUrl() const;
+    // Connections accepted so far.
+    int ConnectionCount() const { return accepted_; }
+
+  private:
+    void Serve();
+
+    Handler handler_;
+    std::string host_;
+    int listenFd_ = -1;
+    int port_ = 0;
+    std::thread thread_;
+    std::atomic<bool> stopping_{false};
+    std::atomic<int> accepted_{0};
+};
+
 }  // namespace kovasim
 
 #endif  // KOVASIM_LOOPBACK_SERVER_H

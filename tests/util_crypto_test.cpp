@@ -1,0 +1,415 @@
+// Encryption helpers and the encrypted parameter envelopes, checked by decrypting with OpenSSL
+// directly: RSA with the private half of a key made here, AES with a key derived here.
+#include <string.h>
+
+#include <memory>
+#include <string>
+
+#include <gtest/gtest.h>
+#include <openssl/bn.h>
+#include <openssl/core_names.h>
+#include <openssl/evp.h>
+#include <openssl/rsa.h>
+
+#include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_util.h"
+#include "kovacredential/kovaplatform.h"
+#include "platform/json_text.h"
+#include "request/cred_request_p.h"
+#include "simlib/loopback_server.h"
+#include "support/interpose.h"
+#include "support/temp_dir.h"
+
+namespace {
+
+using KOVA::CredRequestUtil;
+
+struct PkeyDeleter {
+    void operator()(EVP_PKEY *k) const { EVP_PKEY_free(k); }
+};
+using Pkey = std::unique_ptr<EVP_PKEY, PkeyDeleter>;
+
+std::string ModulusHex(EVP_PKEY *key) {
+    BIGNUM *n = nullptr;
+    EVP_PKEY_get_bn_param(key, OSSL_PKEY_PARAM_RSA_N, &n);
+    char *hex = BN_bn2hex(n);
+    std::string out(hex);
+    OPENSSL_free(hex);
+    BN_free(n);
+    return out;
+}
+
+std::string Unbase64(const std::string &text) {
+    std::string out(text.size(), '\0');
+    int n = EVP_DecodeBlock(reinterpret_cast<unsigned char *>(&out[0]),
+                            reinterpret_cast<const unsigned char *>(text.data()),
+                            static_cast<int>(text.size()));
+    if (n < 0)
+        return "<bad base64>";
+    size_t pad = 0;
+    while (pad < text.size() && text[text.size() - 1 - pad] == '=')
+        ++pad;
+    out.resize(static_cast<size_t>(n) - pad);
+    return out;
+}
+
+std::string RsaDecrypt(EVP_PKEY *key, const std::string &base64) {
+    std::string raw = Unbase64(base64);
+    EVP_PKEY_CTX *ctx = EVP_PKEY_CTX_new(key, nullptr);
+    std::string out(1024, '\0');
+    size_t len = out.size();
+    bool ok = ctx && EVP_PKEY_decrypt_init(ctx) > 0 &&
+              EVP_PKEY_CTX_set_rsa_padding(ctx, RSA_PKCS1_PADDING) > 0 &&
+              EVP_PKEY_decrypt(ctx, reinterpret_cast<unsigned char *>(&out[0]), &len,
+                               reinterpret_cast<const unsigned char *>(raw.data()), raw.size()) > 0;
+    EVP_PKEY_CTX_free(ctx);
+    if (!ok)
+        return "<decrypt failed>";
+    out.resize(len);
+    return out;
+}
+
+std::string AesDecrypt(const std::string &pass, const std::string &base64) {
+    unsigned char key[32];
+    unsigned char iv[16];
+    EVP_BytesToKey(EVP_aes_256_cbc(), EVP_sha1(), nullptr,
+                   reinterpret_cast<const unsigned char *>(pass.data()),
+                   static_cast<int>(pass.size()), 5, key, iv);
+    std::string raw = Unbase64(base64);
+    std::string out(raw.size() + 32, '\0');
+    int n1 = 0;
+    int n2 = 0;
+    EVP_CIPHER_CTX *ctx = EVP_CIPHER_CTX_new();
+    bool ok = EVP_DecryptInit_ex(ctx, EVP_aes_256_cbc(), nullptr, key, iv) == 1 &&
+              EVP_DecryptUpdate(ctx, reinterpret_cast<unsigned char *>(&out[0]), &n1,
+                                reinterpret_cast<const unsigned char *>(raw.data()),
+                                static_cast<int>(raw.size())) == 1 &&
+              EVP_DecryptFinal_ex(ctx, reinterpret_cast<unsigned char *>(&out[n1]), &n2) == 1;
+    EVP_CIPHER_CTX_free(ctx);
+    if (!ok)
+        return "<decrypt failed>";
+    out.resize(static_cast<size_t>(n1 + n2));
+    return out;
+}
+
+std::string PercentDecode(const std::string &s) {
+    std::string out;
+    for (size_t i = 0; i < s.size(); ++i) {
+        if (s[i] == '%' && i + 2 < s.size()) {
+            out.push_back(static_cast<char>(std::stoi(s.substr(i + 1, 2), nullptr, 16)));
+            i += 2;
+        } else {
+            out.push_back(s[i]);
+        }
+    }
+    return out;
+}
+
+class CryptoTest : public ::testing::Test {
+  protected:
+    static void SetUpTestSuite() {
+        key2048_ = EVP_RSA_gen(2048);
+        key1024_ = EVP_RSA_gen(1024);
+    }
+    static void TearDownTestSuite() {
+        EVP_PKEY_free(key2048_);
+        EVP_PKEY_free(key1024_);
+    }
+    void SetUp() override { kova_test::ClearLog(); }
+    static EVP_PKEY *key2048_;
+    static EVP_PKEY *key1024_;
+};
+EVP_PKEY *CryptoTest::key2048_ = nullptr;
+EVP_PKEY *CryptoTest::key1024_ = nullptr;
+
+TEST_F(CryptoTest, RsaDecryptsWithThePrivateKey) {
+    std::string cipher;
+    ASSERT_TRUE(CredRequestUtil::GetEncString(ModulusHex(key2048_), "account=a&passwd=p", cipher));
+    EXPECT_EQ(cipher.size(), 344u);  // 256 bytes of RSA output in Base64
+    EXPECT_EQ(RsaDecrypt(key2048_, cipher), "account=a&passwd=p");
+    std::string again;
+    ASSERT_TRUE(CredRequestUtil::GetEncString(ModulusHex(key2048_), "account=a&passwd=p", again));
+    EXPECT_NE(cipher, again);  // PKCS#1 v1.5 padding is random
+}
+
+TEST_F(CryptoTest, RsaRejectsEmptyInputsSilently) {
+    std::string cipher = "untouched";
+    EXPECT_FALSE(CredRequestUtil::GetEncString("", "x", cipher));
+    EXPECT_FALSE(CredRequestUtil::GetEncString(ModulusHex(key2048_), "", cipher));
+    EXPECT_EQ(cipher, "untouched");
+    EXPECT_TRUE(kova_test::LogRecords().empty());
+}
+
+TEST_F(CryptoTest, RsaLengthLimits) {
+    // 512 bytes pass the length test and then exceed what a 2048-bit key can take.
+    std::string cipher;
+    EXPECT_FALSE(
+        CredRequestUtil::GetEncString(ModulusHex(key2048_), std::string(512, 'a'), cipher));
+    EXPECT_FALSE(kova_test::LogHas("exceed 512 bytes"));
+    EXPECT_TRUE(kova_test::LogHas("cred_request_util:"));
+    EXPECT_TRUE(kova_test::LogHas(" RSA encrypt fail")) << kova_test::LogDump();
+    kova_test::ClearLog();
+    EXPECT_FALSE(
+        CredRequestUtil::GetEncString(ModulusHex(key2048_), std::string(513, 'a'), cipher));
+    EXPECT_TRUE(kova_test::LogHas("RSA encrypt fail, text exceed 512 bytes assume using AES"));
+    kova_test::ClearLog();
+    // A 1024-bit key takes at most 128 - 11 bytes.
+    EXPECT_TRUE(CredRequestUtil::GetEncString(ModulusHex(key1024_), std::string(117, 'a'), cipher));
+    EXPECT_EQ(RsaDecrypt(key1024_, cipher), std::string(117, 'a'));
+    EXPECT_FALSE(
+        CredRequestUtil::GetEncString(ModulusHex(key1024_), std::string(120, 'a'), cipher));
+    EXPECT_EQ(kova_test::LogCount("RSA encrypt fail"), 1u) << kova_test::LogDump();
+}
+
+TEST_F(CryptoTest, RsaWithNonHexKeyFails) {
+    std::string cipher;
+    EXPECT_FALSE(CredRequestUtil::GetEncString("not-hex", "x", cipher));
+    EXPECT_TRUE(kova_test::LogHas("RSA encrypt fail"));
+}
+
+TEST_F(CryptoTest, AesMatchesIndependentDecryption) {
+    std::string plain = "account=admin&passwd=s%C3%A9cret";
+    std::string cipher;
+    ASSERT_TRUE(CredRequestUtil::GetEncryptAESString("pass phrase", plain, cipher));
+    EXPECT_EQ(AesDecrypt("pass phrase", cipher), plain);
+    std::string again;
+    ASSERT_TRUE(CredRequestUtil::GetEncryptAESString("pass phrase", plain, again));
+    EXPECT_EQ(cipher, again);
+    std::string back;
+    ASSERT_TRUE(CredRequestUtil::GetDecryptAESString("pass phrase", cipher, back));
+    EXPECT_EQ(back, plain);
+}
+
+TEST_F(CryptoTest, AesOfEmptyTextIsOnePaddingBlock) {
+    std::string cipher;
+    ASSERT_TRUE(CredRequestUtil::GetEncryptAESString("k", "", cipher));
+    EXPECT_EQ(cipher.size(), 24u);
+    EXPECT_EQ(Unbase64(cipher).size(), 16u);
+    EXPECT_EQ(AesDecrypt("k", cipher), "");
+}
+
+TEST_F(CryptoTest, AesLongTextCrossesPieceBoundaries) {
+    std::string plain;
+    for (int i = 0; plain.size() < 100000; ++i)
+        plain += std::to_string(i) + ",";
+    std::string cipher;
+    ASSERT_TRUE(CredRequestUtil::GetEncryptAESString("long", plain, cipher));
+    EXPECT_EQ(Unbase64(cipher).size(), (plain.size() / 16 + 1) * 16);
+    EXPECT_EQ(AesDecrypt("long", cipher), plain);
+    std::string back;
+    ASSERT_TRUE(CredRequestUtil::GetDecryptAESString("long", cipher, back));
+    EXPECT_EQ(back, plain);
+}
+
+TEST_F(CryptoTest, AesWrongPassphraseFails) {
+    std::string cipher;
+    ASSERT_TRUE(CredRequestUtil::GetEncryptAESString("right", "some secret text", cipher));
+    int failures = 0;
+    for (const char *wrong : {"wrong", "Right", "right ", "other", "x"}) {
+        std::string plain = "untouched";
+        if (!CredRequestUtil::GetDecryptAESString(wrong, cipher, plain)) {
+            ++failures;
+            EXPECT_EQ(plain, "untouched");
+        }
+    }
+    // A wrong key passes the padding check now and then (about 1 in 256).
+    EXPECT_GE(failures, 4);
+    EXPECT_EQ(kova_test::LogCount("AES Decrypt fail"), static_cast<size_t>(failures));
+}
+
+TEST_F(CryptoTest, AesDecryptRejectsBadBase64) {
+    std::string plain;
+    EXPECT_FALSE(CredRequestUtil::GetDecryptAESString("k", "***", plain));
+    EXPECT_TRUE(kova_test::LogHas("Base64 Decode fail"));
+    EXPECT_FALSE(CredRequestUtil::GetDecryptAESString("k", "", plain));
+    EXPECT_TRUE(kova_test::LogHas("AES Decrypt fail"));
+}
+
+TEST_F(CryptoTest, AesPlainTextWithNulComesBackCut) {
+    std::string cipher;
+    ASSERT_TRUE(CredRequestUtil::GetEncryptAESString("k", std::string("ab\0cd", 5), cipher));
+    std::string plain;
+    ASSERT_TRUE(CredRequestUtil::GetDecryptAESString("k", cipher, plain));
+    EXPECT_EQ(plain, "ab");
+}
+
+TEST_F(CryptoTest, InitAesFillsEitherContext) {
+    EVP_CIPHER_CTX *enc = EVP_CIPHER_CTX_new();
+    const unsigned char pass[] = "pw";
+    EXPECT_EQ(InitAES(pass, 2, nullptr, enc, nullptr), 1);
+    EXPECT_EQ(EVP_CIPHER_CTX_get_key_length(enc), 32);
+    EXPECT_EQ(InitAES(pass, 2, nullptr, nullptr, nullptr), 1);
+    EVP_CIPHER_CTX_free(enc);
+}
+
+// ---- GetEncInfo and the envelopes, against a loopback server.
+
+class EncInfoTest : public CryptoTest {
+  protected:
+    void SetUp() override {
+        CryptoTest::SetUp();
+        server_.Route("POST", "/webapi/encryption.cgi",
+                      [this](const httplib::Request &, httplib::Response &res) {
+                          res.set_content(answer_, "application/json");
+                      });
+        server_.Route("*", "/webapi/entry.cgi",
+                      [](const httplib::Request &req, httplib::Response &res) {
+                          res.set_content(req.body, "text/plain");
+                      });
+        ASSERT_TRUE(server_.Start());
+        Json::Value data;
+        data["cipherkey"] = "__cIpHeRtExT";
+        data["ciphertoken"] = "client_time";
+        data["public_key"] = ModulusHex(key2048_);
+        data["server_time"] = 1700000000;
+        Json::Value root;
+        root["success"] = true;
+        root["data"] = data;
+        answer_ = kova::JsonToString(root);
+    }
+    std::string EncUrl() const { return server_.BaseUrl() + "/webapi/encryption.cgi"; }
+
+    kovasim::LoopbackServer server_;
+    std::string answer_;
+};
+
+TEST_F(EncInfoTest, ReturnsTheDataObject) {
+    Json::Value info;
+    ASSERT_TRUE(CredRequestUtil::GetEncInfo(EncUrl(), info));
+    EXPECT_EQ(info["cipherkey"].asString(), "__cIpHeRtExT");
+    EXPECT_EQ(info["server_time"].asInt(), 1700000000);
+    auto r = server_.Last();
+    EXPECT_EQ(r.Param("api"), "KOVA.API.Encryption");
+    EXPECT_EQ(r.Param("version"), "1");
+    EXPECT_EQ(r.Param("method"), "getinfo");
+    EXPECT_EQ(r.Param("format"), "module");
+}
+
+TEST_F(EncInfoTest, SuccessFalseWithDataStillCounts) {
+    answer_ = "{\"success\":false,\"data\":{\"cipherkey\":\"k\"}}";
+    Json::Value info;
+    ASSERT_TRUE(CredRequestUtil::GetEncInfo(EncUrl(), info));
+    EXPECT_EQ(info["cipherkey"].asString(), "k");
+}
+
+TEST_F(EncInfoTest, InvalidAnswersAndFailures) {
+    Json::Value info;
+    for (const char *bad : {"{\"success\":true}", "<html>", "[1,2]", ""}) {
+        answer_ = bad;
+        kova_test::ClearLog();
+        EXPECT_FALSE(CredRequestUtil::GetEncInfo(EncUrl(), info)) << bad;
+        EXPECT_TRUE(kova_test::LogHas("encryption response is invalid")) << bad;
+    }
+    EXPECT_FALSE(CredRequestUtil::GetEncInfo(server_.BaseUrl() + "/nothing", info));
+    EXPECT_TRUE(kova_test::LogHas("Send encryption request fail.[14]")) << kova_test::LogDump();
+    EXPECT_FALSE(CredRequestUtil::GetEncInfo("", info));
+    EXPECT_TRUE(kova_test::LogHas("Bad parameters"));
+}
+
+TEST_F(EncInfoTest, FromCredentialRecord) {
+    KOVA_CRED cred;
+    cred.protocol = "http";
+    cred.host = "127.0.0.1";
+    cred.port = server_.Port();
+    Json::Value info;
+    EXPECT_FALSE(CredRequestUtil::GetEncInfo(&cred, info));  // never loaded
+    EXPECT_TRUE(kova_test::LogHas("Bad parameters"));
+    EXPECT_EQ(server_.RequestCount(), 0u);
+    EXPECT_FALSE(CredRequestUtil::GetEncInfo(static_cast<const KOVA_CRED *>(nullptr), info));
+    cred.filled = 1;
+    ASSERT_TRUE(CredRequestUtil::GetEncInfo(&cred, info));
+    EXPECT_EQ(server_.Last().path, "/webapi/encryption.cgi");
+    EXPECT_EQ(info["ciphertoken"].asString(), "client_time");
+}
+
+TEST_F(EncInfoTest, UnknownCredentialId) {
+    kova_test::TempDatabase db;
+    Json::Value info;
+    EXPECT_FALSE(CredRequestUtil::GetEncInfo(987654L, info));
+    EXPECT_TRUE(kova_test::LogHas("Cannot find id[987654] in database")) << kova_test::LogDump();
+}
+
+TEST_F(EncInfoTest, RsaEnvelopeWithoutEncUrl) {
+    KOVA::CredRequestPrivate p(nullptr);
+    ASSERT_TRUE(p.SetRawData("Crypto", 1));
+    Json::Value params;
+    params["a"] = "1";
+    params["KovaToken"] = "T";
+    EXPECT_EQ(p.GetParamString(params), "");
+    EXPECT_TRUE(kova_test::LogHas("Get encryption url fail"));
+    EXPECT_TRUE(kova_test::LogHas("GetRSAEncParamString Fail"));
+    EXPECT_TRUE(p.GetParamJsonObj(params).isNull());
+}
+
+TEST_F(EncInfoTest, RsaEnvelopeOnTheWire) {
+    KOVA::CredRequest req;
+    ASSERT_TRUE(req.SetURL(server_.BaseUrl() + "/webapi/entry.cgi"));
+    ASSERT_TRUE(req.SetEncURL(EncUrl()));
+    ASSERT_TRUE(req.SetEncryptParam(false));  // still selects RSA
+    ASSERT_TRUE(req.AddPostParam("account", "admin"));
+    ASSERT_TRUE(req.AddPostParam("passwd", "p w"));
+    ASSERT_TRUE(req.AddPostParam("KovaToken", "TOK"));
+    ASSERT_TRUE(req.Process(true, 0)) << kova_test::LogDump();
+    auto r = server_.Last();
+    EXPECT_EQ(r.path, "/webapi/entry.cgi");
+    ASSERT_TRUE(r.HasParam("__cIpHeRtExT")) << r.body;
+    EXPECT_FALSE(r.HasParam("account"));
+    EXPECT_EQ(r.Param("KovaToken"), "TOK");
+    EXPECT_EQ(r.body.rfind("&KovaToken=TOK"), r.body.size() - 14);
+    EXPECT_EQ(RsaDecrypt(key2048_, r.Param("__cIpHeRtExT")),
+              "account=admin&client_time=1700000000&passwd=p%20w");
+}
+
+int InstalledToken(char *token, size_t tokenSize, char *key, size_t keySize) {
+    snprintf(token, tokenSize, "%s", "token-0123456789");
+    snprintf(key, keySize, "%s", "aes-key-abcdefghijklmnopqrstuvwx");
+    return 0;
+}
+
+TEST_F(EncInfoTest, AesEnvelope) {
+    KOVA::CredRequestPrivate p(nullptr);
+    ASSERT_TRUE(p.SetRawData("Crypto", 2));
+    Json::Value params;
+    params["b"] = "2";
+    params["a"] = "x y";
+    params["KovaToken"] = "T";
+
+    KOVACloudServiceHxtokenSetProvider(nullptr);
+    EXPECT_EQ(p.GetParamString(params), "");
+    EXPECT_TRUE(kova_test::LogHas("Get Token Fail"));
+    EXPECT_TRUE(kova_test::LogHas("GetAESEncParam Fail"));
+
+    KOVACloudServiceHxtokenSetProvider(InstalledToken);
+    std::string s = p.GetParamString(params);
+    KOVACloudServiceHxtokenSetProvider(nullptr);
+    const std::string head = "__tXeTrEhPiC=\"";
+    ASSERT_EQ(s.rfind(head, 0), 0u) << s;
+    size_t close = s.find('"', head.size());
+    ASSERT_NE(close, std::string::npos);
+    EXPECT_EQ(s.substr(close), "\"&__nEkOtReHpIc=\"token-0123456789\"&KovaToken=T");
+    std::string text = PercentDecode(s.substr(head.size(), close - head.size()));
+    std::string plain;
+    ASSERT_TRUE(
+        CredRequestUtil::GetDecryptAESString("aes-key-abcdefghijklmnopqrstuvwx", text, plain));
+    EXPECT_EQ(plain, "a=x%20y&b=2");
+    EXPECT_EQ(AesDecrypt("aes-key-abcdefghijklmnopqrstuvwx", text), "a=x%20y&b=2");
+}
+
+TEST_F(EncInfoTest, AesEnvelopeAsFormFields) {
+    KOVA::CredRequestPrivate p(nullptr);
+    ASSERT_TRUE(p.SetRawData("Crypto", 2));
+    Json::Value params;
+    params["KovaToken"] = "T";
+    KOVACloudServiceHxtokenSetProvider(InstalledToken);
+    Json::Value fields = p.GetParamJsonObj(params);
+    KOVACloudServiceHxtokenSetProvider(nullptr);
+    ASSERT_TRUE(fields.isObject());
+    EXPECT_EQ(fields.size(), 2u);
+    EXPECT_EQ(fields["__nEkOtReHpIc"].asString(), "token-0123456789");
+    std::string plain;
+    ASSERT_TRUE(CredRequestUtil::GetDecryptAESString("aes-key-abcdefghijklmnopqrstuvwx",
+                                                     fields["__tXeTrEhPiC"].asString(), plain));
+    EXPECT_EQ(plain, "KovaToken=T");  // a form field like any other here
+}
+
+}  // namespace
