@@ -26,6 +26,21 @@ Json::Value ServerCommand(const char *command, const std::string &serverId,
     return document;
 }
 
+// Sends one command and accepts only an object answer with "errno" 0: 22 with the document
+// when it cannot be sent or its answer is not JSON, 23 with the answer otherwise.
+bool SendCommand(CredRequestFarlinkPrivate &client, const Json::Value &document,
+                 Json::Value &answer) {
+    if (!client.SendFarlinkRequest(document, answer)) {
+        client.SetError(CRED_REQ_ERR_UNKNOWN, document);
+        return false;
+    }
+    if (!CredRequestFarlinkPrivate::IsSuccessAnswer(answer)) {
+        client.SetError(CRED_REQ_ERR_SERVER_ERRNO, answer);
+        return false;
+    }
+    return true;
+}
+
 // Points the client at another directory host for the object's lifetime.
 class ServerNameScope {
   public:
@@ -90,16 +105,7 @@ bool CredRequestFarlink::GetSiteList(Json::Value &answer) {
             // The site list always comes from the global directory host; the configured
             // server name is put back on every path.
             ServerNameScope global(*d, CredRequestFarlinkPrivate::GlobalServerName());
-            Json::Value document = Command("get_site_list");
-            if (!d->SendFarlinkRequest(document, answer)) {
-                d->SetError(CRED_REQ_ERR_UNKNOWN, document);
-                return false;
-            }
-            if (!CredRequestFarlinkPrivate::IsSuccessAnswer(answer)) {
-                d->SetError(CRED_REQ_ERR_SERVER_ERRNO, answer);
-                return false;
-            }
-            return true;
+            return SendCommand(*d, Command("get_site_list"), answer);
         },
         false);
 }
@@ -138,17 +144,8 @@ bool CredRequestFarlink::RequestTunnel(Json::Value &answer) {
                 d->SetError(CRED_REQ_ERR_BAD_PARAM, Json::Value());
                 return false;
             }
-            Json::Value document =
-                ServerCommand("request_tunnel", d->GetServerId(), d->GetServiceId());
-            if (!d->SendFarlinkRequest(document, answer)) {
-                d->SetError(CRED_REQ_ERR_UNKNOWN, document);
-                return false;
-            }
-            if (!CredRequestFarlinkPrivate::IsSuccessAnswer(answer)) {
-                d->SetError(CRED_REQ_ERR_SERVER_ERRNO, answer);
-                return false;
-            }
-            return true;
+            return SendCommand(
+                *d, ServerCommand("request_tunnel", d->GetServerId(), d->GetServiceId()), answer);
         },
         false);
 }

@@ -13,6 +13,7 @@
 
 #include "kovacredential/cred_request_farlink.h"
 #include "platform/json_text.h"
+#include "relay_fixture.h"
 #include "request/cred_request_farlink_p.h"
 #include "simlib/relay_sim.h"
 
@@ -21,11 +22,7 @@ namespace {
 using KOVA::CredRequestFarlink;
 using KOVA::CredRequestFarlinkPrivate;
 
-Json::Value Parse(const std::string &text) {
-    Json::Value value;
-    EXPECT_TRUE(kova::JsonFromString(text, value)) << text;
-    return value;
-}
+using kova_test::ParseJson;
 
 Json::Value Candidate(const std::string &protocol, const std::string &host, int port) {
     Json::Value candidate(Json::objectValue);
@@ -77,36 +74,32 @@ class ProbeTargets {
     std::vector<std::unique_ptr<kovasim::LoopbackServer>> servers_;
 };
 
+std::string Addr(int i) {
+    return kovasim::ProcessLoopbackAddress(10 + i);
+}
+
+// Server information naming server S1 with the given LAN addresses and service port.
+Json::Value LanInfo(const std::vector<std::string> &addresses, int port) {
+    Json::Value info(Json::objectValue);
+    info["server"]["serverID"] = "S1";
+    info["server"]["interface"] = Json::Value(Json::arrayValue);
+    for (const std::string &address : addresses) {
+        info["server"]["interface"].append(Json::Value(Json::objectValue))["ip"] = address;
+    }
+    info["service"]["port"] = port;
+    return info;
+}
+
 // Probe targets on loopback addresses of this process (any port, no privilege needed).
 class RelayProbeTest : public ::testing::Test {
   protected:
-    static std::string Addr(int i) { return kovasim::ProcessLoopbackAddress(10 + i); }
-
     ProbeTargets targets_;
 };
 
 // Adds the directory: host 0 is the global directory, host 1 its only site.
-class RelayCandidatesTest : public RelayProbeTest {
+class RelayCandidatesTest : public kova_test::RelayDirectoryTest {
   protected:
-    RelayCandidatesTest() : directory_(2) {}
-
-    void SetUp() override {
-        if (!directory_.Start()) {
-            if (directory_.NotPermitted()) {
-                GTEST_SKIP() << "directory hosts need port 80 on loopback addresses, which "
-                                "this process may not bind: "
-                             << directory_.Error();
-            }
-            FAIL() << directory_.Error();
-        }
-        setenv("kovacredential_farlink_global", directory_.Host(0).c_str(), 1);
-        setenv("kovacredential_farlink_server", directory_.Host(1).c_str(), 1);
-    }
-
-    void TearDown() override {
-        unsetenv("kovacredential_farlink_global");
-        unsetenv("kovacredential_farlink_server");
-    }
+    RelayCandidatesTest() : RelayDirectoryTest(2) {}
 
     // One server known at the site, which is the only one in the site list.
     void Serve(const Json::Value &server) {
@@ -124,7 +117,7 @@ class RelayCandidatesTest : public RelayProbeTest {
         return ids;
     }
 
-    kovasim::RelayDirectory directory_;
+    ProbeTargets targets_;
 };
 
 TEST_F(RelayCandidatesTest, DirectThenRelayCandidatesAreProbedInOrder) {
@@ -143,8 +136,8 @@ TEST_F(RelayCandidatesTest, DirectThenRelayCandidatesAreProbedInOrder) {
 
     Json::Value server(Json::objectValue);
     server["serverID"] = "S1";
-    server["interface"].append(Parse("{}"))["ip"] = Addr(0);
-    server["interface"].append(Parse("{}"))["ip"] = Addr(1);
+    server["interface"].append(ParseJson("{}"))["ip"] = Addr(0);
+    server["interface"].append(ParseJson("{}"))["ip"] = Addr(1);
     server["external"]["ip"] = Addr(2);
     server["ddns"] = Addr(3);
     Json::Value &zon = server["services"]["zon"];
@@ -175,11 +168,9 @@ TEST_F(RelayProbeTest, LanPortAloneIgnoresExternalAndDdns) {
     ASSERT_GT(port, 0);
     ASSERT_EQ(targets_.Start("external", Addr(2), port, "S1"), port);
     ASSERT_EQ(targets_.Start("ddns", Addr(3), port, "S1"), port);
-    Json::Value info = Parse(R"({"server": {"serverID": "S1"}, "service": {}})");
-    info["server"]["interface"].append(Parse("{}"))["ip"] = Addr(0);
+    Json::Value info = LanInfo({Addr(0)}, port);
     info["server"]["external"]["ip"] = Addr(2);
     info["server"]["ddns"] = Addr(3);
-    info["service"]["port"] = port;
 
     CredRequestFarlinkPrivate client(nullptr);
     Json::Value candidate = "untouched";
@@ -195,8 +186,7 @@ TEST_F(RelayProbeTest, ExternalPortAloneSkipsTheLanAndServesExternalAndDdns) {
     ASSERT_GT(extPort, 0);
     ASSERT_EQ(targets_.Start("lan", Addr(0), extPort, "S1"), extPort);
     ASSERT_EQ(targets_.Start("ddns", Addr(3), extPort, "S1"), extPort);
-    Json::Value info = Parse(R"({"server": {"serverID": "S1"}, "service": {"port": 0}})");
-    info["server"]["interface"].append(Parse("{}"))["ip"] = Addr(0);
+    Json::Value info = LanInfo({Addr(0)}, 0);
     info["server"]["external"]["ip"] = Addr(2);
     info["server"]["ddns"] = Addr(3);
     info["service"]["ext_port"] = extPort;
@@ -212,18 +202,18 @@ TEST_F(RelayProbeTest, ExternalPortAloneSkipsTheLanAndServesExternalAndDdns) {
 TEST_F(RelayCandidatesTest, NoPortMeans405WithoutProbesAndTheTunnelIsAsked) {
     const int relayPort = targets_.Start("relay", Addr(4), 0, "S1");
     ASSERT_GT(relayPort, 0);
-    Json::Value server = Parse(R"({"serverID": "S1", "services": {"zon": {}}})");
-    server["interface"].append(Parse("{}"))["ip"] = Addr(0);
+    Json::Value server = ParseJson(R"({"serverID": "S1", "services": {"zon": {}}})");
+    server["interface"].append(ParseJson("{}"))["ip"] = Addr(0);
     server["services"]["zon"]["relay_ip"] = Addr(4);
     server["services"]["zon"]["relay_port"] = relayPort;
     Serve(server);
-    Json::Value info = Parse(R"({"server": {"serverID": "S1", "interface": [{"ip": "x"}]},
+    Json::Value info = ParseJson(R"({"server": {"serverID": "S1", "interface": [{"ip": "x"}]},
                                  "service": {"id": "zon"}})");
 
     CredRequestFarlinkPrivate core(nullptr);
     Json::Value candidate;
     EXPECT_FALSE(core.GetAvailableDirectConnInfo(info, candidate));
-    EXPECT_EQ(core.GetErrors(), Parse(R"({"code":405})"));
+    EXPECT_EQ(core.GetErrors(), ParseJson(R"({"code":405})"));
     EXPECT_TRUE(targets_.Order().empty());
 
     CredRequestFarlink client;
@@ -238,7 +228,7 @@ TEST_F(RelayProbeTest, UnusableServerInformationIs402) {
     CredRequestFarlink client;
     Json::Value candidate;
     for (const Json::Value &info :
-         {Json::Value("text"), Parse(R"({"server": {}})"), Parse(R"({"service": {}})")}) {
+         {Json::Value("text"), ParseJson(R"({"server": {}})"), ParseJson(R"({"service": {}})")}) {
         EXPECT_FALSE(client.GetAvailableConnInfo(info, candidate)) << info;
         EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_CONN_INFO) << info;
         EXPECT_EQ(client.GetErrors()["error"], info) << info;
@@ -249,10 +239,7 @@ TEST_F(RelayProbeTest, HostAnsweringAsAnotherServerIsSkipped) {
     const int port = targets_.Start("impostor", Addr(0), 0, "S2");
     ASSERT_GT(port, 0);
     ASSERT_EQ(targets_.Start("real", Addr(1), port, "S1"), port);
-    Json::Value info = Parse(R"({"server": {"serverID": "S1"}, "service": {}})");
-    info["server"]["interface"].append(Parse("{}"))["ip"] = Addr(0);
-    info["server"]["interface"].append(Parse("{}"))["ip"] = Addr(1);
-    info["service"]["port"] = port;
+    Json::Value info = LanInfo({Addr(0), Addr(1)}, port);
     CredRequestFarlinkPrivate client(nullptr);
     Json::Value candidate;
     ASSERT_TRUE(client.GetAvailableDirectConnInfo(info, candidate));
@@ -264,10 +251,7 @@ TEST_F(RelayProbeTest, DeadCandidateIsPassedOverQuickly) {
     const int port = targets_.Start("live", Addr(1), 0, "S1");
     ASSERT_GT(port, 0);
     // Nothing listens on Addr(0) at that port: the connection is refused.
-    Json::Value info = Parse(R"({"server": {"serverID": "S1"}, "service": {}})");
-    info["server"]["interface"].append(Parse("{}"))["ip"] = Addr(0);
-    info["server"]["interface"].append(Parse("{}"))["ip"] = Addr(1);
-    info["service"]["port"] = port;
+    Json::Value info = LanInfo({Addr(0), Addr(1)}, port);
     CredRequestFarlinkPrivate client(nullptr);
     Json::Value candidate;
     auto start = std::chrono::steady_clock::now();
@@ -281,7 +265,7 @@ TEST_F(RelayProbeTest, RelayAddressComesBeforeItsNameOnTheSamePort) {
     kovasim::RefusedPort dead(Addr(4));
     ASSERT_GT(dead.Port(), 0);
     ASSERT_EQ(targets_.Start("relay_dn", Addr(5), dead.Port(), "S1"), dead.Port());
-    Json::Value tunnel = Parse(R"({"errno": 0, "server": {"serverID": "S1"}, "service": {}})");
+    Json::Value tunnel = ParseJson(R"({"errno": 0, "server": {"serverID": "S1"}, "service": {}})");
     tunnel["service"]["relay_ip"] = Addr(4);
     tunnel["service"]["relay_dn"] = Addr(5);
     tunnel["service"]["relay_port"] = dead.Port();
@@ -295,14 +279,15 @@ TEST_F(RelayProbeTest, RelayAddressComesBeforeItsNameOnTheSamePort) {
     EXPECT_EQ(candidate, Candidate("http", Addr(5), dead.Port()));
     EXPECT_EQ(targets_.Order(), std::vector<std::string>{"relay_dn"});
     EXPECT_FALSE(
-        client.GetAvailableRelayConnInfo(Parse(R"({"server": {}, "service": {}})"), candidate));
+        client.GetAvailableRelayConnInfo(ParseJson(R"({"server": {}, "service": {}})"), candidate));
 }
 
 TEST_F(RelayCandidatesTest, PlainServiceIsTheFallbackOfTheHttpsOne) {
     const int port = targets_.Start("plain", Addr(0), 0, "S1");
     ASSERT_GT(port, 0);
-    Json::Value server = Parse(R"({"serverID": "S1", "services": {"zon_https": {}, "zon": {}}})");
-    server["interface"].append(Parse("{}"))["ip"] = Addr(0);
+    Json::Value server =
+        ParseJson(R"({"serverID": "S1", "services": {"zon_https": {}, "zon": {}}})");
+    server["interface"].append(ParseJson("{}"))["ip"] = Addr(0);
     // The HTTPS service's port is refused and it has no relay (the tunnel is refused).
     kovasim::RefusedPort dead(Addr(0));
     server["services"]["zon_https"]["port"] = dead.Port();
@@ -320,7 +305,7 @@ TEST_F(RelayCandidatesTest, EmptyServerIdIs401WithoutAsking) {
     Json::Value candidate;
     Json::Value errors;
     EXPECT_FALSE(CredRequestFarlink::GetConnInfo("", candidate, &errors));
-    EXPECT_EQ(errors, Parse(R"({"code":401})"));
+    EXPECT_EQ(errors, ParseJson(R"({"code":401})"));
     EXPECT_FALSE(CredRequestFarlink::GetConnInfoPortal("", candidate, nullptr));
     EXPECT_EQ(directory_.Sim().HitCount(), 0u);
 }
@@ -328,7 +313,7 @@ TEST_F(RelayCandidatesTest, EmptyServerIdIs401WithoutAsking) {
 TEST_F(RelayCandidatesTest, PortalLookUpAsksForThePortalServices) {
     const int port = targets_.Start("portal", Addr(0), 0, "S1", true);
     ASSERT_GT(port, 0);
-    Json::Value server = Parse(R"({"serverID": "S1", "services": {"zon_portal_https": {}}})");
+    Json::Value server = ParseJson(R"({"serverID": "S1", "services": {"zon_portal_https": {}}})");
     server["external"]["ip"] = Addr(0);
     server["services"]["zon_portal_https"]["ext_port"] = port;
     Serve(server);
@@ -344,7 +329,7 @@ TEST_F(RelayCandidatesTest, PortalLookUpAsksForThePortalServices) {
     EXPECT_EQ(ServiceIdsAsked("get_server_info"),
               (std::vector<std::string>{"zon_portal_https", "zon_portal"}));
     EXPECT_EQ(errors["code"], 23);
-    EXPECT_EQ(Parse(errors["error"].asString())["errno"], 4);
+    EXPECT_EQ(ParseJson(errors["error"].asString())["errno"], 4);
 }
 
 TEST_F(RelayCandidatesTest, LookUpWithoutADirectoryReportsTheLastError) {
@@ -352,7 +337,7 @@ TEST_F(RelayCandidatesTest, LookUpWithoutADirectoryReportsTheLastError) {
     Json::Value candidate;
     Json::Value errors;
     EXPECT_FALSE(CredRequestFarlink::GetConnInfo("S1", candidate, &errors));
-    EXPECT_EQ(errors, Parse(R"({"code":22,"error":{"command":"get_site_list","version":1}})"));
+    EXPECT_EQ(errors, ParseJson(R"({"code":22,"error":{"command":"get_site_list","version":1}})"));
 }
 
 }  // namespace

@@ -10,6 +10,7 @@
 #include "kovacredential/cred_request_farlink.h"
 #include "platform/json_text.h"
 #include "request/cred_request_farlink_p.h"
+#include "relay_fixture.h"
 #include "simlib/relay_sim.h"
 
 namespace {
@@ -17,42 +18,23 @@ namespace {
 using KOVA::CredRequest;
 using KOVA::CredRequestFarlink;
 
-Json::Value Parse(const std::string &text) {
-    Json::Value value;
-    EXPECT_TRUE(kova::JsonFromString(text, value)) << text;
-    return value;
-}
+using kova_test::ParseJson;
 
-// Host 0 is the global directory, hosts 1 to 3 are sites; the environment points the client's
-// default and global directory hosts at hosts 1 and 0.
-class RelayCommandsTest : public ::testing::Test {
+// Host 0 is the global directory, hosts 1 to 3 are sites.
+class RelayCommandsTest : public kova_test::RelayDirectoryTest {
   protected:
-    RelayCommandsTest() : directory_(4) {}
+    RelayCommandsTest() : RelayDirectoryTest(4) {}
 
     void SetUp() override {
-        if (!directory_.Start()) {
-            if (directory_.NotPermitted()) {
-                GTEST_SKIP() << "directory hosts need port 80 on loopback addresses, which "
-                                "this process may not bind: "
-                             << directory_.Error();
-            }
-            FAIL() << directory_.Error();
+        RelayDirectoryTest::SetUp();
+        if (IsSkipped() || HasFatalFailure()) {
+            return;
         }
-        setenv("kovacredential_farlink_global", Host(0).c_str(), 1);
-        setenv("kovacredential_farlink_server", Host(1).c_str(), 1);
         Configure(R"({"servers": [{"serverID": "S1",
                         "interface": [{"ip": "10.0.0.5"}], "ddns": "s1.example",
                         "services": {"zon": {"port": 5000, "ext_port": 0,
                                              "relay_ip": "10.9.9.9", "relay_port": 7000}}}]})");
     }
-
-    void TearDown() override {
-        unsetenv("kovacredential_farlink_global");
-        unsetenv("kovacredential_farlink_server");
-    }
-
-    const std::string &Host(int i) const { return directory_.Host(i); }
-    kovasim::RelaySim &Sim() { return directory_.Sim(); }
 
     // Replaces the simulator's configuration; "%1" .. "%3" stand for the sites' hosts.
     void Configure(std::string text) {
@@ -63,10 +45,8 @@ class RelayCommandsTest : public ::testing::Test {
             }
         }
         std::string error;
-        ASSERT_TRUE(Sim().Configure(Parse(text), &error)) << error;
+        ASSERT_TRUE(Sim().Configure(ParseJson(text), &error)) << error;
     }
-
-    kovasim::RelayDirectory directory_;
 };
 
 TEST_F(RelayCommandsTest, RequestDocumentsOnTheWire) {
@@ -92,7 +72,7 @@ TEST_F(RelayCommandsTest, RequestDocumentsOnTheWire) {
     EXPECT_EQ(hits[2].site, Host(1));
     EXPECT_EQ(hits[2].body,
               R"({"command":"request_tunnel","id":"zon_portal","serverID":"S1","version":1})");
-    EXPECT_EQ(answer, Parse(R"({"errno": 0, "server": {"serverID": "S1"},
+    EXPECT_EQ(answer, ParseJson(R"({"errno": 0, "server": {"serverID": "S1"},
         "service": {"id": "zon_portal", "relay_ip": "10.9.9.9", "relay_port": 7000}})"));
 }
 
@@ -112,7 +92,7 @@ TEST_F(RelayCommandsTest, ServerInformationIsTheWholeAnswer) {
     client.SetServerId("S1");
     Json::Value info;
     ASSERT_TRUE(client.GetServerInfo(info)) << client.GetErrors().toStyledString();
-    EXPECT_EQ(info, Parse(R"({"errno": 0,
+    EXPECT_EQ(info, ParseJson(R"({"errno": 0,
         "server": {"serverID": "S1", "interface": [{"ip": "10.0.0.5"}], "ddns": "s1.example"},
         "service": {"id": "zon", "port": 5000, "ext_port": 0}})"));
 }
@@ -125,19 +105,19 @@ TEST_F(RelayCommandsTest, PreparedServerInfoRequestIsNotSent) {
     EXPECT_EQ(Sim().HitCount(), 0u);
     ASSERT_TRUE(request->Process(true, 0));
     EXPECT_EQ(Sim().HitCount(), 1u);
-    Json::Value answer = Parse(request->GetResponse());
+    Json::Value answer = ParseJson(request->GetResponse());
     EXPECT_EQ(answer["server"]["serverID"], "S1");
 }
 
 TEST_F(RelayCommandsTest, MissingServerIdIs401ForInformationAnd1ForTunnels) {
     CredRequestFarlink client;
     EXPECT_EQ(client.GetServerInfo(), nullptr);
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":401})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":401})"));
     Json::Value answer;
     EXPECT_FALSE(client.GetServerInfo(answer));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":22})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":22})"));
     EXPECT_FALSE(client.RequestTunnel(answer));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":1})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":1})"));
     EXPECT_EQ(Sim().HitCount(), 0u);
 }
 
@@ -195,7 +175,7 @@ TEST_F(RelayCommandsTest, UnusableSiteListsFailWithoutANewError) {
         client.SetError(KOVA::CRED_REQ_ERR_NO_PORT, "before");
         Json::Value info = "untouched";
         EXPECT_FALSE(client.GetAvailableServerInfo(info)) << list;
-        EXPECT_EQ(client.GetErrors(), Parse(R"({"code":405,"error":"before"})")) << list;
+        EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":405,"error":"before"})")) << list;
         EXPECT_EQ(Sim().HitCount(), 1u) << list;
     }
 }
@@ -209,7 +189,7 @@ TEST_F(RelayCommandsTest, FailingSiteListLeavesTheServerName) {
                                "relay_ip": "10.9.9.9", "relay_port": 7000}}}]})");
     Json::Value answer;
     EXPECT_FALSE(client.GetSiteList(answer));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":23,"error":{"errno":7}})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":{"errno":7}})"));
     EXPECT_FALSE(client.GetAvailableServerInfo(answer));
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_SERVER_ERRNO);
     ASSERT_TRUE(client.RequestTunnel(answer));
@@ -219,7 +199,7 @@ TEST_F(RelayCommandsTest, FailingSiteListLeavesTheServerName) {
     setenv("kovacredential_farlink_global", kovasim::ProcessLoopbackAddress(9).c_str(), 1);
     EXPECT_FALSE(client.GetSiteList(answer));
     EXPECT_EQ(client.GetErrors(),
-              Parse(R"({"code":22,"error":{"command":"get_site_list","version":1}})"));
+              ParseJson(R"({"code":22,"error":{"command":"get_site_list","version":1}})"));
     Sim().ClearHits();
     ASSERT_TRUE(client.RequestTunnel(answer));
     EXPECT_EQ(Sim().Hits("request_tunnel")[0].site, Host(3));
@@ -232,12 +212,12 @@ TEST_F(RelayCommandsTest, ErrnoAnswersGive23WithTheAnswer) {
     client.SetServerId("S9");
     Json::Value answer;
     EXPECT_FALSE(client.RequestTunnel(answer));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":23,"error":{"errno":1}})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":{"errno":1}})"));
     // Server information gives the raw text as detail.
     EXPECT_FALSE(client.GetServerInfo(answer));
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_SERVER_ERRNO);
     EXPECT_EQ(client.GetErrors()["error"], Sim().Hits("get_server_info")[0].answer);
-    EXPECT_EQ(Parse(client.GetErrors()["error"].asString())["errno"], 4);
+    EXPECT_EQ(ParseJson(client.GetErrors()["error"].asString())["errno"], 4);
 }
 
 TEST_F(RelayCommandsTest, NonJsonAnswersGive23ForInformationAnd22ForTheOthers) {
@@ -246,27 +226,27 @@ TEST_F(RelayCommandsTest, NonJsonAnswersGive23ForInformationAnd22ForTheOthers) {
     client.SetServerId("S1");
     Json::Value answer;
     EXPECT_FALSE(client.GetServerInfo(answer));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":23,"error":"<html>busy</html>"})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":"<html>busy</html>"})"));
     EXPECT_FALSE(client.GetSiteList(answer));
     EXPECT_EQ(client.GetErrors(),
-              Parse(R"({"code":22,"error":{"command":"get_site_list","version":1}})"));
+              ParseJson(R"({"code":22,"error":{"command":"get_site_list","version":1}})"));
     EXPECT_FALSE(client.RequestTunnel(answer));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":22,"error":{"command":"request_tunnel",
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":22,"error":{"command":"request_tunnel",
                                             "id":"zon","serverID":"S1","version":1}})"));
 }
 
 TEST_F(RelayCommandsTest, JsonThatIsNoObjectIsSentButNotAccepted) {
     Configure(R"({"answers": [{"json": [1, 2]}]})");
     KOVA::CredRequestFarlinkPrivate core(nullptr);
-    Json::Value body = Parse(R"({"version":1,"command":"get_site_list"})");
+    Json::Value body = ParseJson(R"({"version":1,"command":"get_site_list"})");
     Json::Value answer;
     EXPECT_TRUE(core.SendFarlinkRequest(body, answer));
-    EXPECT_EQ(answer, Parse("[1,2]"));
+    EXPECT_EQ(answer, ParseJson("[1,2]"));
     EXPECT_FALSE(core.CheckResponse(kova::JsonToString(answer), nullptr));
 
     CredRequestFarlink client;
     EXPECT_FALSE(client.GetSiteList(answer));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":23,"error":[1,2]})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":[1,2]})"));
 }
 
 TEST_F(RelayCommandsTest, TransportFailureGives22WithTheRequestError) {
@@ -275,11 +255,11 @@ TEST_F(RelayCommandsTest, TransportFailureGives22WithTheRequestError) {
     client.SetServerName(kovasim::ProcessLoopbackAddress(9));  // nothing listens there
     Json::Value info;
     EXPECT_FALSE(client.GetServerInfo(info));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":22,"error":20})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":22,"error":20})"));
     client.SetServerName(Host(2));
     Configure(R"({"answers": [{"raw": ""}]})");
     EXPECT_FALSE(client.GetServerInfo(info));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":23,"error":""})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":""})"));
 }
 
 }  // namespace

@@ -8,7 +8,7 @@
 #include <gtest/gtest.h>
 
 #include "kovacredential/cred_request_farlink.h"
-#include "platform/json_text.h"
+#include "relay_fixture.h"
 #include "request/cred_request_farlink_p.h"
 #include "simlib/relay_sim.h"
 #include "support/interpose.h"
@@ -36,11 +36,7 @@ class ScopedEnv {
     std::string old_;
 };
 
-Json::Value Parse(const std::string &text) {
-    Json::Value value;
-    EXPECT_TRUE(kova::JsonFromString(text, value)) << text;
-    return value;
-}
+using kova_test::ParseJson;
 
 TEST(RelayConfig, ServiceIdsSelectTheirProtocol) {
     CredRequestFarlinkPrivate client(nullptr);
@@ -100,7 +96,7 @@ TEST(RelayConfig, EmptyServerIdClearsTheDigestWith401) {
     EXPECT_EQ(client.GetServerId(), "");
     EXPECT_EQ(client.GetServerIdMd5(), "");
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_SERVER_ID);
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":401})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":401})"));
 }
 
 TEST(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuild) {
@@ -135,19 +131,19 @@ TEST(RelayConfig, ClearRestoresConnectionSettingsOnly) {
     EXPECT_EQ(client.GetServerId(), "abc");
     EXPECT_EQ(client.GetServiceId(), "zon_portal_https");
     EXPECT_EQ(client.GetServiceProtocol(), "https");
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":23,"error":"kept"})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":"kept"})"));
 }
 
 TEST(RelayConfig, ErrorDocumentCarriesTheDetailOnlyWhenThereIsOne) {
     CredRequestFarlink client;
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":0})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":0})"));
     client.SetError(KOVA::CRED_REQ_ERR_NO_PORT);
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":405})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":405})"));
     client.SetError(KOVA::CRED_REQ_ERR_UNKNOWN, 20);
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":22,"error":20})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":22,"error":20})"));
     client.SetError(KOVA::CRED_REQ_ERR_NO_CONN_INFO, Json::Value(Json::objectValue));
-    EXPECT_EQ(client.GetErrors(), Parse(R"({"code":402})"));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":402})"));
 }
 
 TEST(RelayConfig, CheckResponseAcceptsOnlyObjectsWithErrnoZero) {
@@ -161,7 +157,7 @@ TEST(RelayConfig, CheckResponseAcceptsOnlyObjectsWithErrnoZero) {
     EXPECT_EQ(out, Json::Value("untouched"));
     EXPECT_TRUE(client.CheckResponse("{\"a\":1}", nullptr));
     EXPECT_TRUE(client.CheckResponse("{\"errno\":0,\"sites\":[\"s\"]}", &out));
-    EXPECT_EQ(out, Parse(R"({"errno":0,"sites":["s"]})"));
+    EXPECT_EQ(out, ParseJson(R"({"errno":0,"sites":["s"]})"));
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
 }
 

@@ -6,30 +6,22 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/json_text.h"
+#include "relay_fixture.h"
 #include "simlib/relay_sim.h"
 #include "support/temp_dir.h"
 
 namespace {
 
-Json::Value Parse(const std::string &text) {
-    Json::Value value;
-    EXPECT_TRUE(kova::JsonFromString(text, value)) << "[" << text << "]";
-    return value;
-}
+using kova_test::ParseJson;
 
-class RelayResolveTest : public ::testing::Test {
+class RelayResolveTest : public kova_test::RelayDirectoryTest {
   protected:
-    RelayResolveTest() : directory_(2) {}
+    RelayResolveTest() : RelayDirectoryTest(2) {}
 
     void SetUp() override {
-        if (!directory_.Start()) {
-            if (directory_.NotPermitted()) {
-                GTEST_SKIP() << "directory hosts need port 80 on loopback addresses, which "
-                                "this process may not bind: "
-                             << directory_.Error();
-            }
-            FAIL() << directory_.Error();
+        RelayDirectoryTest::SetUp();
+        if (IsSkipped() || HasFatalFailure()) {
+            return;
         }
         kovasim::LoopbackServer::Options options;
         options.host = kovasim::ProcessLoopbackAddress(10);
@@ -58,7 +50,6 @@ class RelayResolveTest : public ::testing::Test {
         return kova_test::RunCommand(command, out);
     }
 
-    kovasim::RelayDirectory directory_;
     std::unique_ptr<kovasim::LoopbackServer> target_;
 };
 
@@ -69,13 +60,13 @@ TEST_F(RelayResolveTest, PrintsTheCandidate) {
     expected["protocol"] = "http";
     expected["host"] = target_->Host();
     expected["port"] = target_->Port();
-    EXPECT_EQ(Parse(out), expected);
+    EXPECT_EQ(ParseJson(out), expected);
 }
 
 TEST_F(RelayResolveTest, PortalFlagLooksUpThePortalService) {
     std::string out;
     ASSERT_EQ(Resolve("S1 --portal", &out), 0) << out;
-    EXPECT_EQ(Parse(out)["port"], target_->Port());
+    EXPECT_EQ(ParseJson(out)["port"], target_->Port());
     std::vector<std::string> ids;
     for (const auto &hit : directory_.Sim().Hits("get_server_info")) {
         ids.push_back(hit.request["id"].asString());
@@ -86,12 +77,12 @@ TEST_F(RelayResolveTest, PortalFlagLooksUpThePortalService) {
 TEST_F(RelayResolveTest, FailurePrintsTheErrorDocumentAndExitsNonZero) {
     std::string out;
     EXPECT_EQ(Resolve("UNKNOWN", &out), 23) << out;  // the directory's error
-    Json::Value errors = Parse(out);
+    Json::Value errors = ParseJson(out);
     EXPECT_EQ(errors["code"], 23);
-    EXPECT_EQ(Parse(errors["error"].asString())["errno"], 4);
+    EXPECT_EQ(ParseJson(errors["error"].asString())["errno"], 4);
 
     EXPECT_EQ(Resolve("''", &out), 1) << out;  // 401 does not fit an exit status
-    EXPECT_EQ(Parse(out), Parse(R"({"code":401})"));
+    EXPECT_EQ(ParseJson(out), ParseJson(R"({"code":401})"));
     EXPECT_EQ(directory_.Sim().Hits("get_site_list").size(), 2u);
 }
 
