@@ -1,0 +1,159 @@
+// relay_bench: what a whole look-up by server id costs against the requests it is made of.
+//
+// A simulated directory (global host and one site, on port 80 of loopback addresses) knows a
+// server that offers only the plain "zon" service, whose LAN addresses are k dead ones (refused
+// ports) followed by the live one. One resolution is GetConnInfo: site list and server
+// information for "zon_https" (refused by the directory), site list and server information for
+// "zon", k refused probes and one probe that succeeds. The same requests are then sent one by
+// one with plain CredRequests and timed alone; their sum is what a resolution should cost if
+// it adds no waits of its own.
+#include <stdio.h>
+#include <stdlib.h>
+
+#include <algorithm>
+#include <chrono>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include <json/value.h>
+
+#include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_farlink.h"
+#include "platform/json_text.h"
+#include "simlib/relay_sim.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+double Millis(Clock::duration d) {
+    return std::chrono::duration<double, std::milli>(d).count();
+}
+
+double Median(std::vector<double> values) {
+    std::sort(values.begin(), values.end());
+    return values[values.size() / 2];
+}
+
+// One directory command exactly as the client sends it.
+bool DirectoryRequest(const std::string &host, const Json::Value &body) {
+    KOVA::CredRequest request;
+    request.SetURL("http", host, 80, "/Serv.php");
+    request.SetHTTPSVerify(false);
+    request.SetResponseTimeout(5);
+    request.AddRawParam(kova::JsonToString(body));
+    return request.Process(true, 0);
+}
+
+// One direct probe exactly as the client sends it.
+bool Probe(const std::string &host, int port) {
+    KOVA::CredRequest request;
+    request.SetURL("http", host, port, "/webman/pingpong.cgi");
+    request.SetResponseTimeout(5);
+    request.SetDefaultTimeout(10);
+    return request.Process(true, 0);
+}
+
+template <typename Fn>
+double Time(Fn fn) {
+    auto start = Clock::now();
+    fn();
+    return Millis(Clock::now() - start);
+}
+
+}  // namespace
+
+int main() {
+    kovasim::RelayDirectory directory(2);
+    if (!directory.Start()) {
+        printf("relay_bench: skipped: the directory needs port 80 on loopback addresses (%s)\n",
+               directory.Error().c_str());
+        return directory.NotPermitted() ? 0 : 1;
+    }
+    const std::string global = directory.Host(0);
+    const std::string site = directory.Host(1);
+    setenv("kovacredential_farlink_global", global.c_str(), 1);
+    setenv("kovacredential_farlink_server", site.c_str(), 1);
+
+    kovasim::LoopbackServer::Options options;
+    options.host = kovasim::ProcessLoopbackAddress(10);
+    kovasim::LoopbackServer live(options);
+    kovasim::InstallPingPong(live, "BENCH");
+    if (!live.Start()) {
+        fprintf(stderr, "relay_bench: cannot start the server: %s\n", live.Error().c_str());
+        return 1;
+    }
+    const int port = live.Port();
+
+    const int counts[] = {0, 4, 16};
+    const int rounds = 200;
+    printf(
+        "relay_bench: GetConnInfo with k refused candidates before the live one "
+        "(median of %d rounds)\n",
+        rounds);
+    printf("%4s  %14s  %14s  %16s  %7s\n", "k", "resolution ms", "sum of parts", "(dir + probes)",
+           "ratio");
+    bool withinTarget = true;
+    for (int k : counts) {
+        // The dead addresses have nothing listening at the live server's port.
+        Json::Value server(Json::objectValue);
+        server["serverID"] = "BENCH";
+        std::vector<std::string> dead;
+        for (int i = 0; i < k; ++i) {
+            dead.push_back(kovasim::ProcessLoopbackAddress(20 + i));
+            server["interface"].append(Json::Value(Json::objectValue))["ip"] = dead.back();
+        }
+        server["interface"].append(Json::Value(Json::objectValue))["ip"] = options.host;
+        server["services"]["zon"]["port"] = port;
+        Json::Value config(Json::objectValue);
+        config["sites"].append(site);
+        config["servers"].append(server);
+        directory.Sim().Configure(config);
+
+        Json::Value siteList(Json::objectValue);
+        siteList["version"] = 1;
+        siteList["command"] = "get_site_list";
+        Json::Value httpsInfo = siteList;
+        httpsInfo["command"] = "get_server_info";
+        httpsInfo["serverID"] = "BENCH";
+        httpsInfo["id"] = "zon_https";
+        Json::Value plainInfo = httpsInfo;
+        plainInfo["id"] = "zon";
+
+        std::vector<double> resolution, parts, directoryParts, probeParts;
+        for (int round = 0; round < rounds; ++round) {
+            Json::Value candidate;
+            Json::Value errors;
+            bool ok = true;
+            resolution.push_back(Time(
+                [&] { ok = KOVA::CredRequestFarlink::GetConnInfo("BENCH", candidate, &errors); }));
+            if (!ok || candidate["host"].asString() != options.host) {
+                fprintf(stderr, "relay_bench: resolution failed: %s\n",
+                        kova::JsonToString(errors).c_str());
+                return 1;
+            }
+            double dirMs = Time([&] { DirectoryRequest(global, siteList); }) +
+                           Time([&] { DirectoryRequest(site, httpsInfo); }) +
+                           Time([&] { DirectoryRequest(global, siteList); }) +
+                           Time([&] { DirectoryRequest(site, plainInfo); });
+            double probeMs = 0;
+            for (const std::string &host : dead) {
+                probeMs += Time([&] { Probe(host, port); });
+            }
+            probeMs += Time([&] { Probe(options.host, port); });
+            directoryParts.push_back(dirMs);
+            probeParts.push_back(probeMs);
+            parts.push_back(dirMs + probeMs);
+        }
+        double r = Median(resolution);
+        double p = Median(parts);
+        char split[64];
+        snprintf(split, sizeof(split), "%.3f + %.3f", Median(directoryParts), Median(probeParts));
+        printf("%4d  %14.3f  %14.3f  %16s  %7.3f\n", k, r, p, split, r / p);
+        withinTarget = withinTarget && r <= 1.1 * p;
+    }
+    printf("target: a resolution costs at most 1.1 times the sum of its parts: %s\n",
+           withinTarget ? "met" : "NOT met");
+    return 0;
+}

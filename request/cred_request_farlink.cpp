@@ -1,0 +1,253 @@
+// KOVA::CredRequestFarlink and the core of its implementation object: settings, service ids,
+// the server id and its MD5, the error state, and one directory request to "/Serv.php".
+#include "request/cred_request_farlink_p.h"
+
+#include <stdio.h>
+#include <stdlib.h>
+
+#include <memory>
+#include <new>
+
+#include <openssl/evp.h>
+
+#include "platform/json_text.h"
+#include "platform/kova_log.h"
+
+namespace KOVA {
+
+namespace {
+
+// The unit name that the client's log records carry.
+const char kLogUnit[] = "cred_request_farlink_conn";
+const char kDirectoryPath[] = "/Serv.php";
+const long kDefaultTimeout = 5;
+
+std::string HostFromEnv(const char *variable, const char *fallback) {
+    const char *value = getenv(variable);
+    return (value != nullptr && value[0] != '\0') ? std::string(value) : std::string(fallback);
+}
+
+struct MdCtxDeleter {
+    void operator()(EVP_MD_CTX *ctx) const { EVP_MD_CTX_free(ctx); }
+};
+
+// Lower-case hexadecimal MD5 of `text`; "" when the digest cannot be computed.
+std::string Md5Hex(const std::string &text) {
+    std::unique_ptr<EVP_MD_CTX, MdCtxDeleter> ctx(EVP_MD_CTX_new());
+    unsigned char digest[EVP_MAX_MD_SIZE];
+    unsigned int length = 0;
+    if (!ctx || EVP_DigestInit_ex(ctx.get(), EVP_md5(), nullptr) != 1 ||
+        EVP_DigestUpdate(ctx.get(), text.data(), text.size()) != 1 ||
+        EVP_DigestFinal_ex(ctx.get(), digest, &length) != 1) {
+        return "";
+    }
+    std::string hex;
+    for (unsigned int i = 0; i < length && i < 32; ++i) {
+        char pair[3];
+        snprintf(pair, sizeof(pair), "%02x", digest[i]);
+        hex += pair;
+    }
+    return hex;
+}
+
+}  // namespace
+
+// ---- CredRequestFarlinkPrivate: settings.
+
+CredRequestFarlinkPrivate::CredRequestFarlinkPrivate(CredRequestFarlink *ownerObject)
+    : owner(ownerObject), serverName(DefaultServerName()) {}
+
+CredRequestFarlinkPrivate::~CredRequestFarlinkPrivate() = default;
+
+std::string CredRequestFarlinkPrivate::DefaultServerName() {
+    return HostFromEnv("kovacredential_farlink_server", KOVA_DEFAULT_FARLINK_SERVER);
+}
+
+std::string CredRequestFarlinkPrivate::GlobalServerName() {
+    return HostFromEnv("kovacredential_farlink_global", KOVA_DEFAULT_FARLINK_GLOBAL);
+}
+
+// Line number carried by the record of an unsupported service id.
+const int kUnsupportedServiceIdLine = 64;
+
+void CredRequestFarlinkPrivate::SetServiceId(const std::string &id) {
+    // The id is kept even when it is not supported: later requests send it as it stands.
+    serviceId = id;
+    if (id == "zon" || id == "zon_portal") {
+        serviceProtocol = "http";
+    } else if (id == "zon_https" || id == "zon_portal_https") {
+        serviceProtocol = "https";
+    } else {
+        kova::Log("%s:%d Service id[%s] is not supported", kLogUnit, kUnsupportedServiceIdLine,
+                  id.c_str());
+    }
+}
+
+void CredRequestFarlinkPrivate::SetHTTPS(bool https, bool verify) {
+    useHTTPS = https;
+    verifyHTTPS = verify;
+}
+
+void CredRequestFarlinkPrivate::SetServerName(const std::string &name) {
+    serverName = name;
+}
+
+void CredRequestFarlinkPrivate::SetTimeout(long seconds) {
+    timeout = seconds;
+}
+
+void CredRequestFarlinkPrivate::SetServerId(const std::string &id) {
+    if (id == serverId) {
+        return;
+    }
+    serverId = id;
+    SetServerIdMd5(id);
+}
+
+void CredRequestFarlinkPrivate::SetServerIdMd5(const std::string &id) {
+    if (id.empty()) {
+        SetError(CRED_REQ_ERR_NO_SERVER_ID, Json::Value());
+        serverIdMd5.clear();
+        return;
+    }
+    serverIdMd5 = Md5Hex(id);
+}
+
+void CredRequestFarlinkPrivate::Clear() {
+    serverName = DefaultServerName();
+    useHTTPS = false;
+    verifyHTTPS = false;
+    timeout = kDefaultTimeout;
+}
+
+// ---- Errors.
+
+void CredRequestFarlinkPrivate::SetError(KOVA::_tag_CRED_REQ_ERR code, const Json::Value &detail) {
+    error = code;
+    errorDetail = detail;
+}
+
+Json::Value CredRequestFarlinkPrivate::GetErrors() const {
+    Json::Value errors(Json::objectValue);
+    errors["code"] = static_cast<int>(error);
+    if (!errorDetail.empty()) {
+        errors["error"] = errorDetail;
+    }
+    return errors;
+}
+
+// ---- Directory protocol.
+
+bool CredRequestFarlinkPrivate::IsSuccessAnswer(const Json::Value &answer) {
+    if (!answer.isObject()) {
+        return false;
+    }
+    // A missing "errno" counts as 0; one that is no number cannot be 0.
+    const Json::Value *errnoValue = answer.find("errno", "errno" + 5);
+    if (errnoValue == nullptr || errnoValue->isNull()) {
+        return true;
+    }
+    return errnoValue->isConvertibleTo(Json::intValue) && errnoValue->asInt() == 0;
+}
+
+bool CredRequestFarlinkPrivate::CheckResponse(const std::string &text, Json::Value *out) {
+    Json::Value parsed;
+    if (text.empty() || !kova::JsonFromString(text, parsed) || !IsSuccessAnswer(parsed)) {
+        return false;
+    }
+    if (out != nullptr) {
+        out->swap(parsed);
+    }
+    return true;
+}
+
+CredRequest *CredRequestFarlinkPrivate::CreateFarlinkRequest(const Json::Value &body) {
+    if (serverName.empty()) {
+        SetError(CRED_REQ_ERR_NO_SERVICE_ID, Json::Value());
+        return nullptr;
+    }
+    if (body.empty()) {
+        SetError(CRED_REQ_ERR_EMPTY_REQUEST, Json::Value());
+        return nullptr;
+    }
+    std::unique_ptr<CredRequest> request(new (std::nothrow) CredRequest());
+    if (!request) {
+        SetError(CRED_REQ_ERR_UNKNOWN, Json::Value());
+        return nullptr;
+    }
+    if (!request->SetURL(useHTTPS ? "https" : "http", serverName, useHTTPS ? 443 : 80,
+                         kDirectoryPath)) {
+        SetError(CRED_REQ_ERR_UNKNOWN, "SetURL fail");
+        return nullptr;
+    }
+    request->SetHTTPSVerify(verifyHTTPS);
+    if (timeout > 0 && !request->SetResponseTimeout(timeout)) {
+        SetError(CRED_REQ_ERR_UNKNOWN, "Cannot set timeout");
+        return nullptr;
+    }
+    if (!request->AddRawParam(kova::JsonToString(body))) {
+        SetError(CRED_REQ_ERR_UNKNOWN, body);
+        return nullptr;
+    }
+    return request.release();
+}
+
+bool CredRequestFarlinkPrivate::SendFarlinkRequest(const Json::Value &body, Json::Value &answer) {
+    std::unique_ptr<CredRequest> request(CreateFarlinkRequest(body));
+    if (!request) {
+        SetError(CRED_REQ_ERR_UNKNOWN, body);
+        return false;
+    }
+    if (!request->Process(true, 0)) {
+        SetError(CRED_REQ_ERR_UNKNOWN, static_cast<int>(request->GetError()));
+        return false;
+    }
+    std::string text = request->GetResponse();
+    if (!kova::JsonFromString(text, answer)) {
+        SetError(CRED_REQ_ERR_SERVER_ERRNO, text);
+        return false;
+    }
+    return true;
+}
+
+// ---- CredRequestFarlink: the public object owns one implementation object.
+
+CredRequestFarlink::CredRequestFarlink() : d(new CredRequestFarlinkPrivate(this)) {}
+
+CredRequestFarlink::~CredRequestFarlink() {
+    delete d;
+}
+
+void CredRequestFarlink::SetHTTPS(bool https, bool verify) {
+    d->SetHTTPS(https, verify);
+}
+
+void CredRequestFarlink::SetServerName(const std::string &name) {
+    FarlinkGuarded([&] { d->SetServerName(name); });
+}
+
+void CredRequestFarlink::SetTimeout(long seconds) {
+    d->SetTimeout(seconds);
+}
+
+void CredRequestFarlink::SetServerId(const std::string &serverId) {
+    FarlinkGuarded([&] { d->SetServerId(serverId); });
+}
+
+void CredRequestFarlink::SetServiceId(const std::string &serviceId) {
+    FarlinkGuarded([&] { d->SetServiceId(serviceId); });
+}
+
+KOVA::_tag_CRED_REQ_ERR CredRequestFarlink::GetError() {
+    return d->GetError();
+}
+
+Json::Value CredRequestFarlink::GetErrors() {
+    return FarlinkGuarded([&] { return d->GetErrors(); }, Json::Value());
+}
+
+void CredRequestFarlink::SetError(KOVA::_tag_CRED_REQ_ERR error, const Json::Value &detail) {
+    FarlinkGuarded([&] { d->SetError(error, detail); });
+}
+
+}  // namespace KOVA

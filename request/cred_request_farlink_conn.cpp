@@ -1,0 +1,205 @@
+// Connection candidates: the direct addresses (LAN interfaces, external address, DDNS name)
+// and the relay endpoints of a server, probed in order until one proves to be the server.
+#include <memory>
+#include <new>
+
+#include "platform/json_text.h"
+#include "request/cred_request_farlink_p.h"
+
+namespace KOVA {
+
+namespace {
+
+const char kProbePath[] = "/webman/pingpong.cgi";
+// Direct addresses are often dead (another LAN, a stale DDNS record); short time-outs pass
+// over them quickly. Relay probes keep the request defaults.
+const long kDirectResponseTimeout = 5;
+const long kDirectDefaultTimeout = 10;
+
+bool Has(const Json::Value &object, const char *name) {
+    return object.isObject() && object.isMember(name);
+}
+
+// The integer member `name` of an object, 0 when missing or not a number.
+int IntMember(const Json::Value &object, const char *name) {
+    if (!Has(object, name)) {
+        return 0;
+    }
+    const Json::Value &value = object[name];
+    return value.isConvertibleTo(Json::intValue) ? value.asInt() : 0;
+}
+
+std::string StringMember(const Json::Value &object, const char *name) {
+    if (!Has(object, name)) {
+        return "";
+    }
+    const Json::Value &value = object[name];
+    return value.isString() ? value.asString() : std::string();
+}
+
+Json::Value Candidate(const std::string &protocol, const Json::Value &host, int port) {
+    Json::Value candidate(Json::objectValue);
+    candidate["protocol"] = protocol;
+    candidate["host"] = host;
+    candidate["port"] = port;
+    return candidate;
+}
+
+}  // namespace
+
+bool CredRequestFarlinkPrivate::ProbeCandidates(const Json::Value &list, bool direct,
+                                                Json::Value &candidate) {
+    candidate = Json::Value();
+    const Json::Value expected(serverIdMd5);
+    for (const Json::Value &element : list) {
+        std::unique_ptr<CredRequest> probe(new (std::nothrow) CredRequest());
+        if (!probe) {
+            continue;
+        }
+        probe->SetURL(StringMember(element, "protocol"), StringMember(element, "host"),
+                      IntMember(element, "port"), kProbePath);
+        if (direct) {
+            probe->SetResponseTimeout(kDirectResponseTimeout);
+            probe->SetDefaultTimeout(kDirectDefaultTimeout);
+        }
+        if (!probe->Process(true, 0)) {
+            continue;
+        }
+        Json::Value answer;
+        if (kova::JsonFromString(probe->GetResponse(), answer) && answer.isObject() &&
+            answer.isMember("ezid") && answer["ezid"] == expected) {
+            candidate = element;
+            break;
+        }
+    }
+    return !candidate.empty();
+}
+
+bool CredRequestFarlinkPrivate::GetAvailableDirectConnInfo(const Json::Value &serverInfo,
+                                                           Json::Value &candidate) {
+    if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
+        return false;
+    }
+    const Json::Value &server = serverInfo["server"];
+    const Json::Value &service = serverInfo["service"];
+    SetServerId(StringMember(server, "serverID"));
+    const int port = IntMember(service, "port");
+    const int extPort = IntMember(service, "ext_port");
+    if (port <= 0 && extPort <= 0) {
+        SetError(CRED_REQ_ERR_NO_PORT, Json::Value());
+        return false;
+    }
+
+    // LAN interfaces in the directory's order, then the external address, then DDNS.
+    Json::Value list(Json::arrayValue);
+    if (Has(server, "interface") && port > 0 && server["interface"].isArray()) {
+        for (const Json::Value &nic : server["interface"]) {
+            list.append(
+                Candidate(serviceProtocol, Has(nic, "ip") ? nic["ip"] : Json::Value(), port));
+        }
+    }
+    if (Has(server, "external") && extPort > 0) {
+        const Json::Value &external = server["external"];
+        list.append(Candidate(serviceProtocol, Has(external, "ip") ? external["ip"] : Json::Value(),
+                              extPort));
+    }
+    if (Has(server, "ddns") && extPort > 0) {
+        list.append(Candidate(serviceProtocol, server["ddns"], extPort));
+    }
+    if (list.empty()) {
+        return false;
+    }
+    return ProbeCandidates(list, true, candidate);
+}
+
+bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tunnelAnswer,
+                                                          Json::Value &candidate) {
+    if (!Has(tunnelAnswer, "service") || !Has(tunnelAnswer, "server")) {
+        return false;
+    }
+    const Json::Value &server = tunnelAnswer["server"];
+    const Json::Value &service = tunnelAnswer["service"];
+    SetServerId(StringMember(server, "serverID"));
+
+    // Relay address, relay host name on the same port, then the relay's HTTPS endpoint, which
+    // is always "https" whatever the service protocol.
+    Json::Value list(Json::arrayValue);
+    if (Has(service, "relay_ip") && Has(service, "relay_port")) {
+        const int relayPort = IntMember(service, "relay_port");
+        list.append(Candidate(serviceProtocol, service["relay_ip"], relayPort));
+        if (Has(service, "relay_dn")) {
+            list.append(Candidate(serviceProtocol, service["relay_dn"], relayPort));
+        }
+    }
+    if (Has(service, "https_ip") && Has(service, "https_port")) {
+        list.append(Candidate("https", service["https_ip"], IntMember(service, "https_port")));
+    }
+    if (list.empty()) {
+        return false;
+    }
+    return ProbeCandidates(list, false, candidate);
+}
+
+bool CredRequestFarlink::GetAvailableConnInfo(const Json::Value &serverInfo,
+                                              Json::Value &candidate) {
+    return FarlinkGuarded(
+        [&]() -> bool {
+            if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
+                d->SetError(CRED_REQ_ERR_NO_CONN_INFO, serverInfo);
+                return false;
+            }
+            if (d->GetAvailableDirectConnInfo(serverInfo, candidate)) {
+                return true;
+            }
+            // The tunnel is asked of the site that gave the server information.
+            Json::Value tunnelAnswer;
+            if (!RequestTunnel(tunnelAnswer)) {
+                return false;
+            }
+            return d->GetAvailableRelayConnInfo(tunnelAnswer, candidate);
+        },
+        false);
+}
+
+namespace {
+
+// One whole look-up with a client of its own: the HTTPS service first, then the plain one.
+bool ResolveServer(const std::string &serverId, const char *httpsService, const char *plainService,
+                   Json::Value &candidate, Json::Value *errors) {
+    return FarlinkGuarded(
+        [&]() -> bool {
+            CredRequestFarlink client;
+            if (serverId.empty()) {
+                client.SetError(CRED_REQ_ERR_NO_SERVER_ID);
+            } else {
+                client.SetServerId(serverId);
+                for (const char *service : {httpsService, plainService}) {
+                    client.SetServiceId(service);
+                    Json::Value info;
+                    if (client.GetAvailableServerInfo(info) &&
+                        client.GetAvailableConnInfo(info, candidate)) {
+                        return true;
+                    }
+                }
+            }
+            if (errors != nullptr) {
+                *errors = client.GetErrors();
+            }
+            return false;
+        },
+        false);
+}
+
+}  // namespace
+
+bool CredRequestFarlink::GetConnInfo(const std::string &serverId, Json::Value &candidate,
+                                     Json::Value *errors) {
+    return ResolveServer(serverId, "zon_https", "zon", candidate, errors);
+}
+
+bool CredRequestFarlink::GetConnInfoPortal(const std::string &serverId, Json::Value &candidate,
+                                           Json::Value *errors) {
+    return ResolveServer(serverId, "zon_portal_https", "zon_portal", candidate, errors);
+}
+
+}  // namespace KOVA

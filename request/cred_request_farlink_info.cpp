@@ -1,0 +1,153 @@
+// The directory commands of KOVA::CredRequestFarlink: server information, site list (from the
+// global directory host), the first site that knows the server, and the relay tunnel.
+#include <memory>
+
+#include "request/cred_request_farlink_p.h"
+
+namespace KOVA {
+
+namespace {
+
+const int kProtocolVersion = 1;
+
+// {"version": 1, "command": command} plus "serverID" and "id" when a server is named.
+Json::Value Command(const char *command) {
+    Json::Value document(Json::objectValue);
+    document["version"] = kProtocolVersion;
+    document["command"] = command;
+    return document;
+}
+
+Json::Value ServerCommand(const char *command, const std::string &serverId,
+                          const std::string &serviceId) {
+    Json::Value document = Command(command);
+    document["serverID"] = serverId;
+    document["id"] = serviceId;
+    return document;
+}
+
+// Sends one command and accepts only an object answer with "errno" 0: 22 with the document
+// when it cannot be sent or its answer is not JSON, 23 with the answer otherwise.
+bool SendCommand(CredRequestFarlinkPrivate &client, const Json::Value &document,
+                 Json::Value &answer) {
+    if (!client.SendFarlinkRequest(document, answer)) {
+        client.SetError(CRED_REQ_ERR_UNKNOWN, document);
+        return false;
+    }
+    if (!CredRequestFarlinkPrivate::IsSuccessAnswer(answer)) {
+        client.SetError(CRED_REQ_ERR_SERVER_ERRNO, answer);
+        return false;
+    }
+    return true;
+}
+
+// Points the client at another directory host for the object's lifetime.
+class ServerNameScope {
+  public:
+    ServerNameScope(CredRequestFarlinkPrivate &client, const std::string &name)
+        : client_(client), kept_(client.GetServerName()) {
+        client_.SetServerName(name);
+    }
+    ~ServerNameScope() { client_.serverName.swap(kept_); }
+    ServerNameScope(const ServerNameScope &) = delete;
+    ServerNameScope &operator=(const ServerNameScope &) = delete;
+
+  private:
+    CredRequestFarlinkPrivate &client_;
+    std::string kept_;
+};
+
+}  // namespace
+
+CredRequest *CredRequestFarlink::GetServerInfo() {
+    return FarlinkGuarded(
+        [&]() -> CredRequest * {
+            if (d->GetServerId().empty()) {
+                d->SetError(CRED_REQ_ERR_NO_SERVER_ID, Json::Value());
+                return nullptr;
+            }
+            Json::Value document =
+                ServerCommand("get_server_info", d->GetServerId(), d->GetServiceId());
+            CredRequest *request = d->CreateFarlinkRequest(document);
+            if (request == nullptr) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, document);
+            }
+            return request;
+        },
+        static_cast<CredRequest *>(nullptr));
+}
+
+bool CredRequestFarlink::GetServerInfo(Json::Value &info) {
+    return FarlinkGuarded(
+        [&]() -> bool {
+            std::unique_ptr<CredRequest> request(GetServerInfo());
+            if (!request) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, Json::Value());
+                return false;
+            }
+            if (!request->Process(true, 0)) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, static_cast<int>(request->GetError()));
+                return false;
+            }
+            std::string text = request->GetResponse();
+            if (!d->CheckResponse(text, &info)) {
+                d->SetError(CRED_REQ_ERR_SERVER_ERRNO, text);
+                return false;
+            }
+            return true;
+        },
+        false);
+}
+
+bool CredRequestFarlink::GetSiteList(Json::Value &answer) {
+    return FarlinkGuarded(
+        [&]() -> bool {
+            // The site list always comes from the global directory host; the configured
+            // server name is put back on every path.
+            ServerNameScope global(*d, CredRequestFarlinkPrivate::GlobalServerName());
+            return SendCommand(*d, Command("get_site_list"), answer);
+        },
+        false);
+}
+
+bool CredRequestFarlink::GetAvailableServerInfo(Json::Value &info) {
+    return FarlinkGuarded(
+        [&]() -> bool {
+            Json::Value list;
+            if (!GetSiteList(list)) {
+                return false;
+            }
+            const Json::Value *sites = list.find("sites", "sites" + 5);
+            if (sites == nullptr || !sites->isArray()) {
+                return false;
+            }
+            info = Json::Value();
+            for (const Json::Value &site : *sites) {
+                // A failing site leaves its error recorded until a later one overwrites it; the
+                // server name stays at the site that answered so that a tunnel goes there too.
+                d->SetServerName(site.isString() ? site.asString() : std::string());
+                Json::Value candidate;
+                if (GetServerInfo(candidate)) {
+                    info.swap(candidate);
+                    break;
+                }
+            }
+            return !info.empty();
+        },
+        false);
+}
+
+bool CredRequestFarlink::RequestTunnel(Json::Value &answer) {
+    return FarlinkGuarded(
+        [&]() -> bool {
+            if (d->GetServerId().empty()) {
+                d->SetError(CRED_REQ_ERR_BAD_PARAM, Json::Value());
+                return false;
+            }
+            return SendCommand(
+                *d, ServerCommand("request_tunnel", d->GetServerId(), d->GetServiceId()), answer);
+        },
+        false);
+}
+
+}  // namespace KOVA

@@ -1,0 +1,111 @@
+// Implementation object of KOVA::CredRequestFarlink: the client's directory settings, the
+// server and service it looks for, its error state, and the directory protocol core (making,
+// sending and checking one "/Serv.php" request) and candidate probing.
+#ifndef KOVA_REQUEST_CRED_REQUEST_FARLINK_P_H
+#define KOVA_REQUEST_CRED_REQUEST_FARLINK_P_H
+
+#include <string>
+
+#include <json/value.h>
+
+#include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_farlink.h"
+
+namespace KOVA {
+
+// Runs `fn` and turns any exception (out of memory in string or JSON handling, a JSON value of
+// an unexpected type) into `onError`, so that none leaves the library.
+template <typename Fn, typename R>
+R FarlinkGuarded(Fn &&fn, R onError) {
+    try {
+        return fn();
+    } catch (...) {
+        return onError;
+    }
+}
+
+template <typename Fn>
+void FarlinkGuarded(Fn &&fn) {
+    try {
+        fn();
+    } catch (...) {
+    }
+}
+
+class CredRequestFarlinkPrivate {
+  public:
+    explicit CredRequestFarlinkPrivate(CredRequestFarlink *owner);
+    ~CredRequestFarlinkPrivate();
+    CredRequestFarlinkPrivate(const CredRequestFarlinkPrivate &) = delete;
+    CredRequestFarlinkPrivate &operator=(const CredRequestFarlinkPrivate &) = delete;
+
+    // The directory host used after construction and Clear: kovacredential_farlink_server
+    // when set (and not empty), else the build's default.
+    static std::string DefaultServerName();
+    // The host asked for the site list: kovacredential_farlink_global when set (and not
+    // empty), else the build's default.
+    static std::string GlobalServerName();
+
+    // ---- Settings.
+    // Stores `id` whatever it is; "zon"/"zon_portal" select "http", "zon_https"/
+    // "zon_portal_https" select "https"; any other id is logged and keeps the old protocol.
+    void SetServiceId(const std::string &id);
+    const std::string &GetServiceId() const { return serviceId; }
+    const std::string &GetServiceProtocol() const { return serviceProtocol; }
+    void SetHTTPS(bool https, bool verify);
+    void SetServerName(const std::string &name);
+    const std::string &GetServerName() const { return serverName; }
+    void SetTimeout(long seconds);
+    // Stores the id and its MD5; the same id again changes nothing (no new digest).
+    void SetServerId(const std::string &id);
+    // Stores the lower-case hexadecimal MD5 of `id`; an empty id sets 401 and an empty MD5.
+    void SetServerIdMd5(const std::string &id);
+    const std::string &GetServerId() const { return serverId; }
+    const std::string &GetServerIdMd5() const { return serverIdMd5; }
+    // Server name, both HTTPS flags and the time-out back to their defaults.
+    void Clear();
+
+    // ---- Errors.
+    KOVA::_tag_CRED_REQ_ERR GetError() const { return error; }
+    void SetError(KOVA::_tag_CRED_REQ_ERR code, const Json::Value &detail);
+    // {"code": error, "error": detail}; "error" only when the detail is not empty.
+    Json::Value GetErrors() const;
+
+    // ---- Directory protocol.
+    // Whether a directory answer is an object whose "errno" is 0 (a missing one counts as 0).
+    static bool IsSuccessAnswer(const Json::Value &answer);
+    // True when `text` is a JSON object whose "errno" is 0 (or missing); copies it to `out`
+    // when given. Sets no error.
+    bool CheckResponse(const std::string &text, Json::Value *out);
+    // The prepared, unsent request carrying `body` to "/Serv.php" of the server name; the
+    // caller owns it. Null with 403, 404 or 22 set.
+    KOVA::CredRequest *CreateFarlinkRequest(const Json::Value &body);
+    // Makes, runs and parses one request. False with 22 (not made or not completed) or 23
+    // (answer not JSON). Whether the answer's "errno" is 0 is left to the caller.
+    bool SendFarlinkRequest(const Json::Value &body, Json::Value &answer);
+
+    // ---- Connection candidates.
+    bool GetAvailableDirectConnInfo(const Json::Value &serverInfo, Json::Value &candidate);
+    bool GetAvailableRelayConnInfo(const Json::Value &tunnelAnswer, Json::Value &candidate);
+    // Probes each {"protocol", "host", "port"} of `list` in order with "/webman/pingpong.cgi"
+    // and copies the first whose "ezid" is the server id MD5 into `candidate`. Direct probes
+    // run with short time-outs; relay probes with the request defaults. Sets no error.
+    bool ProbeCandidates(const Json::Value &list, bool direct, Json::Value &candidate);
+
+    // Fields, in this order.
+    CredRequestFarlink *owner;
+    std::string serverId;
+    std::string serverIdMd5;
+    std::string serverName;
+    bool useHTTPS = false;
+    bool verifyHTTPS = false;
+    long timeout = 5;
+    KOVA::_tag_CRED_REQ_ERR error = CRED_REQ_ERR_NONE;
+    Json::Value errorDetail;
+    std::string serviceId = "zon";
+    std::string serviceProtocol = "http";
+};
+
+}  // namespace KOVA
+
+#endif  // KOVA_REQUEST_CRED_REQUEST_FARLINK_P_H

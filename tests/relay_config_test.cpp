@@ -1,0 +1,259 @@
+// Relay client configuration: service ids, the server id and its MD5, defaults and Clear,
+// error documents, answer checks, and how one directory request is prepared.
+#include <stdlib.h>
+
+#include <memory>
+#include <string>
+
+#include <gtest/gtest.h>
+
+#include "kovacredential/cred_request_farlink.h"
+#include "relay_fixture.h"
+#include "request/cred_request_farlink_p.h"
+#include "simlib/relay_sim.h"
+#include "support/interpose.h"
+
+namespace {
+
+using KOVA::CredRequest;
+using KOVA::CredRequestFarlink;
+using KOVA::CredRequestFarlinkPrivate;
+
+// Sets (or, with nullptr, unsets) an environment variable for the object's lifetime.
+class ScopedEnv {
+  public:
+    ScopedEnv(const char *name, const char *value) : name_(name) {
+        const char *old = getenv(name);
+        hadOld_ = old != nullptr;
+        old_ = old != nullptr ? old : "";
+        value != nullptr ? setenv(name, value, 1) : unsetenv(name);
+    }
+    ~ScopedEnv() { hadOld_ ? setenv(name_.c_str(), old_.c_str(), 1) : unsetenv(name_.c_str()); }
+
+  private:
+    std::string name_;
+    bool hadOld_;
+    std::string old_;
+};
+
+using kova_test::ParseJson;
+
+TEST(RelayConfig, ServiceIdsSelectTheirProtocol) {
+    CredRequestFarlinkPrivate client(nullptr);
+    EXPECT_EQ(client.GetServiceId(), "zon");
+    EXPECT_EQ(client.GetServiceProtocol(), "http");
+    const std::pair<const char *, const char *> table[] = {{"zon_https", "https"},
+                                                           {"zon", "http"},
+                                                           {"zon_portal_https", "https"},
+                                                           {"zon_portal", "http"}};
+    for (const auto &row : table) {
+        client.SetServiceId(row.first);
+        EXPECT_EQ(client.GetServiceId(), row.first);
+        EXPECT_EQ(client.GetServiceProtocol(), row.second) << row.first;
+    }
+    EXPECT_EQ(kova_test::LogCount("is not supported"), 0u);
+}
+
+TEST(RelayConfig, UnsupportedServiceIdIsKeptWithTheOldProtocolAndLogged) {
+    kova_test::ClearLog();
+    CredRequestFarlinkPrivate client(nullptr);
+    client.SetServiceId("zon_https");
+    client.SetServiceId("ftp");
+    EXPECT_EQ(client.GetServiceId(), "ftp");
+    EXPECT_EQ(client.GetServiceProtocol(), "https");
+    ASSERT_EQ(kova_test::LogCount("Service id[ftp] is not supported"), 1u) << kova_test::LogDump();
+    EXPECT_EQ(kova_test::LogRecords().back().rfind("cred_request_farlink_conn:", 0), 0u)
+        << kova_test::LogDump();
+    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
+}
+
+TEST(RelayConfig, ServerIdMd5IsLowerCaseHex) {
+    CredRequestFarlinkPrivate client(nullptr);
+    client.SetServerId("abc");
+    EXPECT_EQ(client.GetServerId(), "abc");
+    EXPECT_EQ(client.GetServerIdMd5(), "900150983cd24fb0d6963f7d28e17f72");
+    EXPECT_EQ(kovasim::Md5Hex("abc"), client.GetServerIdMd5());
+}
+
+TEST(RelayConfig, RepeatedServerIdKeepsItsDigestAndANewIdReplacesBoth) {
+    CredRequestFarlinkPrivate client(nullptr);
+    client.SetServerId("abc");
+    // Overwrite the digest behind the id's back: setting the same id again must not redo it.
+    client.SetServerIdMd5("something else");
+    const std::string planted = client.GetServerIdMd5();
+    ASSERT_NE(planted, "900150983cd24fb0d6963f7d28e17f72");
+    client.SetServerId("abc");
+    EXPECT_EQ(client.GetServerIdMd5(), planted);
+    client.SetServerId("abd");
+    EXPECT_EQ(client.GetServerId(), "abd");
+    EXPECT_EQ(client.GetServerIdMd5(), kovasim::Md5Hex("abd"));
+}
+
+TEST(RelayConfig, EmptyServerIdClearsTheDigestWith401) {
+    CredRequestFarlinkPrivate client(nullptr);
+    client.SetServerId("abc");
+    client.SetServerId("");
+    EXPECT_EQ(client.GetServerId(), "");
+    EXPECT_EQ(client.GetServerIdMd5(), "");
+    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_SERVER_ID);
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":401})"));
+}
+
+TEST(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuild) {
+    {
+        ScopedEnv unset("kovacredential_farlink_server", nullptr);
+        EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
+    }
+    {
+        ScopedEnv empty("kovacredential_farlink_server", "");
+        EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
+    }
+    ScopedEnv server("kovacredential_farlink_server", "dir.example");
+    ScopedEnv global("kovacredential_farlink_global", "global.example");
+    EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), "dir.example");
+    EXPECT_EQ(CredRequestFarlinkPrivate::GlobalServerName(), "global.example");
+}
+
+TEST(RelayConfig, ClearRestoresConnectionSettingsOnly) {
+    ScopedEnv server("kovacredential_farlink_server", "dir.example");
+    CredRequestFarlinkPrivate client(nullptr);
+    client.SetServerId("abc");
+    client.SetServiceId("zon_portal_https");
+    client.SetServerName("elsewhere.example");
+    client.SetHTTPS(true, true);
+    client.SetTimeout(30);
+    client.SetError(KOVA::CRED_REQ_ERR_SERVER_ERRNO, "kept");
+    client.Clear();
+    EXPECT_EQ(client.GetServerName(), "dir.example");
+    EXPECT_FALSE(client.useHTTPS);
+    EXPECT_FALSE(client.verifyHTTPS);
+    EXPECT_EQ(client.timeout, 5);
+    EXPECT_EQ(client.GetServerId(), "abc");
+    EXPECT_EQ(client.GetServiceId(), "zon_portal_https");
+    EXPECT_EQ(client.GetServiceProtocol(), "https");
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":"kept"})"));
+}
+
+TEST(RelayConfig, ErrorDocumentCarriesTheDetailOnlyWhenThereIsOne) {
+    CredRequestFarlink client;
+    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":0})"));
+    client.SetError(KOVA::CRED_REQ_ERR_NO_PORT);
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":405})"));
+    client.SetError(KOVA::CRED_REQ_ERR_UNKNOWN, 20);
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":22,"error":20})"));
+    client.SetError(KOVA::CRED_REQ_ERR_NO_CONN_INFO, Json::Value(Json::objectValue));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":402})"));
+}
+
+TEST(RelayConfig, CheckResponseAcceptsOnlyObjectsWithErrnoZero) {
+    CredRequestFarlinkPrivate client(nullptr);
+    Json::Value out = "untouched";
+    EXPECT_FALSE(client.CheckResponse("", &out));
+    EXPECT_FALSE(client.CheckResponse("{\"errno\":0", &out));
+    EXPECT_FALSE(client.CheckResponse("[0]", &out));
+    EXPECT_FALSE(client.CheckResponse("{\"errno\":1}", &out));
+    EXPECT_FALSE(client.CheckResponse("{\"errno\":\"x\"}", &out));
+    EXPECT_EQ(out, Json::Value("untouched"));
+    EXPECT_TRUE(client.CheckResponse("{\"a\":1}", nullptr));
+    EXPECT_TRUE(client.CheckResponse("{\"errno\":0,\"sites\":[\"s\"]}", &out));
+    EXPECT_EQ(out, ParseJson(R"({"errno":0,"sites":["s"]})"));
+    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
+}
+
+TEST(RelayConfig, MissingDirectoryHostIsReportedBeforeAnEmptyBody) {
+    CredRequestFarlinkPrivate client(nullptr);
+    client.SetServerName("");
+    EXPECT_EQ(client.CreateFarlinkRequest(Json::Value()), nullptr);
+    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_SERVICE_ID);
+    client.SetServerName("dir.example");
+    EXPECT_EQ(client.CreateFarlinkRequest(Json::Value(Json::objectValue)), nullptr);
+    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_EMPTY_REQUEST);
+    // Sending reports any failure to make the request as 22 with the document.
+    Json::Value answer;
+    client.SetServerName("");
+    Json::Value body(Json::objectValue);
+    body["version"] = 1;
+    EXPECT_FALSE(client.SendFarlinkRequest(body, answer));
+    EXPECT_EQ(client.GetErrors()["code"], 22);
+    EXPECT_EQ(client.GetErrors()["error"], body);
+}
+
+TEST(RelayConfig, ResponseTimeoutIsSetOnlyWhenPositive) {
+    Json::Value body(Json::objectValue);
+    body["version"] = 1;
+    CredRequestFarlinkPrivate client(nullptr);
+    client.SetServerName("dir.example");
+    std::unique_ptr<CredRequest> request(client.CreateFarlinkRequest(body));
+    ASSERT_TRUE(request);
+    EXPECT_EQ(request->GetResponseTimeout(), 5);
+    client.SetTimeout(0);
+    request.reset(client.CreateFarlinkRequest(body));
+    ASSERT_TRUE(request);
+    EXPECT_EQ(request->GetResponseTimeout(), 120);
+    client.SetTimeout(-3);
+    request.reset(client.CreateFarlinkRequest(body));
+    ASSERT_TRUE(request);
+    EXPECT_EQ(request->GetResponseTimeout(), 120);
+    client.SetTimeout(42);
+    request.reset(client.CreateFarlinkRequest(body));
+    ASSERT_TRUE(request);
+    EXPECT_EQ(request->GetResponseTimeout(), 42);
+}
+
+TEST(RelayConfig, PortAndSchemeFollowTheHttpsFlag) {
+    Json::Value body(Json::objectValue);
+    body["version"] = 1;
+    CredRequestFarlinkPrivate client(nullptr);
+    client.SetServerName("dir.example");
+    std::unique_ptr<CredRequest> request(client.CreateFarlinkRequest(body));
+    ASSERT_TRUE(request);
+    EXPECT_EQ(request->GetURL().rfind("http://dir.example:80/", 0), 0u) << request->GetURL();
+    client.SetHTTPS(true, false);
+    request.reset(client.CreateFarlinkRequest(body));
+    ASSERT_TRUE(request);
+    EXPECT_EQ(request->GetURL().rfind("https://dir.example:443/", 0), 0u) << request->GetURL();
+    EXPECT_NE(request->GetURL().find("Serv.php"), std::string::npos);
+}
+
+// The same on the wire: a directory host listening on both 80 and 443 sees plain HTTP on 80
+// and TLS on 443, with nothing on any other port.
+TEST(RelayConfig, DirectoryRequestsReachPort80OrTls443) {
+    kovasim::RelaySim sim;
+    kovasim::LoopbackServer::Options plainOptions;
+    plainOptions.host = kovasim::ProcessLoopbackAddress(0);
+    plainOptions.port = 80;
+    kovasim::LoopbackServer plain(plainOptions);
+    kovasim::LoopbackServer::Options tlsOptions = plainOptions;
+    tlsOptions.port = 443;
+    tlsOptions.https = true;
+    kovasim::LoopbackServer tls(tlsOptions);
+    sim.Install(plain);
+    sim.Install(tls);
+    for (kovasim::LoopbackServer *server : {&plain, &tls}) {
+        if (!server->Start()) {
+            if (kovasim::BindNotPermitted(*server)) {
+                GTEST_SKIP() << "binding a directory host on a privileged port is not "
+                                "permitted here: "
+                             << server->Error();
+            }
+            FAIL() << server->Error();
+        }
+    }
+    ScopedEnv global("kovacredential_farlink_global", plainOptions.host.c_str());
+    CredRequestFarlink client;
+    Json::Value answer;
+    ASSERT_TRUE(client.GetSiteList(answer)) << client.GetErrors().toStyledString();
+    EXPECT_EQ(plain.CountPath("//Serv.php") + plain.CountPath("/Serv.php"), 1u);
+    EXPECT_EQ(tls.RequestCount(), 0u);
+    client.SetHTTPS(true, false);
+    ASSERT_TRUE(client.GetSiteList(answer)) << client.GetErrors().toStyledString();
+    EXPECT_EQ(plain.RequestCount(), 1u);
+    EXPECT_EQ(tls.RequestCount(), 1u);
+    // A certificate check against the self-signed certificate fails the request.
+    client.SetHTTPS(true, true);
+    EXPECT_FALSE(client.GetSiteList(answer));
+    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_UNKNOWN);
+}
+
+}  // namespace
