@@ -3,7 +3,19 @@
 // "https 127.0.0.1:PORT") and runs until SIGINT or SIGTERM, or for --duration seconds.
 //
 // Roles are configured from a JSON file whose top-level members name them; "webapi"
-// configures the WebAPI role (tools/simlib/webapi_sim.h).
+// configures the WebAPI role (tools/simlib/webapi_sim.h) and "relay" the relay-directory role:
+//
+//   "relay": {
+//     "hosts": ["127.0.0.2", "127.0.0.3"],  // loopback addresses serving "/Serv.php"
+//     "port": 80,                           // directory port (clients use 80, or 443 for TLS)
+//     "serverId": "S1",                     // the WebAPI listeners answer the probe
+//                                           // "/webman/pingpong.cgi" as this server
+//     "directory": { ... }                  // the directory's contents (simlib/relay_sim.h)
+//   }
+//
+// In "directory", the texts "$http_port" and "$https_port" stand for the ports the WebAPI
+// listeners got, so a configuration can point the directory at them before they are known.
+// Each directory host prints "relay HOST:PORT".
 #include <signal.h>
 #include <stdio.h>
 #include <time.h>
@@ -13,12 +25,14 @@
 #include <memory>
 #include <sstream>
 #include <string>
+#include <vector>
 
 #include <CLI/CLI.hpp>
 #include <json/reader.h>
 #include <json/value.h>
 
 #include "simlib/loopback_server.h"
+#include "simlib/relay_sim.h"
 #include "simlib/webapi_sim.h"
 
 namespace {
@@ -78,10 +92,81 @@ void WaitForStop(const sigset_t &stopSignals, double duration) {
     sigtimedwait(&stopSignals, nullptr, &limit);
 }
 
+// Replaces the port placeholders in a directory configuration by the listeners' ports.
+Json::Value FillPorts(const Json::Value &value, int httpPort, int httpsPort) {
+    if (value.isString()) {
+        if (value.asString() == "$http_port") {
+            return Json::Value(httpPort);
+        }
+        if (value.asString() == "$https_port") {
+            return Json::Value(httpsPort);
+        }
+        return value;
+    }
+    Json::Value out = value;
+    if (value.isObject()) {
+        for (const auto &name : value.getMemberNames()) {
+            out[name] = FillPorts(value[name], httpPort, httpsPort);
+        }
+    } else if (value.isArray()) {
+        for (Json::ArrayIndex i = 0; i < value.size(); ++i) {
+            out[i] = FillPorts(value[i], httpPort, httpsPort);
+        }
+    }
+    return out;
+}
+
+// The relay-directory role: one RelaySim served on every configured host.
+struct RelayRole {
+    kovasim::RelaySim sim;
+    std::vector<std::unique_ptr<kovasim::LoopbackServer>> hosts;
+    std::string serverId;
+    int port = 80;
+
+    bool Configure(const Json::Value &config, std::string &error) {
+        if (config.isNull()) {
+            return true;
+        }
+        if (!config.isObject() || !config["hosts"].isArray() || config["hosts"].empty()) {
+            error = "\"relay\" needs a non-empty array \"hosts\"";
+            return false;
+        }
+        port = config.get("port", 80).asInt();
+        serverId = config.get("serverId", "").asString();
+        for (const auto &host : config["hosts"]) {
+            kovasim::LoopbackServer::Options options;
+            options.host = host.asString();
+            options.port = port;
+            options.threads = 8;
+            hosts.push_back(std::make_unique<kovasim::LoopbackServer>(options));
+            sim.Install(*hosts.back());
+        }
+        return sim.Configure(config.get("directory", Json::Value(Json::objectValue)), &error);
+    }
+
+    bool Start(const Json::Value &config, int httpPort, int httpsPort, std::string &error) {
+        if (hosts.empty()) {
+            return true;
+        }
+        if (!sim.Configure(FillPorts(config.get("directory", Json::Value(Json::objectValue)),
+                                     httpPort, httpsPort),
+                           &error)) {
+            return false;
+        }
+        for (auto &host : hosts) {
+            if (!host->Start()) {
+                error = host->Error();
+                return false;
+            }
+        }
+        return true;
+    }
+};
+
 }  // namespace
 
 int main(int argc, char **argv) {
-    CLI::App app{"kovasim: loopback WebAPI simulator"};
+    CLI::App app{"kovasim: loopback WebAPI and relay-directory simulator"};
     Settings settings;
     app.add_option("--config", settings.configPath, "JSON configuration file")
         ->check(CLI::ExistingFile);
@@ -111,6 +196,11 @@ int main(int argc, char **argv) {
         fprintf(stderr, "kovasim: webapi: %s\n", error.c_str());
         return 2;
     }
+    RelayRole relay;
+    if (!relay.Configure(config["relay"], error)) {
+        fprintf(stderr, "kovasim: relay: %s\n", error.c_str());
+        return 2;
+    }
 
     // Worker threads inherit this mask, so the stop signals reach only WaitForStop.
     sigset_t stopSignals;
@@ -125,6 +215,9 @@ int main(int argc, char **argv) {
     if (!settings.noHttps) {
         https = MakeServer(true, settings.httpsPort, settings.threads);
         webapi.Install(*https);
+        if (!relay.serverId.empty()) {
+            kovasim::InstallPingPong(*https, relay.serverId);
+        }
         if (!https->Start()) {
             fprintf(stderr, "kovasim: https: %s\n", https->Error().c_str());
             return 1;
@@ -136,17 +229,27 @@ int main(int argc, char **argv) {
             kovasim::WebApiSim::InstallRedirect(*http, https->Port());
         } else {
             webapi.Install(*http);
+            if (!relay.serverId.empty()) {
+                kovasim::InstallPingPong(*http, relay.serverId);
+            }
         }
         if (!http->Start()) {
             fprintf(stderr, "kovasim: http: %s\n", http->Error().c_str());
             return 1;
         }
     }
+    if (!relay.Start(config["relay"], http ? http->Port() : 0, https ? https->Port() : 0, error)) {
+        fprintf(stderr, "kovasim: relay: %s\n", error.c_str());
+        return 1;
+    }
     if (http) {
         printf("http %s:%d\n", http->Host().c_str(), http->Port());
     }
     if (https) {
         printf("https %s:%d\n", https->Host().c_str(), https->Port());
+    }
+    for (const auto &host : relay.hosts) {
+        printf("relay %s:%d\n", host->Host().c_str(), host->Port());
     }
     fflush(stdout);
 
