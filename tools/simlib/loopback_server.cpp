@@ -107,6 +107,8 @@ LoopbackServer::LoopbackServer(const Options &options) : options_(options) {
     }
     int threads = options_.threads > 0 ? options_.threads : 1;
     server_->new_task_queue = [threads] { return new httplib::ThreadPool(threads); };
+    // Without TCP_NODELAY a TLS response waits on delayed ACKs (about 40 ms per request).
+    server_->set_tcp_nodelay(true);
     server_->set_keep_alive_max_count(options_.keepAlive ? 1000 : 1);
     server_->set_payload_max_length(1ULL << 32);
     // The body is read after pre-routing, so requests are recorded by the route wrappers and,
