@@ -14,65 +14,11 @@
 
 #include <gtest/gtest.h>
 
+#include "support/sim_process.h"
 #include "support/temp_dir.h"
 
 namespace kova_test {
 namespace {
-
-// Starts kovasim with its ports written to a file; stops it with SIGTERM.
-class SimProcess {
-  public:
-    explicit SimProcess(const TempDir &dir, const std::string &args = "") {
-        portsFile_ = dir.File("ports");
-        pid_ = fork();
-        if (pid_ == 0) {
-            std::string command = std::string("exec ") + KOVASIM_BIN + " " + args + " > " +
-                                  portsFile_ + " 2>/dev/null";
-            execl("/bin/sh", "sh", "-c", command.c_str(), static_cast<char *>(nullptr));
-            _exit(127);
-        }
-        for (int i = 0; i < 300 && httpsPort_ == 0; ++i) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(50));
-            std::ifstream in(portsFile_);
-            std::string kind;
-            std::string address;
-            while (in >> kind >> address) {
-                int port = std::stoi(address.substr(address.rfind(':') + 1));
-                (kind == "http" ? httpPort_ : httpsPort_) = port;
-            }
-        }
-    }
-    ~SimProcess() { Stop(); }
-    // Exit status after SIGTERM; -1 when it had to be killed.
-    int Stop() {
-        if (pid_ <= 0) {
-            return status_;
-        }
-        kill(pid_, SIGTERM);
-        for (int i = 0; i < 100; ++i) {
-            int status = 0;
-            if (waitpid(pid_, &status, WNOHANG) == pid_) {
-                pid_ = 0;
-                status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-                return status_;
-            }
-            std::this_thread::sleep_for(std::chrono::milliseconds(50));
-        }
-        kill(pid_, SIGKILL);
-        waitpid(pid_, nullptr, 0);
-        pid_ = 0;
-        return status_;
-    }
-    int HttpPort() const { return httpPort_; }
-    int HttpsPort() const { return httpsPort_; }
-
-  private:
-    pid_t pid_ = 0;
-    int status_ = -1;
-    std::string portsFile_;
-    int httpPort_ = 0;
-    int httpsPort_ = 0;
-};
 
 class WebApiE2eTest : public ::testing::Test {
   protected:
