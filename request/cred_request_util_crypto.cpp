@@ -296,22 +296,21 @@ bool CredRequestUtil::GetEncryptAESString(const std::string &passphrase, const s
     }
     total += static_cast<size_t>(finalLength);
 
-    const size_t size = Base64BufferSize(total);
-    CBuffer<char> text(static_cast<char *>(calloc(size, 1)));
-    if (!text) {
+    // The Base64 text is written straight into its final string (a megabyte of cipher text is
+    // not copied again); the string's terminator slot takes the encoder's NUL.
+    const size_t length = (total + 2) / 3 * 4;
+    std::string text;
+    try {
+        text.resize(length);
+    } catch (...) {
         kova::Log("%s:%d calloc Base64 fail", kUnit, kLineAesEncB64CallocFail);
         return false;
     }
-    if (VLIBCBase64SzEncodeFull(out.get(), total, text.get(), size, 0) == 0) {
+    if (VLIBCBase64SzEncodeFull(out.get(), total, &text[0], length + 1, 0) == 0) {
         kova::Log("%s:%d Base64 Encode fail", kUnit, kLineAesEncB64Fail);
         return false;
     }
-    try {
-        // The encoded length is known, which spares a scan of a text that can be megabytes.
-        cipher.assign(text.get(), (total + 2) / 3 * 4);
-    } catch (...) {
-        return false;
-    }
+    cipher.swap(text);
     return true;
 }
 
