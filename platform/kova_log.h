@@ -2,6 +2,8 @@
 #ifndef KOVA_PLATFORM_KOVA_LOG_H
 #define KOVA_PLATFORM_KOVA_LOG_H
 
+#include <exception>
+
 namespace kova {
 
 // Writes one record to the system log at priority error (syslog LOG_ERR). Formats in the
@@ -17,6 +19,21 @@ int ArgInvalid(const char *file, int line, const char *check);
 // the last recorded error, for a failure whose cause an inner step already recorded.
 void LogInnerFailure(const char *file, int line, const char *fmt, ...)
     __attribute__((format(printf, 3, 4)));
+
+// Runs `body` and returns its result. An exception escaping it (std::bad_alloc from a string or
+// a JSON value) is logged as "<unit>:<line> Exception: <what>" and turns into `failure`, so
+// that none leaves the library through a public entry point.
+template <typename Result, typename Body>
+Result Guarded(const char *unit, int line, Result failure, Body &&body) {
+    try {
+        return body();
+    } catch (const std::exception &e) {
+        Log("%s:%d Exception: %s", unit, line, e.what());
+    } catch (...) {
+        Log("%s:%d Exception", unit, line);
+    }
+    return failure;
+}
 
 }  // namespace kova
 

@@ -21,18 +21,6 @@ namespace {
 
 const char kUnit[] = "cred_request";
 
-template <typename Result, typename Body>
-Result Guarded(int line, Result failure, Body body) {
-    try {
-        return body();
-    } catch (const std::exception &e) {
-        kova::Log("%s:%d Exception: %s", kUnit, line, e.what());
-    } catch (...) {
-        kova::Log("%s:%d Exception", kUnit, line);
-    }
-    return failure;
-}
-
 bool WebApiArgsValid(const std::string &api, int version, const std::string &method) {
     return !api.empty() && version > 0 && !method.empty();
 }
@@ -47,7 +35,7 @@ constexpr int kLineSetParams = 65;
 
 bool CredRequest::SetWebAPIRequest(const std::string &api, int version, const std::string &method,
                                    const Json::Value &params) {
-    return Guarded(kLineFactoryException, false, [&] {
+    return kova::Guarded(kUnit, kLineFactoryException, false, [&] {
         if (!WebApiArgsValid(api, version, method)) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineSetBadParam);
             return false;
@@ -82,7 +70,7 @@ bool CredRequest::CreateWebAPIRequest(KOVA::CredRequest *request, const KOVA_CRE
                                       const KOVA_CRED_SESS *sess, const std::string &api,
                                       int version, const std::string &method,
                                       const Json::Value &params) {
-    return Guarded(kLineFactoryException, false, [&] {
+    return kova::Guarded(kUnit, kLineFactoryException, false, [&] {
         if (request == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineFillNoRequest);
             return false;
@@ -133,8 +121,8 @@ KOVA::CredRequest *CredRequest::CreateWebAPIRequest(const KOVA_CRED *cred,
                                                     const std::string &api, int version,
                                                     const std::string &method,
                                                     const Json::Value &params) {
-    return Guarded(
-        kLineFactoryException, static_cast<CredRequest *>(nullptr), [&]() -> CredRequest * {
+    return kova::Guarded(
+        kUnit, kLineFactoryException, static_cast<CredRequest *>(nullptr), [&]() -> CredRequest * {
             std::unique_ptr<CredRequest> request(new (std::nothrow) CredRequest());
             if (!request) {
                 kova::Log("%s:%d New CredRequest fail", kUnit, kLineNewFail);
@@ -156,8 +144,8 @@ constexpr int kLineIdCreate = 170;
 KOVA::CredRequest *CredRequest::CreateWebAPIRequest(long credId, const std::string &api,
                                                     int version, const std::string &method,
                                                     const Json::Value &params) {
-    return Guarded(
-        kLineFactoryException, static_cast<CredRequest *>(nullptr), [&]() -> CredRequest * {
+    return kova::Guarded(
+        kUnit, kLineFactoryException, static_cast<CredRequest *>(nullptr), [&]() -> CredRequest * {
             KOVA_CRED cred;
             KOVA_CRED_SESS sess;
             if (!WebApiArgsValid(api, version, method)) {
@@ -188,44 +176,44 @@ KOVA::CredRequest *CredRequest::CreateRelayRequest(long credId, const std::strin
                                                    const std::string &method,
                                                    const Json::Value &headers, FILE *in,
                                                    FILE *out) {
-    return Guarded(kLineFactoryException, static_cast<CredRequest *>(nullptr),
-                   [&]() -> CredRequest * {
-                       KOVA_CRED cred;
-                       if (!WebApiArgsValid(api, version, method)) {
-                           kova::Log("%s:%d Bad parameters", kUnit, kLineRelayBadParam);
-                           return nullptr;
-                       }
-                       // Lenient by design: only a load that reports nothing and leaves id 0
-                       // counts as invalid; the credential-id factory below loads it again.
-                       const int loaded = KOVACredGetByID(credId, &cred);
-                       if (loaded <= 0 && cred.id == 0) {
-                           kova::Log("%s:%d CredId is invalid", kUnit, kLineRelayInvalid);
-                           return nullptr;
-                       }
-                       std::unique_ptr<CredRequest> request(
-                           CreateWebAPIRequest(credId, api, version, method, Json::Value()));
-                       if (!request) {
-                           return nullptr;
-                       }
-                       if (!headers.empty() && !request->AddHeader(headers)) {
-                           kova::Log("%s:%d Bad parameters", kUnit, kLineRelayHeaders);
-                           return nullptr;
-                       }
-                       // Both streams feed the request body; given both, `out` wins.
-                       if (in != nullptr) {
-                           request->SetReqStream(in);
-                       }
-                       if (out != nullptr) {
-                           request->SetReqStream(out);
-                       }
-                       return request.release();
-                   });
+    return kova::Guarded(kUnit, kLineFactoryException, static_cast<CredRequest *>(nullptr),
+                         [&]() -> CredRequest * {
+                             KOVA_CRED cred;
+                             if (!WebApiArgsValid(api, version, method)) {
+                                 kova::Log("%s:%d Bad parameters", kUnit, kLineRelayBadParam);
+                                 return nullptr;
+                             }
+                             // Lenient by design: only a load that reports nothing and leaves id 0
+                             // counts as invalid; the credential-id factory below loads it again.
+                             const int loaded = KOVACredGetByID(credId, &cred);
+                             if (loaded <= 0 && cred.id == 0) {
+                                 kova::Log("%s:%d CredId is invalid", kUnit, kLineRelayInvalid);
+                                 return nullptr;
+                             }
+                             std::unique_ptr<CredRequest> request(
+                                 CreateWebAPIRequest(credId, api, version, method, Json::Value()));
+                             if (!request) {
+                                 return nullptr;
+                             }
+                             if (!headers.empty() && !request->AddHeader(headers)) {
+                                 kova::Log("%s:%d Bad parameters", kUnit, kLineRelayHeaders);
+                                 return nullptr;
+                             }
+                             // Both streams feed the request body; given both, `out` wins.
+                             if (in != nullptr) {
+                                 request->SetReqStream(in);
+                             }
+                             if (out != nullptr) {
+                                 request->SetReqStream(out);
+                             }
+                             return request.release();
+                         });
 }
 
 constexpr int kLineBuildParse = 235;
 
 bool CredRequestPrivate::buildCredByURL(const std::string &url) {
-    return Guarded(kLineFactoryException, false, [&] {
+    return kova::Guarded(kUnit, kLineFactoryException, false, [&] {
         if (url.empty()) {
             error = CRED_REQ_ERR_LOGIN_PARAM;
             return false;

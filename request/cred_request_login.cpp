@@ -17,24 +17,12 @@ namespace {
 
 const char kUnit[] = "cred_request";
 
-template <typename Result, typename Body>
-Result Guarded(int line, Result failure, Body body) {
-    try {
-        return body();
-    } catch (const std::exception &e) {
-        kova::Log("%s:%d Exception: %s", kUnit, line, e.what());
-    } catch (...) {
-        kova::Log("%s:%d Exception", kUnit, line);
-    }
-    return failure;
-}
-
 }  // namespace
 
 constexpr int kLineLoginException = 35;
 
 bool CredRequest::ProcessWithLogin(long credId, bool perform, int retries) {
-    return Guarded(kLineLoginException, false, [&] {
+    return kova::Guarded(kUnit, kLineLoginException, false, [&] {
         KOVA_CRED_SESS session;
         if (!CredRequestUtil::Login(credId, &session)) {
             SetError(CRED_REQ_ERR_LOGIN_FAIL);
@@ -54,7 +42,7 @@ constexpr int kLineLoginToken = 82;
 
 bool CredRequest::Login(const std::string &account, const std::string &password,
                         const std::string &url) {
-    return Guarded(kLineLoginException, false, [&] {
+    return kova::Guarded(kUnit, kLineLoginException, false, [&] {
         const std::string target = url.empty() ? GetURL() : url;
         if (!d->buildCredByURL(target)) {
             SetError(CRED_REQ_ERR_LOGIN_PARAM);
@@ -86,7 +74,7 @@ bool CredRequest::Login(const std::string &account, const std::string &password,
 }
 
 bool CredRequest::Logout() {
-    return Guarded(kLineLoginException, false, [&] {
+    return kova::Guarded(kUnit, kLineLoginException, false, [&] {
         if (d->cred == nullptr || d->sess == nullptr || d->cred->host.empty() ||
             d->cred->protocol.empty() || d->sess->access_token.empty()) {
             return false;
@@ -96,7 +84,7 @@ bool CredRequest::Logout() {
 }
 
 bool CredRequest::isAPIValid(const std::string &api) {
-    return Guarded(kLineLoginException, false, [&] {
+    return kova::Guarded(kUnit, kLineLoginException, false, [&] {
         if (!d->buildCredByURL(GetURL())) {
             return false;
         }

@@ -72,20 +72,28 @@ int CredRequestMgr::AddCredRequest(KOVA::CredRequest *request) {
 
 namespace {
 constexpr int kLineCreateWebAPIFail = 39;
-}  // namespace
 
-int CredRequestMgr::AddWebAPIRequest(long credId, const std::string &api, int version,
-                                     const std::string &method, const Json::Value &params) {
-    RequestPtr request(CredRequest::CreateWebAPIRequest(credId, api, version, method, params));
+// Adds a request a factory built, destroying it when the manager cannot take it. A null request
+// (the factory failed) is logged as "<factory> fail" with `line`.
+int Adopt(CredRequestMgr &mgr, CredRequest *built, const char *factory, int line) {
+    RequestPtr request(built);
     if (!request) {
-        kova::Log("%s:%d CreateWebAPIRequest fail", kUnit, kLineCreateWebAPIFail);
+        kova::Log("%s:%d %s fail", kUnit, line, factory);
         return -1;
     }
-    int index = AddCredRequest(request.get());
+    int index = mgr.AddCredRequest(request.get());
     if (index >= 0) {
         request.release();
     }
     return index;
+}
+
+}  // namespace
+
+int CredRequestMgr::AddWebAPIRequest(long credId, const std::string &api, int version,
+                                     const std::string &method, const Json::Value &params) {
+    return Adopt(*this, CredRequest::CreateWebAPIRequest(credId, api, version, method, params),
+                 "CreateWebAPIRequest", kLineCreateWebAPIFail);
 }
 
 namespace {
@@ -95,16 +103,8 @@ constexpr int kLineCreateWebAPIRecordsFail = 58;
 int CredRequestMgr::AddWebAPIRequest(const KOVA_CRED *cred, const KOVA_CRED_SESS *sess,
                                      const std::string &api, int version, const std::string &method,
                                      const Json::Value &params) {
-    RequestPtr request(CredRequest::CreateWebAPIRequest(cred, sess, api, version, method, params));
-    if (!request) {
-        kova::Log("%s:%d CreateWebAPIRequest fail", kUnit, kLineCreateWebAPIRecordsFail);
-        return -1;
-    }
-    int index = AddCredRequest(request.get());
-    if (index >= 0) {
-        request.release();
-    }
-    return index;
+    return Adopt(*this, CredRequest::CreateWebAPIRequest(cred, sess, api, version, method, params),
+                 "CreateWebAPIRequest", kLineCreateWebAPIRecordsFail);
 }
 
 namespace {
@@ -114,17 +114,9 @@ constexpr int kLineCreateRelayFail = 77;
 int CredRequestMgr::AddRelayRequest(long credId, const std::string &api, int version,
                                     const std::string &method, const Json::Value &headers, FILE *in,
                                     FILE *out) {
-    RequestPtr request(
-        CredRequest::CreateRelayRequest(credId, api, version, method, headers, in, out));
-    if (!request) {
-        kova::Log("%s:%d CreateRelayRequest fail", kUnit, kLineCreateRelayFail);
-        return -1;
-    }
-    int index = AddCredRequest(request.get());
-    if (index >= 0) {
-        request.release();
-    }
-    return index;
+    return Adopt(*this,
+                 CredRequest::CreateRelayRequest(credId, api, version, method, headers, in, out),
+                 "CreateRelayRequest", kLineCreateRelayFail);
 }
 
 int CredRequestMgr::AddCredRequest(const std::string &protocol, const std::string &host, int port,

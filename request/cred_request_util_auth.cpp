@@ -20,18 +20,6 @@ namespace {
 const char kUnit[] = "cred_request_util";
 const char kAuthApi[] = "KOVA.API.Auth";
 
-template <typename Result, typename Body>
-Result Guarded(int line, Result failure, Body body) {
-    try {
-        return body();
-    } catch (const std::exception &e) {
-        kova::Log("%s:%d Exception: %s", kUnit, line, e.what());
-    } catch (...) {
-        kova::Log("%s:%d Exception", kUnit, line);
-    }
-    return failure;
-}
-
 std::string Text(const Json::Value &v) {
     return v.isConvertibleTo(Json::stringValue) ? v.asString() : "";
 }
@@ -81,7 +69,7 @@ constexpr int kLineUrlFormat = 104;
 
 bool CredRequestUtil::SetWebAPIURL(const KOVA_CRED *cred, const std::string &api, int version,
                                    const std::string &method, KOVA::CredRequest *request) {
-    return Guarded(kLineAuthException, false, [&] {
+    return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         if (cred == nullptr || api.empty() || version <= 0 || method.empty() ||
             request == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineUrlBadParam);
@@ -127,7 +115,7 @@ constexpr int kLineRedirNoLocation = 166;
 constexpr int kLineRedirBadLocation = 172;
 
 bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
-    return Guarded(kLineAuthException, false, [&] {
+    return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         if (cred == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineRedirBadParam);
             return false;
@@ -190,7 +178,7 @@ constexpr int kLineLoginStore = 248;
 
 bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
                                    KOVA_CRED_SESS *sess, Json::Value *response) {
-    return Guarded(kLineAuthException, false, [&] {
+    return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         if (cred == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineLoginBadParam);
             return false;
@@ -259,7 +247,7 @@ bool CredRequestUtil::Login(KOVA_CRED *cred, KOVA_CRED_SESS *sess) {
 constexpr int kLineLoginIdMissing = 278;
 
 bool CredRequestUtil::Login(long id, KOVA_CRED_SESS *sess) {
-    return Guarded(kLineAuthException, false, [&] {
+    return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         KOVA_CRED cred;
         if (KOVACredGetByID(id, &cred) < 0 || cred.filled == 0) {
             kova::Log("%s:%d Cannot find id[%ld] in database", kUnit, kLineLoginIdMissing, id);
@@ -274,55 +262,49 @@ constexpr int kLineTokenNoSess = 297;
 constexpr int kLineTokenLogin = 305;
 constexpr int kLineTokenUnfilled = 312;
 
+namespace {
+
+// The stored session of credential `id` when there is one (trusted as it is: the server is not
+// asked whether it still lives), else a fresh login through `login`.
+template <typename LoginFn>
+bool StoredSessionOrLogin(long id, KOVA_CRED_SESS *sess, LoginFn login) {
+    if (KOVACredSessGetByID(id, sess) < 0) {
+        kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenNoSess, id);
+        return false;
+    }
+    if (sess->filled) {
+        return true;
+    }
+    if (!login()) {
+        kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenLogin, id);
+        return false;
+    }
+    if (sess->filled) {
+        return true;
+    }
+    kova::Log("%s:%d Cannot get access token from database", kUnit, kLineTokenUnfilled);
+    return false;
+}
+
+}  // namespace
+
 bool CredRequestUtil::GetAccessToken(long id, KOVA_CRED_SESS *sess) {
-    return Guarded(kLineAuthException, false, [&] {
+    return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         if (sess == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineTokenBadParam);
             return false;
         }
-        if (KOVACredSessGetByID(id, sess) < 0) {
-            kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenNoSess, id);
-            return false;
-        }
-        // A stored session is trusted as it is; the server is not asked whether it still lives.
-        if (sess->filled) {
-            return true;
-        }
-        if (!Login(id, sess)) {
-            kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenLogin, id);
-            return false;
-        }
-        if (sess->filled) {
-            return true;
-        }
-        kova::Log("%s:%d Cannot get access token from database", kUnit, kLineTokenUnfilled);
-        return false;
+        return StoredSessionOrLogin(id, sess, [&] { return Login(id, sess); });
     });
 }
 
 bool CredRequestUtil::GetAccessToken(KOVA_CRED *cred, KOVA_CRED_SESS *sess) {
-    return Guarded(kLineAuthException, false, [&] {
+    return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         if (cred == nullptr || sess == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineTokenBadParam);
             return false;
         }
-        const long id = cred->id;
-        if (KOVACredSessGetByID(id, sess) < 0) {
-            kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenNoSess, id);
-            return false;
-        }
-        if (sess->filled) {
-            return true;
-        }
-        if (!Login(cred, sess)) {
-            kova::Log("%s:%d Cannot get access token from id=[%ld]", kUnit, kLineTokenLogin, id);
-            return false;
-        }
-        if (sess->filled) {
-            return true;
-        }
-        kova::Log("%s:%d Cannot get access token from database", kUnit, kLineTokenUnfilled);
-        return false;
+        return StoredSessionOrLogin(cred->id, sess, [&] { return Login(cred, sess); });
     });
 }
 
@@ -333,7 +315,7 @@ constexpr int kLineLogoutSend = 368;
 constexpr int kLineLogoutInvalid = 377;
 
 bool CredRequestUtil::Logout(KOVA_CRED *cred, const std::string &sid) {
-    return Guarded(kLineAuthException, false, [&] {
+    return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         if (cred == nullptr || sid.empty()) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineLogoutBadParam);
             return false;
@@ -367,7 +349,7 @@ bool CredRequestUtil::Logout(KOVA_CRED *cred, const std::string &sid) {
 }
 
 bool CredRequestUtil::Logout(KOVA_CRED *cred, KOVA_CRED_SESS *sess) {
-    return Guarded(kLineAuthException, false, [&] {
+    return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         if (cred == nullptr || sess == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineLogoutBadParam);
             return false;
@@ -380,7 +362,7 @@ constexpr int kLineLogoutNoCred = 398;
 constexpr int kLineLogoutNoSess = 403;
 
 bool CredRequestUtil::Logout(long id) {
-    return Guarded(kLineAuthException, false, [&] {
+    return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         KOVA_CRED cred;
         if (KOVACredGetByID(id, &cred) < 0 || cred.filled == 0) {
             kova::Log("%s:%d Cannot find id[%ld] in cred", kUnit, kLineLogoutNoCred, id);

@@ -19,18 +19,6 @@ namespace {
 
 const char kUnit[] = "cred_request_util";
 
-template <typename Result, typename Body>
-Result Guarded(int line, Result failure, Body body) {
-    try {
-        return body();
-    } catch (const std::exception &e) {
-        kova::Log("%s:%d Exception: %s", kUnit, line, e.what());
-    } catch (...) {
-        kova::Log("%s:%d Exception", kUnit, line);
-    }
-    return failure;
-}
-
 // A credential id as the cache names it: through a JSON integer, so -1 is "-1".
 std::string CacheKey(long id) {
     return Json::Value(static_cast<Json::Int64>(id)).asString();
@@ -98,7 +86,7 @@ constexpr int kLineDescFail = 90;
 constexpr int kLineDescException = 96;
 
 bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
-    return Guarded(kLineDescException, false, [&] {
+    return kova::Guarded(kUnit, kLineDescException, false, [&] {
         if (cred == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineDescBadParam);
             return false;
@@ -140,7 +128,7 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
 }
 
 void CredRequestUtil::RemoveWebAPIDesc(const KOVA_CRED *cred) {
-    Guarded(kLineDescException, 0, [&] {
+    kova::Guarded(kUnit, kLineDescException, 0, [&] {
         if (cred != nullptr) {
             Json::Value &root = DescRoot();
             if (root.isObject()) {
@@ -152,7 +140,7 @@ void CredRequestUtil::RemoveWebAPIDesc(const KOVA_CRED *cred) {
 }
 
 bool CredRequestUtil::IsCredIdCached(long id) {
-    return Guarded(kLineDescException, false, [&] {
+    return kova::Guarded(kUnit, kLineDescException, false, [&] {
         Json::Value &root = DescRoot();
         return root.isObject() && root.isMember(CacheKey(id));
     });
@@ -163,7 +151,7 @@ constexpr int kLinePathNoDesc = 148;
 constexpr int kLinePathNoApi = 154;
 
 std::string CredRequestUtil::GetWebAPIPath(const KOVA_CRED *cred, const std::string &api) {
-    return Guarded(kLineDescException, std::string(), [&]() -> std::string {
+    return kova::Guarded(kUnit, kLineDescException, std::string(), [&]() -> std::string {
         if (cred == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLinePathBadParam);
             return "";
@@ -187,7 +175,7 @@ std::string CredRequestUtil::GetWebAPIPath(const KOVA_CRED *cred, const std::str
 constexpr int kLinePathIdMissing = 172;
 
 std::string CredRequestUtil::GetWebAPIPath(long id, const std::string &api) {
-    return Guarded(kLineDescException, std::string(), [&]() -> std::string {
+    return kova::Guarded(kUnit, kLineDescException, std::string(), [&]() -> std::string {
         KOVA_CRED cred;
         if (KOVACredGetByID(id, &cred) < 0 || cred.filled == 0) {
             kova::Log("%s:%d cannot get cgi path from id=[%ld]", kUnit, kLinePathIdMissing, id);
@@ -202,7 +190,7 @@ constexpr int kLineFormatNoDesc = 192;
 
 bool CredRequestUtil::GetWebAPIRequestFormat(const KOVA_CRED *cred, const std::string &api,
                                              std::string &format) {
-    return Guarded(kLineDescException, false, [&] {
+    return kova::Guarded(kUnit, kLineDescException, false, [&] {
         if (cred == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineFormatBadParam);
             return false;
@@ -222,7 +210,7 @@ bool CredRequestUtil::GetWebAPIRequestFormat(const KOVA_CRED *cred, const std::s
 constexpr int kLineFormatFailed = 207;
 
 std::string CredRequestUtil::GetWebAPIRequestFormat(const KOVA_CRED *cred, const std::string &api) {
-    return Guarded(kLineDescException, std::string(), [&]() -> std::string {
+    return kova::Guarded(kUnit, kLineDescException, std::string(), [&]() -> std::string {
         std::string format;
         if (!GetWebAPIRequestFormat(cred, api, format)) {
             kova::Log("%s:%d GetWebAPIRequestFormat failed", kUnit, kLineFormatFailed);
@@ -235,7 +223,7 @@ std::string CredRequestUtil::GetWebAPIRequestFormat(const KOVA_CRED *cred, const
 constexpr int kLineFormatIdMissing = 221;
 
 std::string CredRequestUtil::GetWebAPIRequestFormat(long id, const std::string &api) {
-    return Guarded(kLineDescException, std::string(), [&]() -> std::string {
+    return kova::Guarded(kUnit, kLineDescException, std::string(), [&]() -> std::string {
         KOVA_CRED cred;
         if (KOVACredGetByID(id, &cred) < 0 || cred.filled == 0) {
             kova::Log("%s:%d Cannot find id[%ld] in database", kUnit, kLineFormatIdMissing, id);
