@@ -24,10 +24,11 @@ const Json::Value kNull;
 }  // namespace
 
 namespace {
-// Encryption mode of the document: 0 when "Crypto" is absent or not a number.
+// Encryption mode of the document: 0 (plain) when "Crypto" is absent, not a number, or a number
+// no mode can be (asInt would throw on a value beyond int).
 int CryptoMode(const CredRequestPrivate &p) {
     const Json::Value &mode = p.GetData("Crypto", "", kNull);
-    return mode.isIntegral() ? mode.asInt() : 0;
+    return mode.isInt() ? mode.asInt() : 0;
 }
 
 bool IsJsonFormat(const CredRequestPrivate &p) {

@@ -122,7 +122,7 @@ bool CredRequestPrivate::InitCurlHandler() {
 
     const Json::Value &respTime = GetData("RespTime", "", kNull);
     const long lowSpeedTime =
-        respTime.isIntegral() ? static_cast<long>(respTime.asInt64()) : defaultTimeout;
+        respTime.isInt64() ? static_cast<long>(respTime.asInt64()) : defaultTimeout;
     if (!SetOption(CURLOPT_TCP_KEEPALIVE, 1L) || !SetOption(CURLOPT_TCP_KEEPIDLE, defaultTimeout) ||
         !SetOption(CURLOPT_TCP_KEEPINTVL, defaultTimeout) ||
         !SetOption(CURLOPT_LOW_SPEED_LIMIT, 1L) ||
