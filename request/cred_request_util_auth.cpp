@@ -7,6 +7,8 @@
 #include <exception>
 #include <string>
 
+#include <json/reader.h>
+
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
 #include "kovacredential/kovacred.h"
@@ -209,8 +211,10 @@ bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
                       static_cast<int>(request.GetError()));
             return false;
         }
+        // jsoncpp's lenient reader: comments and text behind the answer are tolerated.
+        Json::Reader reader;
         Json::Value answer;
-        const bool parsed = kova::JsonFromString(request.GetResponse(), answer);
+        const bool parsed = reader.parse(request.GetResponse(), answer);
         if (response != nullptr) {
             *response = answer;
         }

@@ -318,6 +318,32 @@ INSTANTIATE_TEST_SUITE_P(Answers, WebApiBadAnswerTest,
                                            "{\"success\":true}", "{\"success\":\"yes\"}",
                                            "{\"success\":true,\"data\":\"sid\"}", "[1,2]", ""));
 
+TEST_F(WebApiAuthTest, LoginAnswerIsReadLenientlyButLogoutAnswerMustBeWhole) {
+    const std::string body =
+        "/* session */ {\"success\":true,\"data\":{\"sid\":\"S-1\",\"kovatoken\":\"T-1\"}}"
+        "\n<!-- served in 1 ms -->";
+    kovasim::LoopbackServer lenient;
+    lenient.Route("*", "/webapi/auth.cgi",
+                  [body](const httplib::Request &, httplib::Response &res) {
+                      res.set_content(body, "application/json");
+                  });
+    Sim().Install(lenient);  // discovery and encryption from the simulator
+    ASSERT_TRUE(lenient.Start());
+    KOVA_CRED cred;
+    FillCred(cred);
+    cred.port = lenient.Port();
+    KOVA_CRED_SESS sess;
+    Json::Value response;
+    ASSERT_TRUE(CredRequestUtil::LoginWithOTP(&cred, "", &sess, &response)) << LogDump();
+    EXPECT_EQ(1, sess.filled);
+    EXPECT_EQ("S-1", sess.access_token);
+    EXPECT_EQ("T-1", sess.csrf_token);
+    EXPECT_EQ("S-1", response["data"]["sid"].asString());
+
+    EXPECT_FALSE(CredRequestUtil::Logout(&cred, "S-1"));
+    EXPECT_TRUE(LogHas("Logout response is invalid")) << LogDump();
+}
+
 TEST_F(WebApiAuthTest, LoginTransferFailureIsReported) {
     KOVA_CRED cred;
     FillCred(cred);
