@@ -51,15 +51,6 @@ Json::Value HeaderValue(const Json::Value &headers, const std::string &name) {
     return Json::Value();
 }
 
-std::string Trimmed(const std::string &text) {
-    const char *space = " \t\r\n";
-    size_t start = text.find_first_not_of(space);
-    if (start == std::string::npos) {
-        return "";
-    }
-    return text.substr(start, text.find_last_not_of(space) - start + 1);
-}
-
 }  // namespace
 
 constexpr int kLineAuthException = 75;
@@ -151,11 +142,12 @@ bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
             return false;
         }
         const Json::Value location = HeaderValue(headers, "Location");
-        if (!location.isString() || Trimmed(location.asString()).empty()) {
+        if (!location.isString() || location.asString().empty()) {
             kova::Log("%s:%d Return 302, but no Location in header.", kUnit, kLineRedirNoLocation);
             return false;
         }
-        const std::string target = Trimmed(location.asString());
+        // Parsed as the server sent it.
+        const std::string target = location.asString();
         std::string scheme;
         std::string host;
         std::string port;

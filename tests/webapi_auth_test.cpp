@@ -469,6 +469,24 @@ TEST_F(WebApiRedirectTest, RedirectWithoutUsableLocationFails) {
     EXPECT_TRUE(LogHas("Can not identify 302 Location: https://[fe80::1.")) << LogDump();
 }
 
+TEST_F(WebApiRedirectTest, LocationIsParsedAsTheServerSentIt) {
+    // A blank in front of the address hides its scheme from the split: the credential stays
+    // plain HTTP and the text before the last colon becomes its host.
+    kovasim::LoopbackServer odd;
+    odd.Route("*", "/webapi/query.cgi", [](const httplib::Request &, httplib::Response &res) {
+        res.status = 302;
+        res.set_header("Location", " https://127.0.0.1:5001/");
+    });
+    ASSERT_TRUE(odd.Start());
+    KOVA_CRED cred;
+    FillCred(cred);
+    cred.port = odd.Port();
+    ASSERT_TRUE(CredRequestUtil::CheckRedirect(&cred)) << LogDump();
+    EXPECT_EQ("http", cred.protocol);
+    EXPECT_EQ(" https", cred.host);
+    EXPECT_EQ(0, cred.port);
+}
+
 TEST_F(WebApiAuthTest, SetWebApiUrlPlacesStandardParametersByFormat) {
     KOVA_CRED cred;
     FillCred(cred);
