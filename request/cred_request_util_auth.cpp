@@ -7,6 +7,8 @@
 #include <exception>
 #include <string>
 
+#include <json/reader.h>
+
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
 #include "kovacredential/kovacred.h"
@@ -47,15 +49,6 @@ Json::Value HeaderValue(const Json::Value &headers, const std::string &name) {
         }
     }
     return Json::Value();
-}
-
-std::string Trimmed(const std::string &text) {
-    const char *space = " \t\r\n";
-    size_t start = text.find_first_not_of(space);
-    if (start == std::string::npos) {
-        return "";
-    }
-    return text.substr(start, text.find_last_not_of(space) - start + 1);
 }
 
 }  // namespace
@@ -149,11 +142,12 @@ bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
             return false;
         }
         const Json::Value location = HeaderValue(headers, "Location");
-        if (!location.isString() || Trimmed(location.asString()).empty()) {
+        if (!location.isString() || location.asString().empty()) {
             kova::Log("%s:%d Return 302, but no Location in header.", kUnit, kLineRedirNoLocation);
             return false;
         }
-        const std::string target = Trimmed(location.asString());
+        // Parsed as the server sent it.
+        const std::string target = location.asString();
         std::string scheme;
         std::string host;
         std::string port;
@@ -209,8 +203,10 @@ bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
                       static_cast<int>(request.GetError()));
             return false;
         }
+        // jsoncpp's lenient reader: comments and text behind the answer are tolerated.
+        Json::Reader reader;
         Json::Value answer;
-        const bool parsed = kova::JsonFromString(request.GetResponse(), answer);
+        const bool parsed = reader.parse(request.GetResponse(), answer);
         if (response != nullptr) {
             *response = answer;
         }

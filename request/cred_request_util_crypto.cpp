@@ -10,6 +10,8 @@
 #include <openssl/param_build.h>
 #include <openssl/rsa.h>
 
+#include <json/reader.h>
+
 #include "kovacredential/cred_request_util.h"
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
@@ -163,8 +165,10 @@ bool CredRequestUtil::GetEncInfo(const std::string &url, Json::Value &info) {
                       static_cast<int>(request.GetError()));
             return false;
         }
+        // jsoncpp's lenient reader: comments and text behind the answer are tolerated.
+        Json::Reader reader;
         Json::Value root;
-        if (!kova::JsonFromString(request.GetResponse(), root) || !root.isObject() ||
+        if (!reader.parse(request.GetResponse(), root, false) || !root.isObject() ||
             !root.isMember("data")) {
             kova::Log("%s:%d encryption response is invalid", kUnit, kLineEncInfoInvalid);
             return false;

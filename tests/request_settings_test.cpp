@@ -68,6 +68,14 @@ TEST_F(SettingsTest, RejectedArgumentsSetBadParam) {
     EXPECT_FALSE(req.SetUploadFile(nullptr, "/tmp/x"));
     EXPECT_FALSE(req.SetUploadFile("f", nullptr));
     EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_BAD_PARAM);
+    // With both arguments given the result is true, even when the document refuses the name.
+    req.SetError(KOVA::CRED_REQ_ERR_NONE);
+    EXPECT_TRUE(req.SetUploadFile("", "/tmp/x"));
+    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_BAD_PARAM);
+    req.SetError(KOVA::CRED_REQ_ERR_NONE);
+    EXPECT_TRUE(req.SetUploadFile("f", "/tmp/x"));
+    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_NONE);
+    req.SetError(KOVA::CRED_REQ_ERR_BAD_PARAM);
     // The error is never cleared by a later successful setter.
     EXPECT_TRUE(req.AddGetParam(Json::Value(Json::objectValue)));
     EXPECT_TRUE(req.AddHeader("X", ""));

@@ -292,6 +292,13 @@ TEST_F(EncInfoTest, SuccessFalseWithDataStillCounts) {
     EXPECT_EQ(info["cipherkey"].asString(), "k");
 }
 
+TEST_F(EncInfoTest, CommentsAndTextBehindTheAnswerAreTolerated) {
+    answer_ = "/* module */ {\"data\":{\"cipherkey\":\"k\"}}\n<!-- served in 1 ms -->";
+    Json::Value info;
+    ASSERT_TRUE(CredRequestUtil::GetEncInfo(EncUrl(), info)) << kova_test::LogDump();
+    EXPECT_EQ(info["cipherkey"].asString(), "k");
+}
+
 TEST_F(EncInfoTest, InvalidAnswersAndFailures) {
     Json::Value info;
     for (const char *bad : {"{\"success\":true}", "<html>", "[1,2]", ""}) {

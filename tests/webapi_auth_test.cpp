@@ -318,6 +318,32 @@ INSTANTIATE_TEST_SUITE_P(Answers, WebApiBadAnswerTest,
                                            "{\"success\":true}", "{\"success\":\"yes\"}",
                                            "{\"success\":true,\"data\":\"sid\"}", "[1,2]", ""));
 
+TEST_F(WebApiAuthTest, LoginAnswerIsReadLenientlyButLogoutAnswerMustBeWhole) {
+    const std::string body =
+        "/* session */ {\"success\":true,\"data\":{\"sid\":\"S-1\",\"kovatoken\":\"T-1\"}}"
+        "\n<!-- served in 1 ms -->";
+    kovasim::LoopbackServer lenient;
+    lenient.Route("*", "/webapi/auth.cgi",
+                  [body](const httplib::Request &, httplib::Response &res) {
+                      res.set_content(body, "application/json");
+                  });
+    Sim().Install(lenient);  // discovery and encryption from the simulator
+    ASSERT_TRUE(lenient.Start());
+    KOVA_CRED cred;
+    FillCred(cred);
+    cred.port = lenient.Port();
+    KOVA_CRED_SESS sess;
+    Json::Value response;
+    ASSERT_TRUE(CredRequestUtil::LoginWithOTP(&cred, "", &sess, &response)) << LogDump();
+    EXPECT_EQ(1, sess.filled);
+    EXPECT_EQ("S-1", sess.access_token);
+    EXPECT_EQ("T-1", sess.csrf_token);
+    EXPECT_EQ("S-1", response["data"]["sid"].asString());
+
+    EXPECT_FALSE(CredRequestUtil::Logout(&cred, "S-1"));
+    EXPECT_TRUE(LogHas("Logout response is invalid")) << LogDump();
+}
+
 TEST_F(WebApiAuthTest, LoginTransferFailureIsReported) {
     KOVA_CRED cred;
     FillCred(cred);
@@ -441,6 +467,24 @@ TEST_F(WebApiRedirectTest, RedirectWithoutUsableLocationFails) {
     cred.port = unparsable.Port();
     EXPECT_FALSE(CredRequestUtil::CheckRedirect(&cred));
     EXPECT_TRUE(LogHas("Can not identify 302 Location: https://[fe80::1.")) << LogDump();
+}
+
+TEST_F(WebApiRedirectTest, LocationIsParsedAsTheServerSentIt) {
+    // A blank in front of the address hides its scheme from the split: the credential stays
+    // plain HTTP and the text before the last colon becomes its host.
+    kovasim::LoopbackServer odd;
+    odd.Route("*", "/webapi/query.cgi", [](const httplib::Request &, httplib::Response &res) {
+        res.status = 302;
+        res.set_header("Location", " https://127.0.0.1:5001/");
+    });
+    ASSERT_TRUE(odd.Start());
+    KOVA_CRED cred;
+    FillCred(cred);
+    cred.port = odd.Port();
+    ASSERT_TRUE(CredRequestUtil::CheckRedirect(&cred)) << LogDump();
+    EXPECT_EQ("http", cred.protocol);
+    EXPECT_EQ(" https", cred.host);
+    EXPECT_EQ(0, cred.port);
 }
 
 TEST_F(WebApiAuthTest, SetWebApiUrlPlacesStandardParametersByFormat) {
