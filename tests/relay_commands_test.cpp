@@ -247,6 +247,17 @@ TEST_F(RelayCommandsTest, JsonThatIsNoObjectIsSentButNotAccepted) {
     CredRequestFarlink client;
     EXPECT_FALSE(client.GetSiteList(answer));
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":[1,2]})"));
+
+    // A bare scalar is JSON as well: it is parsed and then refused as the answer.
+    Configure(R"({"answers": [{"raw": "0"}]})");
+    EXPECT_TRUE(core.SendFarlinkRequest(body, answer));
+    EXPECT_EQ(answer, Json::Value(0));
+    EXPECT_FALSE(core.CheckResponse("0", nullptr));
+    EXPECT_FALSE(client.GetSiteList(answer));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":0})"));
+    client.SetServerId("S1");
+    EXPECT_FALSE(client.GetServerInfo(answer));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":"0"})"));
 }
 
 TEST_F(RelayCommandsTest, TransportFailureGives22WithTheRequestError) {
