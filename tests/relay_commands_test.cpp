@@ -1,5 +1,7 @@
 // Relay directory commands against a simulated directory: the documents on the wire, the site
 // list and the walk over its sites, tunnels, and how unusable answers are reported.
+#include <arpa/inet.h>
+#include <netinet/in.h>
 #include <stdlib.h>
 
 #include <memory>
@@ -144,6 +146,25 @@ TEST_F(RelayCommandsTest, SitesAreTriedInOrderUntilOneAnswers) {
     auto tunnels = Sim().Hits("request_tunnel");
     ASSERT_EQ(tunnels.size(), 1u);
     EXPECT_EQ(tunnels[0].site, Host(2));
+}
+
+TEST_F(RelayCommandsTest, SiteEntriesAreTakenAsText) {
+    // A site given as a JSON number is used as the text of that number: the 32-bit number
+    // form of an IPv4 address reaches the site at that address.
+    in_addr address{};
+    ASSERT_EQ(inet_pton(AF_INET, Host(2).c_str(), &address), 1);
+    const std::string number = std::to_string(ntohl(address.s_addr));
+    Configure(R"({"sites": [)" + number + R"(],
+                  "servers": [{"serverID": "S1", "sites": ["%2"],
+                               "services": {"zon": {"port": 5000}}}]})");
+    CredRequestFarlink client;
+    client.SetServerId("S1");
+    Json::Value info;
+    ASSERT_TRUE(client.GetAvailableServerInfo(info)) << client.GetErrors().toStyledString();
+    EXPECT_EQ(info["service"]["port"], 5000);
+    auto asked = Sim().Hits("get_server_info");
+    ASSERT_EQ(asked.size(), 1u);
+    EXPECT_EQ(asked[0].site, Host(2));
 }
 
 TEST_F(RelayCommandsTest, NoSiteAnsweringLeavesTheLastSiteAndFails) {
