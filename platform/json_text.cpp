@@ -13,6 +13,9 @@ bool JsonFromString(const std::string &text, Json::Value &value) {
         Json::CharReaderBuilder builder;
         Json::CharReaderBuilder::strictMode(&builder.settings_);
         builder["allowSpecialFloats"] = false;
+        // Any JSON value may stand at the root ("0", "\"busy\""); callers that need an object
+        // check for one themselves.
+        builder["strictRoot"] = false;
         return std::unique_ptr<Json::CharReader>(builder.newCharReader());
     }();
     Json::Value parsed;

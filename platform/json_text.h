@@ -8,8 +8,9 @@
 
 namespace kova {
 
-// Parses the whole of `text` as one strict JSON document into `value`. Returns false (and
-// leaves `value` null) for invalid text, trailing garbage or an empty text.
+// Parses the whole of `text` as one strict JSON document into `value`; its root may be any
+// value, not only an object or array. Returns false (and leaves `value` null) for invalid text,
+// trailing garbage or an empty text.
 bool JsonFromString(const std::string &text, Json::Value &value);
 
 // The compact JSON text of `value` (no white space, UTF-8 kept as it is).

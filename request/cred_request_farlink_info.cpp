@@ -125,7 +125,10 @@ bool CredRequestFarlink::GetAvailableServerInfo(Json::Value &info) {
             for (const Json::Value &site : *sites) {
                 // A failing site leaves its error recorded until a later one overwrites it; the
                 // server name stays at the site that answered so that a tunnel goes there too.
-                d->SetServerName(site.isString() ? site.asString() : std::string());
+                // Each entry is taken as text (a number or flag as its text); one that has
+                // none (an array or object) leaves no server name, which fails with 22.
+                d->SetServerName(site.isConvertibleTo(Json::stringValue) ? site.asString()
+                                                                         : std::string());
                 Json::Value candidate;
                 if (GetServerInfo(candidate)) {
                     info.swap(candidate);

@@ -155,6 +155,12 @@ TEST(JsonText, ParsesStrictlyAndWritesCompactly) {
     EXPECT_FALSE(kova::JsonFromString("{\"a\":1} trailing", v));
     EXPECT_FALSE(kova::JsonFromString("", v));
     EXPECT_FALSE(kova::JsonFromString("{'a':1}", v));
+    // A scalar is a whole JSON document too.
+    EXPECT_TRUE(kova::JsonFromString("0", v));
+    EXPECT_EQ(v, Json::Value(0));
+    EXPECT_TRUE(kova::JsonFromString("\"busy\"", v));
+    EXPECT_EQ(v, Json::Value("busy"));
+    EXPECT_FALSE(kova::JsonFromString("0 1", v));
 }
 
 int FixedProvider(char *token, size_t tokenSize, char *key, size_t keySize) {

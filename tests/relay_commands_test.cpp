@@ -1,5 +1,7 @@
 // Relay directory commands against a simulated directory: the documents on the wire, the site
 // list and the walk over its sites, tunnels, and how unusable answers are reported.
+#include <arpa/inet.h>
+#include <netinet/in.h>
 #include <stdlib.h>
 
 #include <memory>
@@ -146,6 +148,25 @@ TEST_F(RelayCommandsTest, SitesAreTriedInOrderUntilOneAnswers) {
     EXPECT_EQ(tunnels[0].site, Host(2));
 }
 
+TEST_F(RelayCommandsTest, SiteEntriesAreTakenAsText) {
+    // A site given as a JSON number is used as the text of that number: the 32-bit number
+    // form of an IPv4 address reaches the site at that address.
+    in_addr address{};
+    ASSERT_EQ(inet_pton(AF_INET, Host(2).c_str(), &address), 1);
+    const std::string number = std::to_string(ntohl(address.s_addr));
+    Configure(R"({"sites": [)" + number + R"(],
+                  "servers": [{"serverID": "S1", "sites": ["%2"],
+                               "services": {"zon": {"port": 5000}}}]})");
+    CredRequestFarlink client;
+    client.SetServerId("S1");
+    Json::Value info;
+    ASSERT_TRUE(client.GetAvailableServerInfo(info)) << client.GetErrors().toStyledString();
+    EXPECT_EQ(info["service"]["port"], 5000);
+    auto asked = Sim().Hits("get_server_info");
+    ASSERT_EQ(asked.size(), 1u);
+    EXPECT_EQ(asked[0].site, Host(2));
+}
+
 TEST_F(RelayCommandsTest, NoSiteAnsweringLeavesTheLastSiteAndFails) {
     Configure(R"({"sites": ["%2", "%3"], "servers": []})");
     CredRequestFarlink client;
@@ -247,6 +268,17 @@ TEST_F(RelayCommandsTest, JsonThatIsNoObjectIsSentButNotAccepted) {
     CredRequestFarlink client;
     EXPECT_FALSE(client.GetSiteList(answer));
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":[1,2]})"));
+
+    // A bare scalar is JSON as well: it is parsed and then refused as the answer.
+    Configure(R"({"answers": [{"raw": "0"}]})");
+    EXPECT_TRUE(core.SendFarlinkRequest(body, answer));
+    EXPECT_EQ(answer, Json::Value(0));
+    EXPECT_FALSE(core.CheckResponse("0", nullptr));
+    EXPECT_FALSE(client.GetSiteList(answer));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":0})"));
+    client.SetServerId("S1");
+    EXPECT_FALSE(client.GetServerInfo(answer));
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":"0"})"));
 }
 
 TEST_F(RelayCommandsTest, TransportFailureGives22WithTheRequestError) {
