@@ -24,12 +24,16 @@ class KOVA_EXPORT CredRequestMgr {
     CredRequestMgr(const CredRequestMgr &) = delete;
     CredRequestMgr &operator=(const CredRequestMgr &) = delete;
 
+    // The manager's last error (CRED_REQ_ERR_BAD_PARAM, _LOGIN_FAIL, _QUERY_FAIL,
+    // _NO_REQUEST_FORMAT, _CURL_INTERNAL, _TIMEOUT, _SELECT); 0 until one happens, never reset by
+    // the manager. Each request keeps its own error besides.
     void SetError(KOVA::_tag_CRED_REQ_ERR error);
     KOVA::_tag_CRED_REQ_ERR GetError();
 
     // Takes ownership of `request`; its index, or -1 (null: CRED_REQ_ERR_BAD_PARAM).
     int AddCredRequest(KOVA::CredRequest *request);
-    // Builds a WebAPI request with CredRequest::CreateWebAPIRequest and adds it.
+    // Build a WebAPI (or relay) request with the factories of CredRequest and add it; -1 (and a
+    // log line) when the factory fails.
     int AddWebAPIRequest(long credId, const std::string &api, int version,
                          const std::string &method, const Json::Value &params);
     int AddWebAPIRequest(const KOVA_CRED *cred, const KOVA_CRED_SESS *sess, const std::string &api,
@@ -46,18 +50,30 @@ class KOVA_EXPORT CredRequestMgr {
     KOVA::CredRequest *GetRequest(int index);
     // Hands the request at `index` to the caller; its slot stays, holding null.
     KOVA::CredRequest *RemoveRequest(int index);
+    // Slots, removed ones included.
     int Size();
     bool IsEmpty();
+    // Destroys every request the manager holds and empties the slots.
     void Clear();
 
-    // Runs every request concurrently until all have finished or the first failure.
+    // Runs every request concurrently on the calling thread until all have finished; false on
+    // the first failure of the loop itself (CRED_REQ_ERR_CURL_INTERNAL, _SELECT, or _TIMEOUT
+    // after a whole wait of the largest response time-out, 120 s by default, without progress).
+    // Requests whose set-up fails are left out and keep their own error. Each request's outcome
+    // is read from the request (GetResponse, GetError of the request).
     bool Run();
+    // A copy of the response body of the request at `index`; "" and CRED_REQ_ERR_BAD_PARAM for
+    // a bad index.
     std::string GetResponse(int index);
-    // One string per slot, in adding order.
+    // One string per slot, in adding order ("" for a slot emptied by RemoveRequest).
     Json::Value GetAllResponse();
 
+    // The multi handle's socket callback: on CURL_POLL_REMOVE it marks the request holding
+    // `easy` with CRED_REQ_ERR_TIMEOUT. Always returns 0.
     static int SocketCallback(CURL *easy, curl_socket_t socket, int what, void *userp,
                               void *socketp);
+    // The transfer loop of Run: select over the multi handle's sockets, waiting at most
+    // `waitSeconds` for progress. True when every transfer has finished.
     bool curlHandlerProcess(CURLM *multi, long waitSeconds);
 
   private:
