@@ -312,6 +312,18 @@ TEST_F(RecordsTest, CredRowFirstCopiesColumnsByName) {
     EXPECT_EQ(cred->host, "");
 }
 
+TEST_F(RecordsTest, IntegerColumnsOutOfRangeSaturate) {
+    CredPtr cred = NewCred();
+    FakeRow row({"id", "owner", "port", "ctime", "mtime"},
+                {"2147483647", "-99999999999", "99999999999", "4294967297", "-2147483648"});
+    row.Feed(CredRowFirst, cred.get());
+    EXPECT_EQ(cred->id, INT32_MAX);
+    EXPECT_EQ(cred->owner, INT32_MIN);
+    EXPECT_EQ(cred->port, INT32_MAX);
+    EXPECT_EQ(cred->ctime, INT32_MAX);  // not wrapped to 1
+    EXPECT_EQ(cred->mtime, INT32_MIN);
+}
+
 TEST_F(RecordsTest, CredRowFirstMatchesNamesExactly) {
     CredPtr cred = NewCred();
     FakeRow row({"ID", "Host", "hostname", "host"}, {"5", "upper", "longer", "exact"});
