@@ -1,6 +1,7 @@
 // Row callbacks of the credential database: result rows of sqlite3_exec become records.
 // SQLite calls them from C, so no exception may pass through them; each returns 0 so that a
 // query is never aborted by a record it could not build.
+#include <stdint.h>
 #include <stdlib.h>
 #include <string.h>
 
@@ -59,9 +60,21 @@ const StringColumn<KOVA_CRED_SESS> kSessStringColumns[] = {
     {"extra_info", &KOVA_CRED_SESS::extra_info},
 };
 
-// Integer columns are always written by the database layer; a NULL one reads as 0.
+// Integer columns are always written by the database layer; a NULL one reads as 0. The text
+// converts as strtol does where long is 32 bits: a value beyond the range saturates rather
+// than wrapping.
 int32_t ColumnInt(const char *text) {
-    return text != nullptr ? static_cast<int32_t>(strtol(text, nullptr, 10)) : 0;
+    if (text == nullptr) {
+        return 0;
+    }
+    const long long value = strtoll(text, nullptr, 10);
+    if (value > INT32_MAX) {
+        return INT32_MAX;
+    }
+    if (value < INT32_MIN) {
+        return INT32_MIN;
+    }
+    return static_cast<int32_t>(value);
 }
 
 template <typename Record, size_t NInt, size_t NString>

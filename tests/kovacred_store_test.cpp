@@ -1,8 +1,5 @@
 // kovacred's store commands end to end on a temporary database: output, failure messages,
 // exit codes, and that no password ever reaches the output.
-#include <fcntl.h>
-#include <unistd.h>
-
 #include <string>
 
 #include <gtest/gtest.h>
@@ -156,9 +153,7 @@ TEST_F(KovacredStoreTest, FailuresPrintOneLineAndExitNonZero) {
 }
 
 TEST_F(KovacredStoreTest, UnusableDatabaseIsReportedWithTheLibraryCode) {
-    const std::string blocker = db_.dir().File("plain");
-    close(open(blocker.c_str(), O_CREAT | O_WRONLY, 0600));
-    const std::string cmd = std::string(KOVACRED_BIN) + " --db '" + blocker + "/x.sqlite' list";
+    const std::string cmd = std::string(KOVACRED_BIN) + " --db '" + BlockDatabase() + "' list";
     std::string out;
     EXPECT_EQ(kova_test::RunCommand(cmd + " 2>&1", &out), 1);
     EXPECT_EQ(out, "kovacred: list credentials failed (error 2304)\n");

@@ -20,11 +20,6 @@ namespace {
 
 using namespace store_test;
 
-struct DbCloser {
-    void operator()(sqlite3 *db) const { sqlite3_close(db); }
-};
-using DbPtr = std::unique_ptr<sqlite3, DbCloser>;
-
 // Counts the executions of statements that begin with a prefix on one connection, and can
 // release another connection's lock once a given number of executions is reached.
 struct StatementCounter {

@@ -1,6 +1,5 @@
 // The credential database: file, mode and schema; the record-level operations on an open
 // connection; their argument and statement errors; hostile text; a broken environment.
-#include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -15,11 +14,6 @@
 namespace {
 
 using namespace store_test;
-
-struct DbCloser {
-    void operator()(sqlite3 *db) const { sqlite3_close(db); }
-};
-using DbPtr = std::unique_ptr<sqlite3, DbCloser>;
 
 class DatabaseTest : public StoreTest {
   protected:
@@ -158,10 +152,7 @@ TEST_F(DatabaseTest, GetListOrderConditionAndOrdering) {
         Add(db.get(), *MakeCred("h" + std::to_string(port), "app", port));
     }
     auto ids = [](KOVA_CRED *head) {
-        std::vector<int> out;
-        for (KOVA_CRED *p = head; p; p = p->next) {
-            out.push_back(p->id);
-        }
+        std::vector<int> out = Ids(head);
         KOVACredListFree(&head);
         return out;
     };
@@ -313,39 +304,38 @@ TEST_F(DatabaseTest, ArgumentErrorsCarryTheirLines) {
     DbPtr db = Open();
     CredPtr cred = NewCred();
     SessPtr sess = NewSess();
-    struct Case {
-        std::function<long()> call;
-        int line;
-        std::string check;
-    };
-    const std::vector<Case> cases = {
-        {[&] { return KOVACredDBRecordAdd(nullptr, cred.get(), nullptr); }, 193, "__null != db"},
-        {[&] { return KOVACredDBRecordAdd(db.get(), nullptr, nullptr); }, 193, "NULL != pCred"},
-        {[&] { return KOVACredDBRecordGet(nullptr, 1, cred.get()); }, 235, "__null != db"},
-        {[&] { return KOVACredDBRecordGet(db.get(), 1, nullptr); }, 235, "NULL != pCred"},
-        {[&] { return KOVACredDBRecordGetList(nullptr, nullptr, nullptr, 0) ? 0L : -1L; }, 265,
+    ExpectArgErrors({
+        {[&] { return KOVACredDBRecordAdd(nullptr, cred.get(), nullptr); }, "cred_db", 193,
          "__null != db"},
-        {[&] { return KOVACredDBRecordRemove(nullptr, 1); }, 312, "__null != db"},
-        {[&] { return KOVACredDBRecordUpdate(nullptr, 1, cred.get()); }, 337, "__null != db"},
-        {[&] { return KOVACredDBRecordUpdate(db.get(), 1, nullptr); }, 337, "NULL != pCred"},
-        {[&] { return KOVACredSessDBRecordAdd(nullptr, sess.get(), nullptr); }, 401,
+        {[&] { return KOVACredDBRecordAdd(db.get(), nullptr, nullptr); }, "cred_db", 193,
+         "NULL != pCred"},
+        {[&] { return KOVACredDBRecordGet(nullptr, 1, cred.get()); }, "cred_db", 235,
          "__null != db"},
-        {[&] { return KOVACredSessDBRecordAdd(db.get(), nullptr, nullptr); }, 401, "NULL != pSess"},
-        {[&] { return KOVACredSessDBRecordGet(nullptr, 1, sess.get()); }, 436, "__null != db"},
-        {[&] { return KOVACredSessDBRecordGet(db.get(), 1, nullptr); }, 436, "NULL != pSess"},
-        {[&] { return KOVACredSessDBRecordGetList(nullptr, "x", "y", 1) ? 0L : -1L; }, 467,
+        {[&] { return KOVACredDBRecordGet(db.get(), 1, nullptr); }, "cred_db", 235,
+         "NULL != pCred"},
+        {[&] { return KOVACredDBRecordGetList(nullptr, nullptr, nullptr, 0) ? 0L : -1L; },
+         "cred_db", 265, "__null != db"},
+        {[&] { return KOVACredDBRecordRemove(nullptr, 1); }, "cred_db", 312, "__null != db"},
+        {[&] { return KOVACredDBRecordUpdate(nullptr, 1, cred.get()); }, "cred_db", 337,
          "__null != db"},
-        {[&] { return KOVACredSessDBRecordRemove(nullptr, 1); }, 513, "__null != db"},
-        {[&] { return KOVACredSessDBRecordUpdate(nullptr, 1, sess.get()); }, 539, "__null != db"},
-        {[&] { return KOVACredSessDBRecordUpdate(db.get(), 1, nullptr); }, 539, "NULL != pSess"},
-    };
-    for (const auto &c : cases) {
-        SCOPED_TRACE(c.check + " line " + std::to_string(c.line));
-        kova_test::ClearLog();
-        ResetErrorSlot();
-        EXPECT_EQ(c.call(), -1);
-        EXPECT_TRUE(ArgErrorReported("cred_db", c.line, c.check));
-    }
+        {[&] { return KOVACredDBRecordUpdate(db.get(), 1, nullptr); }, "cred_db", 337,
+         "NULL != pCred"},
+        {[&] { return KOVACredSessDBRecordAdd(nullptr, sess.get(), nullptr); }, "cred_db", 401,
+         "__null != db"},
+        {[&] { return KOVACredSessDBRecordAdd(db.get(), nullptr, nullptr); }, "cred_db", 401,
+         "NULL != pSess"},
+        {[&] { return KOVACredSessDBRecordGet(nullptr, 1, sess.get()); }, "cred_db", 436,
+         "__null != db"},
+        {[&] { return KOVACredSessDBRecordGet(db.get(), 1, nullptr); }, "cred_db", 436,
+         "NULL != pSess"},
+        {[&] { return KOVACredSessDBRecordGetList(nullptr, "x", "y", 1) ? 0L : -1L; }, "cred_db",
+         467, "__null != db"},
+        {[&] { return KOVACredSessDBRecordRemove(nullptr, 1); }, "cred_db", 513, "__null != db"},
+        {[&] { return KOVACredSessDBRecordUpdate(nullptr, 1, sess.get()); }, "cred_db", 539,
+         "__null != db"},
+        {[&] { return KOVACredSessDBRecordUpdate(db.get(), 1, nullptr); }, "cred_db", 539,
+         "NULL != pSess"},
+    });
 }
 
 TEST_F(DatabaseTest, StatementFailuresAreLoggedWithTheirLines) {
@@ -356,11 +346,9 @@ TEST_F(DatabaseTest, StatementFailuresAreLoggedWithTheirLines) {
               SQLITE_OK);
     CredPtr cred = MakeCred("h");
     SessPtr sess = MakeSess(1, "s", "t");
-    struct Case {
-        std::function<long()> call;
-        std::string prefix;
-    };
-    const std::vector<Case> cases = {
+    // Statement failures record no code.
+    ASSERT_EQ(VLIBCErrGet(), 0);
+    ExpectFailuresLogged({
         {[&] { return KOVACredDBRecordAdd(db.get(), cred.get(), nullptr); },
          "cred_db:214 Exec sql:[INSERT INTO credentials \t\t(ctime, mtime, host, owner, "
          "remote_account, remote_passwd, port, protocol, application, extra_info, pid) "
@@ -390,20 +378,8 @@ TEST_F(DatabaseTest, StatementFailuresAreLoggedWithTheirLines) {
         {[&] { return KOVACredDBRecordRemove(db.get(), 7); },
          "cred_db:319 Exec sql:[DELETE FROM credentials WHERE id=7;] error: no such table: "
          "credentials\n"},
-    };
-    for (const auto &c : cases) {
-        SCOPED_TRACE(c.prefix);
-        kova_test::ClearLog();
-        ResetErrorSlot();
-        EXPECT_EQ(c.call(), -1);
-        auto records = kova_test::LogRecords();
-        size_t found = 0;
-        for (const auto &r : records) {
-            found += r.rfind(c.prefix, 0) == 0 ? 1 : 0;
-        }
-        EXPECT_EQ(found, 1u) << kova_test::LogDump();
-        EXPECT_EQ(VLIBCErrGet(), 0);  // statement failures record no code
-    }
+    });
+    EXPECT_EQ(VLIBCErrGet(), 0);
 }
 
 // Text with every character that could end a quoted SQL literal or a format.
@@ -459,12 +435,7 @@ TEST_F(DatabaseTest, HostileTextRoundTripsAndInjectsNothing) {
 // ---- A broken environment: every case ends in a clean failure with its log, never a crash.
 
 TEST_F(DatabaseTest, FolderThatCannotBeMade) {
-    const std::string blocker = db_.dir().File("plainfile");
-    int fd = open(blocker.c_str(), O_CREAT | O_WRONLY, 0600);
-    ASSERT_GE(fd, 0);
-    close(fd);
-    const std::string path = blocker + "/sub/credentials.sqlite";
-    setenv("kovacredential_db", path.c_str(), 1);
+    const std::string path = BlockDatabase();
     EXPECT_EQ(KOVACredDBInit(), nullptr);
     EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_OPEN, "cred_db", 169));
     EXPECT_EQ(kova_test::LogCount("cred_db:165 " + path + " chmod failed. errno=[0x0014]"), 1u)

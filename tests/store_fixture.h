@@ -6,6 +6,9 @@
 
 #include <sqlite3.h>
 
+#include <stdio.h>
+
+#include <functional>
 #include <memory>
 #include <string>
 #include <vector>
@@ -24,8 +27,12 @@ struct CredDeleter {
 struct SessDeleter {
     void operator()(KOVA_CRED_SESS *p) const { KOVACredSessFree(p); }
 };
+struct DbCloser {
+    void operator()(sqlite3 *db) const { sqlite3_close(db); }
+};
 using CredPtr = std::unique_ptr<KOVA_CRED, CredDeleter>;
 using SessPtr = std::unique_ptr<KOVA_CRED_SESS, SessDeleter>;
+using DbPtr = std::unique_ptr<sqlite3, DbCloser>;
 
 inline CredPtr NewCred() {
     return CredPtr(KOVACredAlloc());
@@ -120,15 +127,94 @@ inline ::testing::AssertionResult ArgErrorReported(const std::string &file, int 
     return ErrorIs(KOVA_ERR_INVALID_ARGUMENT, file, line);
 }
 
-// A fresh database (kovacredential_db) and a clean log and error slot for every test.
-class StoreTest : public ::testing::Test {
+// The ids of a list from its head on.
+template <typename Record>
+std::vector<int> Ids(const Record *head) {
+    std::vector<int> ids;
+    for (const Record *p = head; p != nullptr; p = p->next) {
+        ids.push_back(p->id);
+    }
+    return ids;
+}
+
+// One call that must fail with -1 and report an argument error.
+struct ArgCase {
+    std::function<long()> call;
+    std::string file;
+    int line;
+    std::string check;
+};
+
+inline void ExpectArgErrors(const std::vector<ArgCase> &cases) {
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.file + ":" + std::to_string(c.line) + " " + c.check);
+        kova_test::ClearLog();
+        ResetErrorSlot();
+        EXPECT_EQ(c.call(), -1);
+        EXPECT_TRUE(ArgErrorReported(c.file, c.line, c.check));
+    }
+}
+
+// One call that must fail with -1 and leave exactly one log record beginning with `record`.
+struct FailureCase {
+    std::function<long()> call;
+    std::string record;
+};
+
+inline size_t LogCountPrefix(const std::string &prefix) {
+    size_t found = 0;
+    for (const auto &r : kova_test::LogRecords()) {
+        found += r.rfind(prefix, 0) == 0 ? 1 : 0;
+    }
+    return found;
+}
+
+// `suffix` is appended to every case's record (such as the inner error's "[0x0900 cred_db:169]").
+inline void ExpectFailuresLogged(const std::vector<FailureCase> &cases,
+                                 const std::string &suffix = "") {
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.record);
+        kova_test::ClearLog();
+        EXPECT_EQ(c.call(), -1);
+        EXPECT_EQ(LogCountPrefix(c.record + suffix), 1u) << kova_test::LogDump();
+    }
+}
+
+// A clean log and error slot for every test.
+class LogTest : public ::testing::Test {
   protected:
     void SetUp() override {
         kova_test::ClearLog();
         ResetErrorSlot();
     }
+};
+
+// ... and a fresh database (kovacredential_db).
+class StoreTest : public LogTest {
+  protected:
     const std::string &DbPath() const { return db_.path(); }
     std::vector<Row> Query(const std::string &sql) const { return RawQuery(db_.path(), sql); }
+
+    // Stores a credential through the interface and returns its id.
+    int AddCred(const std::string &host, const std::string &application = "app") {
+        CredPtr cred = MakeCred(host, application);
+        EXPECT_EQ(KOVACredAdd(cred.get()), 0) << kova_test::LogDump();
+        return cred->id;
+    }
+
+    // Points the database below a regular file, where neither a folder nor the file can be
+    // made; returns that database path.
+    std::string BlockDatabase() {
+        const std::string blocker = db_.dir().File("plainfile");
+        FILE *f = fopen(blocker.c_str(), "w");
+        EXPECT_NE(f, nullptr);
+        if (f != nullptr) {
+            fclose(f);
+        }
+        const std::string path = blocker + "/sub/credentials.sqlite";
+        setenv("kovacredential_db", path.c_str(), 1);
+        return path;
+    }
 
     kova_test::TempDatabase db_;
 };

@@ -1,7 +1,6 @@
 // The credential interface: every operation opens the database, does one thing and closes it.
 #include <unistd.h>
 
-#include <functional>
 #include <string>
 #include <vector>
 
@@ -13,22 +12,7 @@ namespace {
 
 using namespace store_test;
 
-class InterfaceTest : public StoreTest {
-  protected:
-    int Add(const std::string &host, const std::string &application = "app") {
-        CredPtr cred = MakeCred(host, application);
-        EXPECT_EQ(KOVACredAdd(cred.get()), 0) << kova_test::LogDump();
-        return cred->id;
-    }
-
-    static std::vector<int> Ids(KOVA_CRED *head) {
-        std::vector<int> ids;
-        for (KOVA_CRED *p = head; p != nullptr; p = KOVACredNext(p)) {
-            ids.push_back(p->id);
-        }
-        return ids;
-    }
-};
+using InterfaceTest = StoreTest;
 
 TEST_F(InterfaceTest, AddStoresTheRowAndTheNewId) {
     CredPtr cred = MakeCred("nas.example", "backup");
@@ -88,7 +72,7 @@ TEST_F(InterfaceTest, SetOfAMissingIdFailsWithReadBackError) {
 }
 
 TEST_F(InterfaceTest, GetByIdOfAMissingRowSucceedsWithoutFilling) {
-    Add("h");
+    AddCred("h");
     CredPtr cred = NewCred();
     EXPECT_EQ(KOVACredGetByID(5, cred.get()), 0);
     EXPECT_EQ(cred->id, -1);
@@ -97,7 +81,7 @@ TEST_F(InterfaceTest, GetByIdOfAMissingRowSucceedsWithoutFilling) {
 }
 
 TEST_F(InterfaceTest, LoadChecksClearsAndReads) {
-    int id = Add("loaded");
+    int id = AddCred("loaded");
     CredPtr cred = NewCred();
     EXPECT_EQ(KOVACredLoad(-2, cred.get()), -1);
     EXPECT_TRUE(ArgErrorReported("cred_load", 10, "-1 <= id"));
@@ -111,7 +95,7 @@ TEST_F(InterfaceTest, LoadChecksClearsAndReads) {
     EXPECT_EQ(KOVACredLoad(id, cred.get()), 0);
     EXPECT_EQ(cred->host, "loaded");
     // A filled record is not overwritten by another load.
-    int other = Add("other");
+    int other = AddCred("other");
     EXPECT_EQ(KOVACredLoad(other, cred.get()), 0);
     EXPECT_EQ(cred->host, "loaded");
 
@@ -135,7 +119,7 @@ TEST_F(InterfaceTest, LoadChecksClearsAndReads) {
 
 TEST_F(InterfaceTest, ListIsNewestFirstAndFiltered) {
     for (int i = 1; i <= 5; ++i) {
-        Add("h" + std::to_string(i), i % 2 ? "odd" : "even");
+        AddCred("h" + std::to_string(i), i % 2 ? "odd" : "even");
     }
     KOVA_CRED *list = nullptr;
     EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 5);
@@ -175,15 +159,16 @@ TEST_F(InterfaceTest, ListIsNewestFirstAndFiltered) {
     EXPECT_TRUE(ArgErrorReported("cred_list", 14, "__null != pCredList"));
 }
 
-TEST_F(InterfaceTest, ListOfAnEmptyTableIsZero) {
+TEST_F(InterfaceTest, EmptyTableListsNothingAndFindsNothing) {
     KOVA_CRED *list = nullptr;
     EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 0);
     EXPECT_EQ(list, nullptr);
+    EXPECT_EQ(KOVACredIDGetByApplication("x"), -1);
 }
 
 TEST_F(InterfaceTest, LookUpByApplicationFindsTheNewest) {
     for (int i = 1; i <= 9; ++i) {
-        Add("h" + std::to_string(i), (i == 4 || i == 9) ? "backup" : "app" + std::to_string(i));
+        AddCred("h" + std::to_string(i), (i == 4 || i == 9) ? "backup" : "app" + std::to_string(i));
     }
     EXPECT_EQ(KOVACredIDGetByApplication("backup"), 9);
     KOVACredRemoveByID(9);
@@ -202,13 +187,9 @@ TEST_F(InterfaceTest, LookUpByApplicationFindsTheNewest) {
     EXPECT_EQ(KOVACredKeepByApplication(cred.get(), other), 0);
 }
 
-TEST_F(InterfaceTest, LookUpInAnEmptyTable) {
-    EXPECT_EQ(KOVACredIDGetByApplication("x"), -1);
-}
-
 TEST_F(InterfaceTest, RemoveDeletesCredentialAndSession) {
-    int keep = Add("keep");
-    int gone = Add("gone");
+    int keep = AddCred("keep");
+    int gone = AddCred("gone");
     SessPtr sess = MakeSess(gone, "sid", "tok");
     ASSERT_EQ(KOVACredSessSave(sess.get()), 0) << kova_test::LogDump();
     EXPECT_EQ(KOVACredRemoveByID(gone), 0) << kova_test::LogDump();
@@ -222,63 +203,68 @@ TEST_F(InterfaceTest, RemoveDeletesCredentialAndSession) {
 }
 
 TEST_F(InterfaceTest, ArgumentErrorsOfTheInterface) {
-    struct Case {
-        int (*call)();
-        std::string file;
-        int line;
-        std::string check;
-    };
-    const Case cases[] = {
+    ExpectArgErrors({
         {[] { return KOVACredGetByID(1, nullptr); }, "cred_get", 10, "__null != pCred"},
         {[] { return KOVACredSetByID(1, nullptr); }, "cred_set", 10, "__null != pCred"},
         {[] { return KOVACredAdd(nullptr); }, "cred_add", 11, "__null != pCred"},
         {[] { return KOVACredSave(nullptr); }, "cred_save", 11, "__null != pCred"},
-    };
-    for (const auto &c : cases) {
-        SCOPED_TRACE(c.file);
-        kova_test::ClearLog();
-        EXPECT_EQ(c.call(), -1);
-        EXPECT_TRUE(ArgErrorReported(c.file, c.line, c.check));
-    }
+    });
     // None of them touched the database.
     EXPECT_NE(access(DbPath().c_str(), F_OK), 0);
 }
 
 TEST_F(InterfaceTest, OpenFailuresNameTheInnerError) {
-    const std::string blocked = db_.dir().File("file");
-    FILE *f = fopen(blocked.c_str(), "w");
-    ASSERT_NE(f, nullptr);
-    fclose(f);
-    setenv("kovacredential_db", (blocked + "/db.sqlite").c_str(), 1);
+    BlockDatabase();
     CredPtr cred = MakeCred("h");
-    struct Case {
-        std::function<int()> call;
-        std::string record;
-    };
-    const std::vector<Case> cases = {
-        {[&] { return KOVACredGetByID(1, cred.get()); }, "cred_get:15 Init sqlite failed. "},
-        {[&] { return KOVACredSetByID(1, cred.get()); }, "cred_set:15 Init sqlite failed. "},
-        {[&] { return KOVACredAdd(cred.get()); }, "cred_add:16 Init sqlite failed. "},
-        {[&] {
-             KOVA_CRED *list = nullptr;
-             return KOVACredListGet(&list, nullptr, nullptr);
-         },
-         "cred_list:19 Init sqlite failed. "},
-        {[&] { return KOVACredRemoveByID(1); }, "cred_remove:14 Init sqlite failed. "},
-        {[&] { return KOVACredLoad(3, cred.get()); }, "cred_load:19 get task failed. [3] "},
-        {[&] {
-             cred->id = -1;
-             return KOVACredSave(cred.get());
-         },
-         "cred_save:16 Add task failed. "},
-    };
-    for (const auto &c : cases) {
-        SCOPED_TRACE(c.record);
-        kova_test::ClearLog();
-        EXPECT_EQ(c.call(), -1);
-        EXPECT_EQ(kova_test::LogCount(c.record + "[0x0900 cred_db:169]"), 1u)
-            << kova_test::LogDump();
-    }
+    ExpectFailuresLogged(
+        {
+            {[&] { return KOVACredGetByID(1, cred.get()); }, "cred_get:15 Init sqlite failed. "},
+            {[&] { return KOVACredSetByID(1, cred.get()); }, "cred_set:15 Init sqlite failed. "},
+            {[&] { return KOVACredAdd(cred.get()); }, "cred_add:16 Init sqlite failed. "},
+            {[&] {
+                 KOVA_CRED *list = nullptr;
+                 return KOVACredListGet(&list, nullptr, nullptr);
+             },
+             "cred_list:19 Init sqlite failed. "},
+            {[&] { return KOVACredRemoveByID(1); }, "cred_remove:14 Init sqlite failed. "},
+            {[&] { return KOVACredLoad(3, cred.get()); }, "cred_load:19 get task failed. [3] "},
+            {[&] {
+                 cred->id = -1;
+                 return KOVACredSave(cred.get());
+             },
+             "cred_save:16 Add task failed. "},
+        },
+        "[0x0900 cred_db:169]");
+    EXPECT_EQ(cred->id, -1);
+}
+
+TEST_F(InterfaceTest, StatementFailuresOfAnOpenDatabaseAreLogged) {
+    AddCred("h");
+    // A view under the credential table's name survives the schema statements (IF NOT EXISTS)
+    // but reads a table that is gone and takes no writes, so every step fails on a database
+    // that opened.
+    ASSERT_TRUE(Query("DROP TABLE credential_sessions; DROP TABLE credentials; "
+                      "CREATE VIEW credentials AS SELECT * FROM gone;")
+                    .empty());
+    CredPtr cred = MakeCred("h");
+    // The inner steps record no code of their own: the lines carry the empty slot.
+    ExpectFailuresLogged(
+        {
+            {[&] { return KOVACredGetByID(1, cred.get()); },
+             "cred_get:19 Get Cred record failed. id:[1]"},
+            {[&] { return KOVACredAdd(cred.get()); }, "cred_add:20 Add Cred record failed. "},
+            {[&] { return KOVACredRemoveByID(1); },
+             "cred_remove:18 Remove Cred record failed. id:[1]"},
+        },
+        "[0x0000 :0]");
+    // A failed read of the table looks like an empty one.
+    kova_test::ClearLog();
+    KOVA_CRED *list = nullptr;
+    EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 0);
+    EXPECT_EQ(list, nullptr);
+    EXPECT_EQ(LogCountPrefix("cred_db:297 Exec sql:[SELECT * FROM credentials;] error: "), 1u)
+        << kova_test::LogDump();
+    EXPECT_EQ(kova_test::LogRecords().size(), 1u);
 }
 
 }  // namespace

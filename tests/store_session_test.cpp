@@ -1,5 +1,4 @@
 // The session interface: one session per credential, kept under the credential's id.
-#include <functional>
 #include <string>
 #include <vector>
 
@@ -11,14 +10,7 @@ namespace {
 
 using namespace store_test;
 
-class SessionTest : public StoreTest {
-  protected:
-    int AddCred(const std::string &host) {
-        CredPtr cred = MakeCred(host);
-        EXPECT_EQ(KOVACredAdd(cred.get()), 0) << kova_test::LogDump();
-        return cred->id;
-    }
-};
+using SessionTest = StoreTest;
 
 TEST_F(SessionTest, SaveWithTheCredentialIdStoresAndReplaces) {
     int id = AddCred("h");
@@ -98,12 +90,17 @@ TEST_F(SessionTest, LoadClearsOrReads) {
     int id = AddCred("h");
     ASSERT_EQ(KOVACredSessSetByID(id, MakeSess(id, "sid", "tok").get()), 0);
     SessPtr sess = NewSess();
-    EXPECT_EQ(KOVACredSessLoad(-2, sess.get()), -1);
-    EXPECT_TRUE(ArgErrorReported("cred_sess_load", 10, "-1 <= id"));
-    kova_test::ClearLog();
-    EXPECT_EQ(KOVACredSessLoad(id, nullptr), -1);
-    EXPECT_TRUE(ArgErrorReported("cred_sess_load", 10, "NULL != pSess"));
+    ExpectArgErrors({
+        {[&] { return KOVACredSessLoad(-2, sess.get()); }, "cred_sess_load", 10, "-1 <= id"},
+        // The id is checked first.
+        {[] { return KOVACredSessLoad(-2, nullptr); }, "cred_sess_load", 10, "-1 <= id"},
+        {[&] { return KOVACredSessLoad(id, nullptr); }, "cred_sess_load", 10, "NULL != pSess"},
+    });
 
+    EXPECT_EQ(KOVACredSessLoad(id, sess.get()), 0);
+    EXPECT_EQ(sess->access_token, "sid");
+    // A filled record is not overwritten by another load.
+    ASSERT_EQ(KOVACredSessSetByID(id, MakeSess(id, "sid-2", "tok-2").get()), 0);
     EXPECT_EQ(KOVACredSessLoad(id, sess.get()), 0);
     EXPECT_EQ(sess->access_token, "sid");
     sess->next = KOVACredSessAlloc();
@@ -123,11 +120,8 @@ TEST_F(SessionTest, ListRemoveAndNext) {
     }
     KOVA_CRED_SESS *list = nullptr;
     EXPECT_EQ(KOVACredSessListGet(&list, nullptr, nullptr), 3);
-    std::vector<int> ids;
-    for (KOVA_CRED_SESS *p = list; p != nullptr; p = KOVACredSessNext(p)) {
-        ids.push_back(p->id);
-    }
-    EXPECT_EQ(ids, (std::vector<int>{c, b, a}));  // newest id first
+    EXPECT_EQ(Ids(list), (std::vector<int>{c, b, a}));  // newest id first
+    EXPECT_EQ(KOVACredSessNext(list->next->next), nullptr);
     KOVACredSessListFree(&list);
     EXPECT_EQ(list, nullptr);
 
@@ -160,66 +154,49 @@ TEST_F(SessionTest, RemovingTheCredentialRemovesItsSession) {
 }
 
 TEST_F(SessionTest, ArgumentAndOpenErrors) {
-    struct Case {
-        int (*call)();
-        std::string file;
-        int line;
-        std::string check;
-    };
-    const Case cases[] = {
+    ExpectArgErrors({
         {[] { return KOVACredSessGetByID(1, nullptr); }, "cred_sess_get", 10, "__null != pSess"},
         {[] { return KOVACredSessSetByID(1, nullptr); }, "cred_sess_set", 10, "__null != pSess"},
         {[] { return KOVACredSessAdd(nullptr); }, "cred_sess_add", 11, "__null != pSess"},
         {[] { return KOVACredSessSave(nullptr); }, "cred_sess_save", 11, "__null != pSess"},
-    };
-    for (const auto &c : cases) {
-        SCOPED_TRACE(c.file);
-        kova_test::ClearLog();
-        EXPECT_EQ(c.call(), -1);
-        EXPECT_TRUE(ArgErrorReported(c.file, c.line, c.check));
-    }
+    });
 
-    const std::string blocked = db_.dir().File("file");
-    FILE *f = fopen(blocked.c_str(), "w");
-    ASSERT_NE(f, nullptr);
-    fclose(f);
-    setenv("kovacredential_db", (blocked + "/db.sqlite").c_str(), 1);
+    BlockDatabase();
     SessPtr sess = MakeSess(1, "s", "t");
-    const std::vector<std::pair<std::function<int()>, std::string>> opens = {
-        {[&] { return KOVACredSessGetByID(1, sess.get()); }, "cred_sess_get:15 "},
-        {[&] { return KOVACredSessSetByID(1, sess.get()); }, "cred_sess_set:15 "},
-        {[&] { return KOVACredSessAdd(sess.get()); }, "cred_sess_add:16 "},
-        {[&] {
-             KOVA_CRED_SESS *list = nullptr;
-             return KOVACredSessListGet(&list, nullptr, nullptr);
-         },
-         "cred_sess_list:19 "},
-        {[&] { return KOVACredSessRemoveByID(1); }, "cred_sess_remove:14 "},
-    };
-    for (const auto &o : opens) {
-        SCOPED_TRACE(o.second);
-        kova_test::ClearLog();
-        EXPECT_EQ(o.first(), -1);
-        EXPECT_EQ(kova_test::LogCount(o.second + "Init sqlite failed. [0x0900 cred_db:169]"), 1u)
-            << kova_test::LogDump();
-    }
-    kova_test::ClearLog();
-    EXPECT_EQ(KOVACredSessLoad(2, sess.get()), -1);
-    EXPECT_EQ(kova_test::LogCount("cred_sess_load:19 get task failed. [2] [0x0900 cred_db:169]"),
-              1u)
-        << kova_test::LogDump();
+    ExpectFailuresLogged(
+        {
+            {[&] { return KOVACredSessGetByID(1, sess.get()); },
+             "cred_sess_get:15 Init sqlite failed. "},
+            {[&] { return KOVACredSessSetByID(1, sess.get()); },
+             "cred_sess_set:15 Init sqlite failed. "},
+            {[&] { return KOVACredSessAdd(sess.get()); }, "cred_sess_add:16 Init sqlite failed. "},
+            {[&] {
+                 KOVA_CRED_SESS *list = nullptr;
+                 return KOVACredSessListGet(&list, nullptr, nullptr);
+             },
+             "cred_sess_list:19 Init sqlite failed. "},
+            {[&] { return KOVACredSessRemoveByID(1); }, "cred_sess_remove:14 Init sqlite failed. "},
+            {[&] { return KOVACredSessLoad(2, sess.get()); },
+             "cred_sess_load:19 get task failed. [2] "},
+        },
+        "[0x0900 cred_db:169]");
 }
 
-TEST_F(SessionTest, ReadFailureOfAnOpenDatabaseIsLogged) {
+TEST_F(SessionTest, StatementFailuresOfAnOpenDatabaseAreLogged) {
     AddCred("h");
     // A view under the session table's name survives the schema statements (IF NOT EXISTS)
-    // and has no id column, so the read fails on a database that opened well.
+    // but has no id column and takes no writes, so the steps fail on a database that opened.
     ASSERT_TRUE(Query("DROP TABLE credential_sessions;").empty());
     ASSERT_TRUE(Query("CREATE VIEW credential_sessions AS SELECT 1 AS x, 2 AS y;").empty());
     SessPtr sess = NewSess();
-    EXPECT_EQ(KOVACredSessGetByID(1, sess.get()), -1);
-    EXPECT_EQ(kova_test::LogCount("cred_sess_get:20 Get Cred_sess record failed. id:[1][0x"), 1u)
-        << kova_test::LogDump();
+    ExpectFailuresLogged(
+        {
+            {[&] { return KOVACredSessGetByID(1, sess.get()); },
+             "cred_sess_get:20 Get Cred_sess record failed. id:[1]"},
+            {[&] { return KOVACredSessRemoveByID(1); },
+             "cred_sess_remove:18 Remove Cred record failed. id:[1]"},
+        },
+        "[0x0000 :0]");
 }
 
 }  // namespace

@@ -5,11 +5,12 @@
 // again. The database is "/usr/kova/etc/private/credentials.sqlite" unless the environment
 // variable kovacredential_db names another file; it is read at every open.
 //
-// Status results are 0 on success and -1 on failure. A failure writes one line to the system
-// log and, for a bad argument or a failed open, records a code in the error slot
-// (VLIBCErrGet, kovaplatform.h): 3328 invalid argument, 2304 database cannot be opened,
-// 2816 written row not found on read-back, 512 out of memory. A failure caused by an inner
-// step records nothing new; its log line carries the inner code, file and line.
+// Status results are 0 on success and -1 on failure. A failure writes a line to the system
+// log; the step that detected it records a code in the error slot (VLIBCErrGet,
+// kovaplatform.h): 3328 invalid argument, 2304 database cannot be opened, 2816 written row
+// not found on read-back, 512 out of memory. A statement SQLite rejects is logged with its
+// message and records no code. A failure caused by an inner step records nothing new; its log
+// line carries the inner code, file and line.
 #ifndef KOVACREDENTIAL_KOVACRED_H
 #define KOVACREDENTIAL_KOVACRED_H
 

@@ -2,8 +2,8 @@
 // the database with KOVACredDBInit, calls one of these and closes it with sqlite3_close; a
 // program may do the same to run several operations on one connection.
 //
-// Every statement is retried while SQLite reports "database is locked", at most 101 times
-// with a random pause below one second between tries.
+// Every statement is retried while SQLite reports "database is locked": it is executed at
+// most 101 times, with a random pause below one second before each retry.
 #ifndef KOVACREDENTIAL_KOVACRED_DB_H
 #define KOVACREDENTIAL_KOVACRED_DB_H
 
