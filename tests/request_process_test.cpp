@@ -125,7 +125,7 @@ TEST_F(ProcessTest, OkIsSuccessAndASecondProcessReusesTheHandle) {
     EXPECT_EQ(server_.CountPath("/ok"), 2u);
 }
 
-TEST_F(ProcessTest, MapsStatusToError) {
+TEST_F(ProcessTest, MapsStatusToErrorAndFollowsRedirectsByDefault) {
     struct Case {
         int status;
         KOVA::CRED_REQ_ERR error;
@@ -154,9 +154,7 @@ TEST_F(ProcessTest, MapsStatusToError) {
             << kova_test::LogDump();
         EXPECT_EQ(server_.RequestCount(), 1u);
     }
-}
-
-TEST_F(ProcessTest, RedirectIsFollowedByDefault) {
+    // Redirects are followed unless turned off.
     KOVA::CredRequest req;
     ASSERT_TRUE(req.SetURL(Url("/status/302")));
     EXPECT_TRUE(req.Process(true, 0));

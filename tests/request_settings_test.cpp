@@ -21,19 +21,6 @@ class SettingsTest : public ::testing::Test {
     const Json::Value null_;
 };
 
-TEST_F(SettingsTest, FreshRequest) {
-    CredRequest req;
-    EXPECT_EQ(req.GetURL(), "");
-    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_NONE);
-    EXPECT_EQ(req.GetDefaultTimeout(), 120);
-    EXPECT_EQ(req.GetResponseTimeout(), 120);
-    EXPECT_EQ(req.GetRequestFormat(), "");
-    EXPECT_EQ(req.GetCurlHandler(), nullptr);
-    EXPECT_EQ(req.GetResponse(), "");
-    EXPECT_TRUE(req.GetResponseHeader().isObject());
-    EXPECT_TRUE(req.GetResponseHeader().empty());
-}
-
 TEST_F(SettingsTest, HeadersMergeAndReplace) {
     ASSERT_TRUE(p_.SetData("Header", "X-A", "1"));
     Json::Value more;
@@ -95,8 +82,13 @@ TEST_F(SettingsTest, RawDataRejectsEmptyValuesOnly) {
     EXPECT_TRUE(p_.HasRawData("K"));
 }
 
-TEST_F(SettingsTest, TimeoutsAndEncryptionModes) {
+TEST_F(SettingsTest, DefaultsTimeoutsAndEncryptionModes) {
     CredRequest req;
+    EXPECT_EQ(req.GetURL(), "");
+    EXPECT_EQ(req.GetRequestFormat(), "");
+    EXPECT_EQ(req.GetResponse(), "");
+    EXPECT_TRUE(req.GetResponseHeader().isObject());
+    EXPECT_TRUE(req.GetResponseHeader().empty());
     EXPECT_FALSE(req.SetDefaultTimeout(0));
     EXPECT_FALSE(req.SetDefaultTimeout(-3));
     EXPECT_EQ(req.GetDefaultTimeout(), 120);

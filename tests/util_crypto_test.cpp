@@ -118,47 +118,46 @@ class CryptoTest : public ::testing::Test {
 EVP_PKEY *CryptoTest::key2048_ = nullptr;
 EVP_PKEY *CryptoTest::key1024_ = nullptr;
 
-TEST_F(CryptoTest, RsaDecryptsWithThePrivateKey) {
-    std::string cipher;
-    ASSERT_TRUE(CredRequestUtil::GetEncString(ModulusHex(key2048_), "account=a&passwd=p", cipher));
-    EXPECT_EQ(cipher.size(), 344u);  // 256 bytes of RSA output in Base64
-    EXPECT_EQ(RsaDecrypt(key2048_, cipher), "account=a&passwd=p");
-    std::string again;
-    ASSERT_TRUE(CredRequestUtil::GetEncString(ModulusHex(key2048_), "account=a&passwd=p", again));
-    EXPECT_NE(cipher, again);  // PKCS#1 v1.5 padding is random
-}
-
+// The RSA text decrypts with the private key, and PKCS#1 v1.5 padding makes each one differ.
 // Empty inputs are refused silently. Up to 512 bytes pass the length test and are then limited
 // by the key (a 1024-bit key takes at most 128 - 11 bytes); longer texts are meant for AES.
-TEST_F(CryptoTest, RsaInputLimits) {
+TEST_F(CryptoTest, RsaEncryptionAndItsLimits) {
     struct Case {
-        std::string key;
+        EVP_PKEY *key;  // nullptr: the key text below
+        const char *keyText;
         size_t length;
         bool ok;
         const char *log;
     };
-    const std::string k2048 = ModulusHex(key2048_);
-    const std::string k1024 = ModulusHex(key1024_);
     const Case cases[] = {
-        {"", 1, false, nullptr},
-        {k2048, 0, false, nullptr},
-        {"not-hex", 1, false, " RSA encrypt fail"},
-        {k2048, 512, false, " RSA encrypt fail"},
-        {k2048, 513, false, " RSA encrypt fail, text exceed 512 bytes assume using AES"},
-        {k1024, 117, true, nullptr},
-        {k1024, 120, false, " RSA encrypt fail"},
+        {nullptr, "", 1, false, nullptr},
+        {key2048_, nullptr, 0, false, nullptr},
+        {nullptr, "not-hex", 1, false, " RSA encrypt fail"},
+        {key2048_, nullptr, 18, true, nullptr},
+        {key2048_, nullptr, 512, false, " RSA encrypt fail"},
+        {key2048_, nullptr, 513, false,
+         " RSA encrypt fail, text exceed 512 bytes assume using AES"},
+        {key1024_, nullptr, 117, true, nullptr},
+        {key1024_, nullptr, 120, false, " RSA encrypt fail"},
     };
     for (const Case &c : cases) {
-        SCOPED_TRACE(c.key.substr(0, 8) + " " + std::to_string(c.length));
+        const std::string key = c.key != nullptr ? ModulusHex(c.key) : c.keyText;
+        SCOPED_TRACE(key.substr(0, 8) + " " + std::to_string(c.length));
         kova_test::ClearLog();
         const std::string text(c.length, 'a');
         std::string cipher = "untouched";
-        EXPECT_EQ(CredRequestUtil::GetEncString(c.key, text, cipher), c.ok);
+        std::string again;
+        EXPECT_EQ(CredRequestUtil::GetEncString(key, text, cipher), c.ok);
         if (c.ok) {
-            EXPECT_EQ(RsaDecrypt(key1024_, cipher), text);
+            // The key size in bytes, Base64-encoded.
+            EXPECT_EQ(cipher.size(), static_cast<size_t>(EVP_PKEY_get_size(c.key) + 2) / 3 * 4);
+            EXPECT_EQ(RsaDecrypt(c.key, cipher), text);
+            ASSERT_TRUE(CredRequestUtil::GetEncString(key, text, again));
+            EXPECT_NE(cipher, again);
         }
         if (c.log == nullptr) {
             EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+            EXPECT_EQ(cipher == "untouched", !c.ok);
             continue;
         }
         EXPECT_EQ(kova_test::LogCount(c.log), 1u) << kova_test::LogDump();
