@@ -26,17 +26,17 @@ File StreamWith(const std::string &text) {
     return f;
 }
 
-std::set<std::string> ParamNames(const kovasim::RecordedRequest &r) {
-    std::set<std::string> names;
-    for (const auto &p : r.params) {
-        names.insert(p.first);
-    }
-    return names;
-}
-
 class WebApiFactoryTest : public WebApiTest {
   protected:
     std::string EntryUrl() const { return Server().BaseUrl() + "/webapi/entry.cgi"; }
+
+    // A request for the entry CGI that asks who its session belongs to.
+    void WhoAmI(CredRequest &request) const {
+        request.SetURL(EntryUrl());
+        request.AddPostParam("api", "KOVA.Demo.Session");
+        request.AddPostParam("version", "1");
+        request.AddPostParam("method", "whoami");
+    }
 };
 
 TEST_F(WebApiFactoryTest, RecordFormSendsSessionAsPostCookieAndTokenInQuery) {
@@ -156,21 +156,15 @@ TEST_F(WebApiFactoryTest, FillFormErrorCodes) {
     EXPECT_TRUE(CredRequest::CreateWebAPIRequest(&reused, &cred, &sess, "KOVA.Demo.Echo", 1, "echo",
                                                  Json::Value()));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, reused.GetError());
-}
 
-TEST_F(WebApiFactoryTest, UnreachableServerLeavesQueryFailure) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    {
-        kovasim::LoopbackServer closed;
-        ASSERT_TRUE(closed.Start());
-        cred.port = closed.Port();
-    }
-    KOVA_CRED_SESS sess;
-    CredRequest request;
-    EXPECT_FALSE(CredRequest::CreateWebAPIRequest(&request, &cred, &sess, "KOVA.Demo.Echo", 1,
+    // A server that cannot be reached leaves the query failure.
+    kovasim::RefusedPort closed;
+    cred.port = closed.Port();
+    cred.id = 50;  // not described yet
+    CredRequest unreachable;
+    EXPECT_FALSE(CredRequest::CreateWebAPIRequest(&unreachable, &cred, &sess, "KOVA.Demo.Echo", 1,
                                                   "echo", Json::Value()));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, request.GetError());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, unreachable.GetError());
 }
 
 TEST_F(WebApiFactoryTest, CredentialIdFormLogsInOnceAndReusesTheSession) {
@@ -195,18 +189,14 @@ TEST_F(WebApiFactoryTest, CredentialIdFormLogsInOnceAndReusesTheSession) {
     EXPECT_EQ(nullptr,
               CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Echo", 0, "echo", Json::Value()));
     EXPECT_TRUE(LogHas("Bad parameters"));
-}
 
-TEST_F(WebApiFactoryTest, CredentialIdFormFailsForUnknownIdOrFailedLogin) {
-    EXPECT_EQ(nullptr,
-              CredRequest::CreateWebAPIRequest(999L, "KOVA.Demo.Echo", 1, "echo", Json::Value()));
-    EXPECT_TRUE(LogHas("GetAccessToken fail")) << LogDump();
-
-    ClearLog();
-    int id = StoreCred("admin", "wrong");
-    EXPECT_EQ(nullptr,
-              CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Echo", 1, "echo", Json::Value()));
-    EXPECT_TRUE(LogHas("GetAccessToken fail")) << LogDump();
+    // An unknown id and a failed login both fail the access token.
+    for (long bad : {999L, static_cast<long>(StoreCred("admin", "wrong"))}) {
+        ClearLog();
+        EXPECT_EQ(nullptr, CredRequest::CreateWebAPIRequest(bad, "KOVA.Demo.Echo", 1, "echo",
+                                                            Json::Value()));
+        EXPECT_TRUE(LogHas("GetAccessToken fail")) << bad << LogDump();
+    }
 }
 
 TEST_F(WebApiFactoryTest, RelayRequestReadsItsBodyFromTheStreams) {
@@ -251,10 +241,7 @@ TEST_F(WebApiFactoryTest, ProcessWithLoginAttachesAFreshSession) {
 
     int id = StoreCred();
     CredRequest request;
-    request.SetURL(EntryUrl());
-    request.AddPostParam("api", "KOVA.Demo.Session");
-    request.AddPostParam("version", "1");
-    request.AddPostParam("method", "whoami");
+    WhoAmI(request);
     ASSERT_TRUE(request.ProcessWithLogin(id, true, 0)) << LogDump();
     Json::Value answer = ParseBody(request.GetResponse());
     ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
@@ -265,19 +252,22 @@ TEST_F(WebApiFactoryTest, ProcessWithLoginAttachesAFreshSession) {
 }
 
 TEST_F(WebApiFactoryTest, RequestLoginAndLogout) {
-    CredRequest empty;
-    EXPECT_FALSE(empty.Login("", "pw", ""));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, empty.GetError());
-
-    CredRequest badUrl;
-    EXPECT_FALSE(badUrl.Login("admin", "secret", "https://[fe80::1"));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, badUrl.GetError());
+    const struct {
+        const char *account;
+        const char *url;  // nullptr: the request's own URL
+        bool ownUrl;
+    } refused[] = {{"", "", false}, {"admin", "https://[fe80::1", false}, {"", nullptr, true}};
+    for (const auto &c : refused) {
+        SCOPED_TRACE(std::string(c.account) + "@" + (c.url ? c.url : "own URL"));
+        CredRequest request;
+        if (c.ownUrl) {
+            request.SetURL(EntryUrl());
+        }
+        EXPECT_FALSE(c.url ? request.Login(c.account, "secret", c.url)
+                           : request.Login(c.account, "secret"));
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, request.GetError());
+    }
     EXPECT_TRUE(LogHas("parseURL Failed: https://[fe80::1")) << LogDump();
-
-    CredRequest noAccount;
-    noAccount.SetURL(EntryUrl());
-    EXPECT_FALSE(noAccount.Login("", "secret"));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, noAccount.GetError());
 
     CredRequest wrong;
     wrong.SetURL(EntryUrl());
@@ -286,10 +276,7 @@ TEST_F(WebApiFactoryTest, RequestLoginAndLogout) {
     EXPECT_FALSE(wrong.Logout());
 
     CredRequest request;
-    request.SetURL(EntryUrl());
-    request.AddPostParam("api", "KOVA.Demo.Session");
-    request.AddPostParam("version", "1");
-    request.AddPostParam("method", "whoami");
+    WhoAmI(request);
     ASSERT_TRUE(request.Login("admin", "secret")) << LogDump();
     ASSERT_TRUE(request.Process(true, 0));
     Json::Value answer = ParseBody(request.GetResponse());
