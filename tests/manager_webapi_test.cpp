@@ -1,7 +1,6 @@
 // The request manager with WebAPI requests against the in-process WebAPI simulator: requests
 // by credential id, by records and by bare server address, discovery under pseudo-ids, and
 // the factories' failures.
-#include <chrono>
 #include <fstream>
 #include <memory>
 #include <string>
@@ -168,29 +167,6 @@ TEST_F(ManagerWebApiTest, FailuresAreLoggedAndAddNothing) {
     EXPECT_TRUE(kova_test::LogHas("cred_request_mgr:77 CreateRelayRequest fail"));
     EXPECT_EQ(0, mgr.Size());
     EXPECT_EQ(0u, Sim().Hits("KOVA.Demo.Echo") - echoes_);
-}
-
-TEST_F(ManagerWebApiTest, DelayedWebApiCallsOverlap) {
-    constexpr int kCount = 10;
-    CredRequestMgr mgr;
-    Json::Value params;
-    params["ms"] = "300";
-    for (int i = 0; i < kCount; ++i) {
-        ASSERT_EQ(i, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), "", "KOVA.Demo.Delay",
-                                        1, "wait", params))
-            << kova_test::LogDump();
-    }
-    auto start = std::chrono::steady_clock::now();
-    ASSERT_TRUE(mgr.Run()) << kova_test::LogDump();
-    double seconds =
-        std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-    EXPECT_LT(seconds, 2.0);
-    EXPECT_GT(Sim().MaxConcurrent(), 1);
-    for (int i = 0; i < kCount; ++i) {
-        Json::Value answer = ParseBody(mgr.GetResponse(i));
-        EXPECT_TRUE(answer["success"].asBool()) << mgr.GetResponse(i);
-        EXPECT_EQ(300, answer["data"]["delayed_ms"].asInt());
-    }
 }
 
 TEST_F(ManagerWebApiTest, BatchCommandRunsCredentialAndUrlCalls) {

@@ -71,8 +71,7 @@ TEST_F(WebApiAuthTest, LoginSendsEveryParameterInsideTheRsaEnvelopeAndStoresTheS
 }
 
 TEST_F(WebApiAuthTest, EmptyApplicationAndOneTimeCodeAreNotSent) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     KOVA_CRED_SESS sess;
     ASSERT_TRUE(CredRequestUtil::Login(&cred, &sess)) << LogDump();
     kovasim::WebApiSim::LoginRecord login = Sim().LastLogin();
@@ -149,8 +148,7 @@ class WebApiAesTest : public WebApiAuthTest {
 
 TEST_F(WebApiAesTest, ParametersTravelInTheAesEnvelope) {
     KOVACloudServiceHxtokenSetProvider(&SimTokenProvider);
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     KOVA_CRED_SESS sess;
     sess.access_token = "S1";
     Json::Value params;
@@ -185,8 +183,7 @@ TEST_F(WebApiAesTest, ParametersTravelInTheAesEnvelope) {
 
 TEST_F(WebApiAesTest, LoginThroughTheAesEnvelope) {
     KOVACloudServiceHxtokenSetProvider(&SimTokenProvider);
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     CredRequest request;
     ASSERT_TRUE(CredRequestUtil::SetWebAPIURL(&cred, "KOVA.API.Auth", 3, "login", &request));
     request.AddPostParam("account", "admin");
@@ -201,8 +198,7 @@ TEST_F(WebApiAesTest, LoginThroughTheAesEnvelope) {
 }
 
 TEST_F(WebApiAuthTest, StaleCiphertokenIsRefused) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     Sim().SetTokenWindow(-1);  // every server time is already too old
     Json::Value response;
     EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "", nullptr, &response));
@@ -264,8 +260,7 @@ TEST_F(WebApiAuthTest, LogoutRefusesMissingInputs) {
     EXPECT_TRUE(LogHas("Cannot find id[" + std::to_string(id) + "] in sess")) << LogDump();
     EXPECT_FALSE(CredRequestUtil::Logout(777L));
     EXPECT_TRUE(LogHas("Cannot find id[777] in cred"));
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     EXPECT_FALSE(CredRequestUtil::Logout(&cred, std::string()));
     EXPECT_FALSE(CredRequestUtil::Logout(&cred, static_cast<KOVA_CRED_SESS *>(nullptr)));
     EXPECT_EQ(2u, LogCount("Bad parameters"));
@@ -279,8 +274,7 @@ class WebApiBadAnswerTest : public WebApiAuthTest,
 TEST_P(WebApiBadAnswerTest, IsAnInvalidResponse) {
     const std::string body = GetParam();
     auto bad = FixedAnswer("/webapi/auth.cgi", body, true);
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     cred.port = bad->Port();
     cred.id = 99;  // not stored: nothing to write back
     KOVA_CRED_SESS sess;
@@ -309,8 +303,7 @@ TEST_F(WebApiAuthTest, LoginAnswerIsReadLenientlyButLogoutAnswerMustBeWhole) {
         "/* session */ {\"success\":true,\"data\":{\"sid\":\"S-1\",\"kovatoken\":\"T-1\"}}"
         "\n<!-- served in 1 ms -->";
     auto lenient = FixedAnswer("/webapi/auth.cgi", body, true);
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     cred.port = lenient->Port();
     KOVA_CRED_SESS sess;
     Json::Value response;
@@ -325,8 +318,7 @@ TEST_F(WebApiAuthTest, LoginAnswerIsReadLenientlyButLogoutAnswerMustBeWhole) {
 }
 
 TEST_F(WebApiAuthTest, LoginTransferFailureIsReported) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     CredRequestUtil::GetWebAPIDesc(&cred);  // cached, so only the login itself fails
     kovasim::LoopbackServer failing;
     failing.Route("*", "/webapi/.*",
@@ -368,8 +360,7 @@ TEST_F(WebApiRedirectTest, OnlyPlainHttpCredentialsAreProbedAndFollowTheRedirect
                  {"https", false}, {"HTTPS", false}, {"Https", false}};
     for (const auto &c : cases) {
         SCOPED_TRACE(c.protocol);
-        KOVA_CRED cred;
-        FillCred(cred);
+        KOVA_CRED cred = Cred();
         cred.protocol = c.protocol;
         cred.port = redirect_->Port();
         redirect_->ClearRecords();
@@ -386,8 +377,7 @@ TEST_F(WebApiRedirectTest, OnlyPlainHttpCredentialsAreProbedAndFollowTheRedirect
 }
 
 TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTarget) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     cred.port = redirect_->Port();
     KOVA_CRED_SESS sess;
     ASSERT_TRUE(CredRequestUtil::Login(&cred, &sess)) << LogDump();
@@ -398,8 +388,7 @@ TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTarget) {
 }
 
 TEST_F(WebApiRedirectTest, RefusedProbeLetsTheRequestReportItsOwnError) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     kovasim::RefusedPort closed;
     cred.port = closed.Port();
     int port = cred.port;
@@ -432,8 +421,7 @@ TEST_F(WebApiRedirectTest, LocationIsTakenAsTheServerSentIt) {
                       }
                   });
         ASSERT_TRUE(odd.Start());
-        KOVA_CRED cred;
-        FillCred(cred);
+        KOVA_CRED cred = Cred();
         cred.port = odd.Port();
         EXPECT_EQ(c.log == nullptr, CredRequestUtil::CheckRedirect(&cred));
         if (c.log != nullptr) {
@@ -449,8 +437,7 @@ TEST_F(WebApiRedirectTest, LocationIsTakenAsTheServerSentIt) {
 }
 
 TEST_F(WebApiAuthTest, SetWebApiUrlPlacesStandardParametersByFormat) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     CredRequest json;
     ASSERT_TRUE(CredRequestUtil::SetWebAPIURL(&cred, "KOVA.Demo.Json", 1, "get", &json));
     EXPECT_EQ("JSON", json.GetRequestFormat());

@@ -42,7 +42,7 @@ TEST_F(WebApiDescTest, DiscoversOncePerCredentialAndAnswersFromTheCache) {
     EXPECT_EQ(before + 1, Sim().QueryHits());
 
     // What reached the wire: one POST with the three standard parameters only.
-    ASSERT_EQ(1u, PathCount("/webapi/query.cgi"));
+    ASSERT_EQ(1u, Server().CountPath("/webapi/query.cgi"));
     kovasim::RecordedRequest query = Server().Requests().front();
     EXPECT_EQ("POST", query.method);
     EXPECT_EQ("KOVA.API.Info", query.Param("api"));
@@ -56,8 +56,7 @@ TEST_F(WebApiDescTest, DiscoversOncePerCredentialAndAnswersFromTheCache) {
 }
 
 TEST_F(WebApiDescTest, UnknownApiSetsErrorSixAndIsQueriedAgain) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     cred.id = 41;
     size_t before = Sim().QueryHits();
 
@@ -121,8 +120,7 @@ TEST_F(WebApiDescTest, UnusableAnswersAreNotCached) {
 }
 
 TEST_F(WebApiDescTest, FailedTransferSetsErrorFive) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     kovasim::RefusedPort closed;
     cred.port = closed.Port();
     cred.id = 11;
@@ -157,8 +155,7 @@ TEST_F(WebApiDescTest, TwoCredentialsOfOneServerAreCachedSeparately) {
     EXPECT_EQ(before + 3, Sim().QueryHits());
 
     // An unstored credential is cached under -1.
-    KOVA_CRED unstored;
-    FillCred(unstored);
+    KOVA_CRED unstored = Cred();
     ASSERT_EQ(-1, unstored.id);
     EXPECT_EQ("encryption.cgi", CredRequestUtil::GetWebAPIPath(&unstored, "KOVA.API.Encryption"));
     EXPECT_TRUE(CredRequestUtil::m_jsData["webapiDesc"].isMember("-1"));

@@ -40,53 +40,46 @@ class WebApiFactoryTest : public WebApiTest {
 };
 
 TEST_F(WebApiFactoryTest, RecordFormSendsSessionAsPostCookieAndTokenInQuery) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    KOVA_CRED_SESS sess;
-    sess.access_token = "S1";
-    sess.csrf_token = "T1";
-    Json::Value params;
-    params["x"] = "1";
-    std::unique_ptr<CredRequest> request(
-        CredRequest::CreateWebAPIRequest(&cred, &sess, "KOVA.Demo.Echo", 2, "echo", params));
-    ASSERT_TRUE(request) << LogDump();
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError());
-    ASSERT_TRUE(request->Process(true, 0));
+    // An empty session still sends "_sid", but no cookie and no token.
+    const struct {
+        const char *sid, *token, *query, *cookie;  // cookie nullptr: no Cookie header
+        std::set<std::string> names;
+    } cases[] = {{"S1",
+                  "T1",
+                  "&KovaToken=T1",
+                  "id=S1",
+                  {"KovaToken", "_sid", "api", "method", "version", "x"}},
+                 {"", "", "", nullptr, {"_sid", "api", "method", "version", "x"}}};
+    KOVA_CRED cred = Cred();
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.sid);
+        KOVA_CRED_SESS sess;
+        sess.access_token = c.sid;
+        sess.csrf_token = c.token;
+        Json::Value params;
+        params["x"] = "1";
+        std::unique_ptr<CredRequest> request(
+            CredRequest::CreateWebAPIRequest(&cred, &sess, "KOVA.Demo.Echo", 2, "echo", params));
+        ASSERT_TRUE(request) << LogDump();
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError());
+        ASSERT_TRUE(request->Process(true, 0));
 
-    kovasim::RecordedRequest wire = Server().Last();
-    EXPECT_EQ("/webapi/entry.cgi", wire.path);
-    EXPECT_EQ("POST", wire.method);
-    // The token is appended behind the (here empty) encoded query parameters.
-    EXPECT_EQ("&KovaToken=T1", wire.query);
-    EXPECT_EQ("T1", wire.Param("KovaToken"));
-    EXPECT_EQ("id=S1", wire.Header("Cookie"));
-    EXPECT_EQ((std::set<std::string>{"KovaToken", "_sid", "api", "method", "version", "x"}),
-              ParamNames(wire));
-    EXPECT_EQ("S1", wire.Param("_sid"));
-    EXPECT_NE(std::string::npos, wire.body.find("_sid=S1"));
-    Json::Value answer = ParseBody(request->GetResponse());
-    EXPECT_EQ("1", answer["data"]["params"]["x"].asString());
-}
-
-TEST_F(WebApiFactoryTest, EmptySessionStillSendsSidButNoCookieOrToken) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    KOVA_CRED_SESS sess;
-    CredRequest request;
-    ASSERT_TRUE(CredRequest::CreateWebAPIRequest(&request, &cred, &sess, "KOVA.Demo.Echo", 1,
-                                                 "echo", Json::Value()));
-    ASSERT_TRUE(request.Process(true, 0));
-    kovasim::RecordedRequest wire = Server().Last();
-    EXPECT_TRUE(wire.HasParam("_sid"));
-    EXPECT_EQ("", wire.Param("_sid"));
-    EXPECT_FALSE(wire.HasHeader("Cookie"));
-    EXPECT_EQ("", wire.query);
-    EXPECT_EQ((std::set<std::string>{"_sid", "api", "method", "version"}), ParamNames(wire));
+        kovasim::RecordedRequest wire = Server().Last();
+        EXPECT_EQ("/webapi/entry.cgi", wire.path);
+        EXPECT_EQ("POST", wire.method);
+        // The token is appended behind the (here empty) encoded query parameters.
+        EXPECT_EQ(c.query, wire.query);
+        EXPECT_EQ(c.cookie != nullptr, wire.HasHeader("Cookie"));
+        EXPECT_EQ(c.cookie ? c.cookie : "", wire.Header("Cookie"));
+        EXPECT_EQ(c.names, ParamNames(wire));
+        EXPECT_EQ(c.sid, wire.Param("_sid"));
+        EXPECT_NE(std::string::npos, wire.body.find(std::string("_sid=") + c.sid));
+        EXPECT_EQ("1", ParseBody(request->GetResponse())["data"]["params"]["x"].asString());
+    }
 }
 
 TEST_F(WebApiFactoryTest, JsonFormatApiGetsJsonEncodedValues) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     KOVA_CRED_SESS sess;
     Json::Value params;
     params["count"] = 5;
@@ -104,8 +97,7 @@ TEST_F(WebApiFactoryTest, JsonFormatApiGetsJsonEncodedValues) {
 }
 
 TEST_F(WebApiFactoryTest, FillFormErrorCodes) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     KOVA_CRED_SESS sess;
     EXPECT_FALSE(CredRequest::CreateWebAPIRequest(nullptr, &cred, &sess, "KOVA.Demo.Echo", 1,
                                                   "echo", Json::Value()));
@@ -299,9 +291,9 @@ TEST_F(WebApiFactoryTest, ApiValidityUsesTheRequestsUrl) {
     EXPECT_FALSE(request.isAPIValid("KOVA.No.Such"));
     EXPECT_TRUE(CredRequestUtil::IsCredIdCached(-1));
     // An API the server does not list is never cached, so asking for it queries again.
-    EXPECT_EQ(2u, PathCount("/webapi/query.cgi"));
+    EXPECT_EQ(2u, Server().CountPath("/webapi/query.cgi"));
     EXPECT_TRUE(request.isAPIValid("KOVA.Demo.Echo"));
-    EXPECT_EQ(2u, PathCount("/webapi/query.cgi"));
+    EXPECT_EQ(2u, Server().CountPath("/webapi/query.cgi"));
 
     CredRequest noUrl;
     EXPECT_FALSE(noUrl.isAPIValid("KOVA.Demo.Echo"));

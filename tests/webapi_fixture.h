@@ -65,6 +65,12 @@ class WebApiTest : public ::testing::Test {
         cred.application = application;
     }
 
+    static KOVA_CRED Cred() {
+        KOVA_CRED cred;
+        FillCred(cred);
+        return cred;
+    }
+
     // Stores a credential for the simulator; returns its id.
     static int StoreCred(const std::string &account = "admin",
                          const std::string &password = "secret",
@@ -75,10 +81,6 @@ class WebApiTest : public ::testing::Test {
         EXPECT_GT(cred.id, 0);
         return cred.id;
     }
-
-    // Requests that reached `path` and named `api` (wire parameters or the simulator's
-    // records).
-    static size_t PathCount(const std::string &path) { return Server().CountPath(path); }
 
     // A started server answering `path` with `body`; with `withSim` the simulator serves its
     // other CGIs (discovery, encryption).
