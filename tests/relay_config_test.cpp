@@ -89,12 +89,9 @@ TEST(RelayConfig, ServerIdCarriesItsLowerCaseMd5) {
 }
 
 TEST(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuild) {
-    {
-        ScopedEnv unset("kovacredential_farlink_server", nullptr);
-        EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
-    }
-    {
-        ScopedEnv empty("kovacredential_farlink_server", "");
+    const char *const unsetOrEmpty[] = {nullptr, ""};
+    for (const char *value : unsetOrEmpty) {
+        ScopedEnv env("kovacredential_farlink_server", value);
         EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
     }
     ScopedEnv server("kovacredential_farlink_server", "dir.example");

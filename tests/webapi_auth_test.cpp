@@ -70,19 +70,6 @@ TEST_F(WebApiAuthTest, LoginSendsEveryParameterInsideTheRsaEnvelopeAndStoresTheS
     EXPECT_EQ(sess.csrf_token, stored.csrf_token);
 }
 
-TEST_F(WebApiAuthTest, EmptyApplicationAndOneTimeCodeAreNotSent) {
-    KOVA_CRED cred = Cred();
-    KOVA_CRED_SESS sess;
-    ASSERT_TRUE(CredRequestUtil::Login(&cred, &sess)) << LogDump();
-    kovasim::WebApiSim::LoginRecord login = Sim().LastLogin();
-    EXPECT_EQ(0u, login.params.count("session"));
-    EXPECT_EQ(0u, login.params.count("otp_code"));
-    // An unstored credential keeps its session in memory only.
-    KOVA_CRED_SESS *list = nullptr;
-    EXPECT_EQ(0, KOVACredSessListGet(&list, nullptr, nullptr));
-    KOVACredSessListFree(&list);
-}
-
 TEST_F(WebApiAuthTest, OneTimeCodeIsRequiredCheckedAndSent) {
     int id = StoreCred("otpuser", "secret");
     KOVA_CRED cred;
@@ -376,7 +363,7 @@ TEST_F(WebApiRedirectTest, OnlyPlainHttpCredentialsAreProbedAndFollowTheRedirect
     EXPECT_FALSE(CredRequestUtil::CheckRedirect(nullptr));
 }
 
-TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTarget) {
+TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTargetWithOnlyTheGivenFields) {
     KOVA_CRED cred = Cred();
     cred.port = redirect_->Port();
     KOVA_CRED_SESS sess;
@@ -385,6 +372,14 @@ TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTarget) {
     EXPECT_EQ("https", cred.protocol);
     EXPECT_EQ(https_->Port(), cred.port);
     EXPECT_EQ(1u, https_->CountPath("/webapi/auth.cgi"));
+    // An empty application and one-time code are not sent.
+    kovasim::WebApiSim::LoginRecord login = Sim().LastLogin();
+    EXPECT_EQ(0u, login.params.count("session"));
+    EXPECT_EQ(0u, login.params.count("otp_code"));
+    // An unstored credential keeps its session in memory only.
+    KOVA_CRED_SESS *list = nullptr;
+    EXPECT_EQ(0, KOVACredSessListGet(&list, nullptr, nullptr));
+    KOVACredSessListFree(&list);
 }
 
 TEST_F(WebApiRedirectTest, RefusedProbeLetsTheRequestReportItsOwnError) {
