@@ -1,11 +1,8 @@
 // The request manager with plain requests against loopback servers: ownership and slots,
 // concurrent runs, set-up failures, silent and refusing servers, and the socket callback.
-#include <arpa/inet.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <unistd.h>
 
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <string>
 #include <thread>
@@ -15,6 +12,7 @@
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_mgr.h"
 #include "simlib/loopback_server.h"
+#include "simlib/relay_sim.h"
 #include "support/interpose.h"
 
 namespace {
@@ -22,52 +20,6 @@ namespace {
 using KOVA::CredRequest;
 using KOVA::CredRequestMgr;
 using Clock = std::chrono::steady_clock;
-
-// A loopback socket that listens but never accepts: connections complete in the kernel and
-// then hear nothing.
-class SilentListener {
-  public:
-    SilentListener() {
-        fd_ = socket(AF_INET, SOCK_STREAM, 0);
-        sockaddr_in addr{};
-        addr.sin_family = AF_INET;
-        addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        socklen_t len = sizeof(addr);
-        if (fd_ >= 0 && bind(fd_, reinterpret_cast<sockaddr *>(&addr), sizeof(addr)) == 0 &&
-            listen(fd_, 16) == 0 &&
-            getsockname(fd_, reinterpret_cast<sockaddr *>(&addr), &len) == 0) {
-            port_ = ntohs(addr.sin_port);
-        }
-    }
-    ~SilentListener() {
-        if (fd_ >= 0) {
-            close(fd_);
-        }
-    }
-    int Port() const { return port_; }
-
-  private:
-    int fd_ = -1;
-    int port_ = 0;
-};
-
-// A loopback port that nobody listens on: bound once to learn a free number, then released.
-int RefusingPort() {
-    int fd = socket(AF_INET, SOCK_STREAM, 0);
-    sockaddr_in addr{};
-    addr.sin_family = AF_INET;
-    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t len = sizeof(addr);
-    int port = 0;
-    if (fd >= 0 && bind(fd, reinterpret_cast<sockaddr *>(&addr), sizeof(addr)) == 0 &&
-        getsockname(fd, reinterpret_cast<sockaddr *>(&addr), &len) == 0) {
-        port = ntohs(addr.sin_port);
-    }
-    if (fd >= 0) {
-        close(fd);
-    }
-    return port;
-}
 
 class ManagerTest : public ::testing::Test {
   protected:
@@ -100,45 +52,36 @@ class ManagerTest : public ::testing::Test {
     std::unique_ptr<kovasim::LoopbackServer> server_;
 };
 
-TEST_F(ManagerTest, EmptyManagerRunsSuccessfully) {
-    CredRequestMgr mgr;
-    EXPECT_TRUE(mgr.IsEmpty());
-    EXPECT_EQ(0, mgr.Size());
-    EXPECT_TRUE(mgr.Run());
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
-    EXPECT_TRUE(mgr.IsEmpty());
-    EXPECT_EQ(Json::Value(Json::arrayValue), mgr.GetAllResponse());
-    EXPECT_EQ(0u, server_->RequestCount());
-}
-
 TEST_F(ManagerTest, BadIndexesGiveErrorOne) {
     CredRequestMgr mgr;
     CredRequest *request = NewRequest(Url("/hello"));
     ASSERT_EQ(0, mgr.AddCredRequest(request));
 
-    EXPECT_EQ(nullptr, mgr.GetRequest(-1));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
-
-    mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
-    EXPECT_EQ(nullptr, mgr.GetRequest(mgr.Size()));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
-
-    mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
-    EXPECT_EQ("", mgr.GetResponse(1));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
-
-    mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
-    EXPECT_EQ(nullptr, mgr.RemoveRequest(-1));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
-    EXPECT_EQ(request, mgr.GetRequest(0));
+    const std::pair<const char *, std::function<bool()>> calls[] = {
+        {"GetRequest(-1)", [&] { return mgr.GetRequest(-1) == nullptr; }},
+        {"GetRequest(size)", [&] { return mgr.GetRequest(mgr.Size()) == nullptr; }},
+        {"GetResponse(1)", [&] { return mgr.GetResponse(1).empty(); }},
+        {"RemoveRequest(-1)", [&] { return mgr.RemoveRequest(-1) == nullptr; }}};
+    for (const auto &call : calls) {
+        SCOPED_TRACE(call.first);
+        mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
+        EXPECT_TRUE(call.second());
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
+    }
 
     // The manager never clears its error by itself.
     EXPECT_EQ(request, mgr.GetRequest(0));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
 }
 
-TEST_F(ManagerTest, AddingAssignsConsecutiveIndexes) {
+TEST_F(ManagerTest, AddingAssignsConsecutiveIndexesAndClearEmpties) {
     CredRequestMgr mgr;
+    EXPECT_TRUE(mgr.IsEmpty());
+    EXPECT_TRUE(mgr.Run());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+    EXPECT_EQ(Json::Value(Json::arrayValue), mgr.GetAllResponse());
+    EXPECT_EQ(0u, server_->RequestCount());
+
     CredRequest *first = NewRequest(Url("/hello"));
     CredRequest *second = NewRequest(Url("/hello"));
     CredRequest *third = NewRequest(Url("/hello"));
@@ -241,17 +184,6 @@ TEST_F(ManagerTest, DelayedRequestsRunConcurrentlyInAddingOrder) {
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
 }
 
-TEST_F(ManagerTest, SecondRunStartsFromEmptyResponses) {
-    CredRequestMgr mgr;
-    ASSERT_EQ(0, mgr.AddCredRequest(NewRequest(Url("/hello"))));
-    ASSERT_EQ(1, mgr.AddCredRequest(NewRequest(Url("/slow?n=1"))));
-    ASSERT_TRUE(mgr.Run());
-    ASSERT_TRUE(mgr.Run()) << kova_test::LogDump();
-    EXPECT_EQ(4u, server_->RequestCount());
-    EXPECT_EQ("hello", mgr.GetResponse(0));
-    EXPECT_EQ("slow 1", mgr.GetResponse(1));
-}
-
 TEST_F(ManagerTest, RequestWithFailedSetUpIsLeftOut) {
     CredRequestMgr mgr;
     ASSERT_EQ(0, mgr.AddCredRequest(NewRequest(Url("/hello"))));
@@ -260,7 +192,9 @@ TEST_F(ManagerTest, RequestWithFailedSetUpIsLeftOut) {
     ASSERT_EQ(2, mgr.AddCredRequest(NewRequest(Url("/slow?n=2"))));
 
     EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
-    EXPECT_EQ(2u, server_->RequestCount());
+    // A second run starts from empty responses.
+    EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+    EXPECT_EQ(4u, server_->RequestCount());
     EXPECT_EQ("hello", mgr.GetResponse(0));
     EXPECT_EQ("", mgr.GetResponse(1));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NO_URL, noUrl->GetError());
@@ -269,8 +203,9 @@ TEST_F(ManagerTest, RequestWithFailedSetUpIsLeftOut) {
 }
 
 TEST_F(ManagerTest, SilentServerEndsRunThroughTimeout) {
-    SilentListener silent;
-    ASSERT_NE(0, silent.Port());
+    // Connections complete and then hear nothing until the client gives up.
+    kovasim::RawServer silent([](kovasim::RawServer::Connection &c) { c.WaitForClose(5000); });
+    ASSERT_TRUE(silent.Start());
     std::string silentUrl = "http://127.0.0.1:" + std::to_string(silent.Port()) + "/never";
     CredRequestMgr mgr;
     CredRequest *quick = NewRequest(silentUrl);
@@ -297,10 +232,11 @@ TEST_F(ManagerTest, SilentServerEndsRunThroughTimeout) {
 }
 
 TEST_F(ManagerTest, RefusedConnectionDoesNotStopTheOthers) {
-    int port = RefusingPort();
-    ASSERT_NE(0, port);
+    kovasim::RefusedPort refused;
+    ASSERT_NE(0, refused.Port());
     CredRequestMgr mgr;
-    ASSERT_EQ(0, mgr.AddCredRequest(NewRequest("http://127.0.0.1:" + std::to_string(port) + "/")));
+    ASSERT_EQ(0, mgr.AddCredRequest(
+                     NewRequest("http://127.0.0.1:" + std::to_string(refused.Port()) + "/")));
     ASSERT_EQ(1, mgr.AddCredRequest(NewRequest(Url("/slow?n=1"))));
 
     EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
@@ -313,9 +249,7 @@ TEST_F(ManagerTest, RefusedConnectionDoesNotStopTheOthers) {
     EXPECT_EQ(0, status);
 }
 
-class SocketCallbackTest : public ManagerTest {};
-
-TEST_F(SocketCallbackTest, RemoveEventMarksTheHeldRequest) {
+TEST_F(ManagerTest, SocketCallbackMarksOnlyTheRemovedHeldRequest) {
     CredRequestMgr mgr;
     CredRequest *first = NewRequest(Url("/hello"));
     CredRequest *second = NewRequest(Url("/hello"));
@@ -323,33 +257,24 @@ TEST_F(SocketCallbackTest, RemoveEventMarksTheHeldRequest) {
     ASSERT_EQ(1, mgr.AddCredRequest(second));
     ASSERT_TRUE(first->Process(false, 0));
     ASSERT_TRUE(second->Process(false, 0));
-    ASSERT_NE(nullptr, second->GetCurlHandler());
-
-    EXPECT_EQ(0, CredRequestMgr::SocketCallback(second->GetCurlHandler(), CURL_SOCKET_BAD,
-                                                CURL_POLL_REMOVE, &mgr, nullptr));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, second->GetError());
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, first->GetError());
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
-}
-
-TEST_F(SocketCallbackTest, OtherEventsAndUnknownHandlesChangeNothing) {
-    CredRequestMgr mgr;
-    CredRequest *request = NewRequest(Url("/hello"));
-    ASSERT_EQ(0, mgr.AddCredRequest(request));
-    ASSERT_TRUE(request->Process(false, 0));
-    CURL *easy = request->GetCurlHandler();
+    CURL *easy = second->GetCurlHandler();
     ASSERT_NE(nullptr, easy);
 
+    // Other events, and a removal of a handle the manager does not hold, change nothing.
     for (int what : {CURL_POLL_NONE, CURL_POLL_IN, CURL_POLL_OUT, CURL_POLL_INOUT}) {
         EXPECT_EQ(0, CredRequestMgr::SocketCallback(easy, CURL_SOCKET_BAD, what, &mgr, nullptr));
-        EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError()) << what;
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, second->GetError()) << what;
     }
-
     std::unique_ptr<CURL, void (*)(CURL *)> stranger(curl_easy_init(), curl_easy_cleanup);
     ASSERT_TRUE(stranger);
     EXPECT_EQ(0, CredRequestMgr::SocketCallback(stranger.get(), CURL_SOCKET_BAD, CURL_POLL_REMOVE,
                                                 &mgr, nullptr));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, second->GetError());
+
+    EXPECT_EQ(
+        0, CredRequestMgr::SocketCallback(easy, CURL_SOCKET_BAD, CURL_POLL_REMOVE, &mgr, nullptr));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, second->GetError());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, first->GetError());
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
 }
 

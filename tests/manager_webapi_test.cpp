@@ -1,24 +1,12 @@
 // The request manager with WebAPI requests against the in-process WebAPI simulator: requests
 // by credential id, by records and by bare server address, discovery under pseudo-ids, and
 // the factories' failures.
-#include <stdio.h>
-
-#include <chrono>
 #include <fstream>
 #include <memory>
 #include <string>
 
-#include <gtest/gtest.h>
-
-#include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_mgr.h"
-#include "kovacredential/cred_request_util.h"
-#include "kovacredential/kovacred.h"
-#include "platform/json_text.h"
-#include "simlib/loopback_server.h"
-#include "simlib/webapi_sim.h"
-#include "support/interpose.h"
-#include "support/temp_dir.h"
+#include "webapi_fixture.h"
 
 namespace {
 
@@ -26,40 +14,13 @@ using KOVA::CredRequest;
 using KOVA::CredRequestMgr;
 using KOVA::CredRequestUtil;
 
-class ManagerWebApiTest : public ::testing::Test {
+class ManagerWebApiTest : public kova_test::WebApiTest {
   protected:
     void SetUp() override {
-        CredRequestUtil::m_jsData = Json::Value();
-        kovasim::LoopbackServer::Options options;
-        options.threads = 32;
-        server_ = std::make_unique<kovasim::LoopbackServer>(options);
-        sim_.Install(*server_);
-        ASSERT_TRUE(server_->Start()) << server_->Error();
-
-        plain_ = std::make_unique<kovasim::LoopbackServer>();
-        plain_->Route("*", "/plain", [](const httplib::Request &, httplib::Response &res) {
-            res.set_content("plain answer", "text/plain");
-        });
-        ASSERT_TRUE(plain_->Start()) << plain_->Error();
-        kova_test::ClearLog();
-    }
-    void TearDown() override {
-        server_->Stop();
-        plain_->Stop();
-        CredRequestUtil::m_jsData = Json::Value();
-    }
-
-    // Stores a credential for the simulator's "admin" account; its id.
-    long StoreCredential() {
-        KOVA_CRED cred;
-        cred.protocol = "http";
-        cred.host = "127.0.0.1";
-        cred.port = server_->Port();
-        cred.remote_account = "admin";
-        cred.remote_passwd = "secret";
-        EXPECT_EQ(0, KOVACredAdd(&cred));
-        EXPECT_GE(cred.id, 0);
-        return cred.id;
+        WebApiTest::SetUp();
+        plain_ = FixedAnswer("/plain", "plain answer", false);
+        queries_ = Sim().QueryHits();
+        echoes_ = Sim().Hits("KOVA.Demo.Echo");
     }
 
     // Negative member names left in the description cache.
@@ -77,20 +38,13 @@ class ManagerWebApiTest : public ::testing::Test {
         return count;
     }
 
-    static Json::Value Parse(const std::string &text) {
-        Json::Value value;
-        EXPECT_TRUE(kova::JsonFromString(text, value)) << text;
-        return value;
-    }
-
-    kova_test::TempDatabase db_;
-    kovasim::WebApiSim sim_;
-    std::unique_ptr<kovasim::LoopbackServer> server_;
     std::unique_ptr<kovasim::LoopbackServer> plain_;
+    size_t queries_ = 0;  // discovery queries and echo calls the simulator saw before the test
+    size_t echoes_ = 0;
 };
 
 TEST_F(ManagerWebApiTest, MixedRequestsRunTogetherInAddingOrder) {
-    long credId = StoreCredential();
+    long credId = StoreCred();
     KOVA_CRED cred;
     ASSERT_EQ(0, KOVACredGetByID(credId, &cred));
     KOVA_CRED_SESS sess;
@@ -106,26 +60,36 @@ TEST_F(ManagerWebApiTest, MixedRequestsRunTogetherInAddingOrder) {
     EXPECT_EQ(1, mgr.AddWebAPIRequest(&cred, &sess, "KOVA.Demo.Echo", 2, "echo", two));
     Json::Value three;
     three["word"] = "three";
-    EXPECT_EQ(2, mgr.AddCredRequest("http", "127.0.0.1", server_->Port(), sess.access_token,
+    EXPECT_EQ(2, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), sess.access_token,
                                     "KOVA.Demo.Echo", 1, "echo", three));
     auto *plain = new CredRequest();
     ASSERT_TRUE(plain->SetURL(plain_->BaseUrl() + "/plain"));
     EXPECT_EQ(3, mgr.AddCredRequest(plain));
-    ASSERT_EQ(4, mgr.Size()) << kova_test::LogDump();
+    Json::Value headers;
+    headers["X-Relay-Test"] = "yes";
+    EXPECT_EQ(4,
+              mgr.AddRelayRequest(credId, "KOVA.Demo.Echo", 1, "echo", headers, nullptr, nullptr));
+    ASSERT_EQ(5, mgr.Size()) << kova_test::LogDump();
 
     EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
     Json::Value all = mgr.GetAllResponse();
-    ASSERT_EQ(4u, all.size());
+    ASSERT_EQ(5u, all.size());
     const char *words[] = {"one", "two", "three"};
     for (int i = 0; i < 3; ++i) {
-        Json::Value answer = Parse(all[i].asString());
+        Json::Value answer = ParseBody(all[i].asString());
         EXPECT_TRUE(answer["success"].asBool()) << all[i].asString();
         EXPECT_EQ(words[i], answer["data"]["params"]["word"].asString()) << i;
         EXPECT_EQ(sess.access_token, answer["data"]["params"]["_sid"].asString()) << i;
     }
-    EXPECT_EQ(2, Parse(all[1].asString())["data"]["version"].asInt());
+    EXPECT_EQ(2, ParseBody(all[1].asString())["data"]["version"].asInt());
     EXPECT_EQ("plain answer", all[3].asString());
-    EXPECT_EQ(3u, sim_.Hits("KOVA.Demo.Echo"));
+    EXPECT_TRUE(ParseBody(all[4].asString())["success"].asBool()) << all[4].asString();
+    size_t relayed = 0;
+    for (const auto &request : Server().Requests()) {
+        relayed += request.path == "/webapi/entry.cgi" && request.Header("X-Relay-Test") == "yes";
+    }
+    EXPECT_EQ(1u, relayed);
+    EXPECT_EQ(4u, Sim().Hits("KOVA.Demo.Echo") - echoes_);
 }
 
 TEST_F(ManagerWebApiTest, ServerAddressDiscoversUnderPseudoIdAndDropsIt) {
@@ -133,29 +97,29 @@ TEST_F(ManagerWebApiTest, ServerAddressDiscoversUnderPseudoIdAndDropsIt) {
     ASSERT_FALSE(CredRequestUtil::IsCredIdCached(-1));
     Json::Value params;
     params["word"] = "x";
-    ASSERT_EQ(0, mgr.AddCredRequest("http", "127.0.0.1", server_->Port(), "", "KOVA.Demo.Echo", 1,
+    ASSERT_EQ(0, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), "", "KOVA.Demo.Echo", 1,
                                     "echo", params))
         << kova_test::LogDump();
-    EXPECT_EQ(1u, sim_.QueryHits());
+    EXPECT_EQ(1u, Sim().QueryHits() - queries_);
     EXPECT_FALSE(CredRequestUtil::IsCredIdCached(-1));
     EXPECT_EQ(0, PseudoEntries());
-    EXPECT_EQ(server_->BaseUrl() + "/webapi/entry.cgi", mgr.GetRequest(0)->GetURL());
+    EXPECT_EQ(Server().BaseUrl() + "/webapi/entry.cgi", mgr.GetRequest(0)->GetURL());
 
     // The pseudo-id is free again, so the next request discovers afresh under the same id and
     // again leaves nothing behind.
-    ASSERT_EQ(1, mgr.AddCredRequest("http", "127.0.0.1", server_->Port(), "", "KOVA.Demo.Delay", 1,
+    ASSERT_EQ(1, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), "", "KOVA.Demo.Delay", 1,
                                     "wait", Json::Value()));
-    EXPECT_EQ(2u, sim_.QueryHits());
+    EXPECT_EQ(2u, Sim().QueryHits() - queries_);
     EXPECT_EQ(0, PseudoEntries());
-    EXPECT_EQ(server_->BaseUrl() + "/webapi/delay.cgi", mgr.GetRequest(1)->GetURL());
+    EXPECT_EQ(Server().BaseUrl() + "/webapi/delay.cgi", mgr.GetRequest(1)->GetURL());
 
     ASSERT_TRUE(mgr.Run()) << kova_test::LogDump();
-    Json::Value answer = Parse(mgr.GetResponse(0));
+    Json::Value answer = ParseBody(mgr.GetResponse(0));
     EXPECT_TRUE(answer["success"].asBool());
     EXPECT_EQ("x", answer["data"]["params"]["word"].asString());
     // No session id given: none is sent.
     EXPECT_FALSE(answer["data"]["params"].isMember("_sid"));
-    EXPECT_TRUE(Parse(mgr.GetResponse(1))["success"].asBool());
+    EXPECT_TRUE(ParseBody(mgr.GetResponse(1))["success"].asBool());
 }
 
 TEST_F(ManagerWebApiTest, ServerAddressSkipsPseudoIdsAlreadyCached) {
@@ -165,21 +129,21 @@ TEST_F(ManagerWebApiTest, ServerAddressSkipsPseudoIdsAlreadyCached) {
     CredRequestUtil::m_jsData["webapiDesc"]["-1"] = bogus;
 
     CredRequestMgr mgr;
-    ASSERT_EQ(0, mgr.AddCredRequest("http", "127.0.0.1", server_->Port(), "", "KOVA.Demo.Echo", 1,
+    ASSERT_EQ(0, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), "", "KOVA.Demo.Echo", 1,
                                     "echo", Json::Value()))
         << kova_test::LogDump();
-    EXPECT_EQ(server_->BaseUrl() + "/webapi/entry.cgi", mgr.GetRequest(0)->GetURL());
+    EXPECT_EQ(Server().BaseUrl() + "/webapi/entry.cgi", mgr.GetRequest(0)->GetURL());
     EXPECT_EQ(bogus, CredRequestUtil::m_jsData["webapiDesc"]["-1"]);
     EXPECT_FALSE(CredRequestUtil::IsCredIdCached(-2));
     EXPECT_EQ(1, PseudoEntries());
 }
 
-TEST_F(ManagerWebApiTest, ServerAddressFailuresCreateNoRequest) {
+TEST_F(ManagerWebApiTest, FailuresAreLoggedAndAddNothing) {
     CredRequestMgr mgr;
-    EXPECT_EQ(-1, mgr.AddCredRequest("http", "127.0.0.1", server_->Port(), "sid", "KOVA.No.Such", 1,
+    EXPECT_EQ(-1, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), "sid", "KOVA.No.Such", 1,
                                      "get", Json::Value()));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, mgr.GetError());
-    EXPECT_EQ(1u, sim_.QueryHits());
+    EXPECT_EQ(1u, Sim().QueryHits() - queries_);
     EXPECT_EQ(0, PseudoEntries());
 
     // A server that cannot be reached.
@@ -190,70 +154,23 @@ TEST_F(ManagerWebApiTest, ServerAddressFailuresCreateNoRequest) {
                                      Json::Value()));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, mgr.GetError());
     EXPECT_EQ(0, PseudoEntries());
-    EXPECT_EQ(0, mgr.Size());
-}
 
-TEST_F(ManagerWebApiTest, FactoryFailuresAreLoggedAndAddNothing) {
-    CredRequestMgr mgr;
+    // The factories' failures are logged with the manager's line.
     EXPECT_EQ(-1, mgr.AddWebAPIRequest(4242L, "KOVA.Demo.Echo", 1, "echo", Json::Value()));
     EXPECT_TRUE(kova_test::LogHas("cred_request_mgr:39 CreateWebAPIRequest fail"))
         << kova_test::LogDump();
-
     KOVA_CRED_SESS sess;
     EXPECT_EQ(-1, mgr.AddWebAPIRequest(nullptr, &sess, "KOVA.Demo.Echo", 1, "echo", Json::Value()));
     EXPECT_TRUE(kova_test::LogHas("cred_request_mgr:58 CreateWebAPIRequest fail"));
-
     EXPECT_EQ(-1, mgr.AddRelayRequest(4242L, "KOVA.Demo.Echo", 1, "echo", Json::Value(), nullptr,
                                       nullptr));
     EXPECT_TRUE(kova_test::LogHas("cred_request_mgr:77 CreateRelayRequest fail"));
     EXPECT_EQ(0, mgr.Size());
-    EXPECT_EQ(0u, sim_.Hits("KOVA.Demo.Echo"));
-}
-
-TEST_F(ManagerWebApiTest, RelayRequestRunsWithItsHeaders) {
-    long credId = StoreCredential();
-    CredRequestMgr mgr;
-    Json::Value headers;
-    headers["X-Relay-Test"] = "yes";
-    ASSERT_EQ(0,
-              mgr.AddRelayRequest(credId, "KOVA.Demo.Echo", 1, "echo", headers, nullptr, nullptr))
-        << kova_test::LogDump();
-    ASSERT_TRUE(mgr.Run()) << kova_test::LogDump();
-    EXPECT_TRUE(Parse(mgr.GetResponse(0))["success"].asBool()) << mgr.GetResponse(0);
-    bool sawHeader = false;
-    for (const auto &request : server_->Requests()) {
-        if (request.path == "/webapi/entry.cgi" && request.Header("X-Relay-Test") == "yes") {
-            sawHeader = true;
-        }
-    }
-    EXPECT_TRUE(sawHeader);
-}
-
-TEST_F(ManagerWebApiTest, DelayedWebApiCallsOverlap) {
-    constexpr int kCount = 10;
-    CredRequestMgr mgr;
-    Json::Value params;
-    params["ms"] = "300";
-    for (int i = 0; i < kCount; ++i) {
-        ASSERT_EQ(i, mgr.AddCredRequest("http", "127.0.0.1", server_->Port(), "", "KOVA.Demo.Delay",
-                                        1, "wait", params))
-            << kova_test::LogDump();
-    }
-    auto start = std::chrono::steady_clock::now();
-    ASSERT_TRUE(mgr.Run()) << kova_test::LogDump();
-    double seconds =
-        std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-    EXPECT_LT(seconds, 2.0);
-    EXPECT_GT(sim_.MaxConcurrent(), 1);
-    for (int i = 0; i < kCount; ++i) {
-        Json::Value answer = Parse(mgr.GetResponse(i));
-        EXPECT_TRUE(answer["success"].asBool()) << mgr.GetResponse(i);
-        EXPECT_EQ(300, answer["data"]["delayed_ms"].asInt());
-    }
+    EXPECT_EQ(0u, Sim().Hits("KOVA.Demo.Echo") - echoes_);
 }
 
 TEST_F(ManagerWebApiTest, BatchCommandRunsCredentialAndUrlCalls) {
-    long credId = StoreCredential();
+    long credId = StoreCred();
     Json::Value calls(Json::arrayValue);
     Json::Value byCred;
     byCred["cred"] = static_cast<Json::Int64>(credId);
@@ -268,18 +185,18 @@ TEST_F(ManagerWebApiTest, BatchCommandRunsCredentialAndUrlCalls) {
     Json::Value unknown = byCred;
     unknown["cred"] = 4242;
     calls.append(unknown);
-    std::string file = db_.dir().File("calls.json");
+    std::string file = db_->dir().File("calls.json");
     std::ofstream(file) << kova::JsonToString(calls);
 
     std::string out;
-    std::string errFile = db_.dir().File("stderr.txt");
+    std::string errFile = db_->dir().File("stderr.txt");
     int status = kova_test::RunCommand(
-        std::string(KOVACRED_BIN) + " --db " + db_.path() + " batch " + file + " 2>" + errFile,
+        std::string(KOVACRED_BIN) + " --db " + db_->path() + " batch " + file + " 2>" + errFile,
         &out);
     std::ifstream errIn(errFile);
     std::string err((std::istreambuf_iterator<char>(errIn)), std::istreambuf_iterator<char>());
     EXPECT_NE(0, status);
-    Json::Value answers = Parse(out.substr(0, out.find_last_not_of('\n') + 1));
+    Json::Value answers = ParseBody(out.substr(0, out.find_last_not_of('\n') + 1));
     ASSERT_EQ(3u, answers.size()) << out;
     EXPECT_TRUE(answers[0]["success"].asBool()) << out;
     EXPECT_EQ("batch", answers[0]["data"]["params"]["word"].asString());

@@ -10,7 +10,6 @@
 #include <gtest/gtest.h>
 
 #include "kovacredential/cred_request_farlink.h"
-#include "platform/json_text.h"
 #include "request/cred_request_farlink_p.h"
 #include "relay_fixture.h"
 #include "simlib/relay_sim.h"
@@ -78,37 +77,29 @@ TEST_F(RelayCommandsTest, RequestDocumentsOnTheWire) {
         "service": {"id": "zon_portal", "relay_ip": "10.9.9.9", "relay_port": 7000}})"));
 }
 
-TEST_F(RelayCommandsTest, UnsupportedServiceIdTravelsAsItStands) {
-    CredRequestFarlink client;
-    client.SetServerId("S1");
-    client.SetServiceId("ftp");
-    Json::Value info;
-    EXPECT_FALSE(client.GetServerInfo(info));
-    ASSERT_EQ(Sim().HitCount(), 1u);
-    EXPECT_EQ(Sim().Hits()[0].request["id"], "ftp");
-    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_SERVER_ERRNO);
-}
-
 TEST_F(RelayCommandsTest, ServerInformationIsTheWholeAnswer) {
     CredRequestFarlink client;
     client.SetServerId("S1");
-    Json::Value info;
-    ASSERT_TRUE(client.GetServerInfo(info)) << client.GetErrors().toStyledString();
-    EXPECT_EQ(info, ParseJson(R"({"errno": 0,
-        "server": {"serverID": "S1", "interface": [{"ip": "10.0.0.5"}], "ddns": "s1.example"},
-        "service": {"id": "zon", "port": 5000, "ext_port": 0}})"));
-}
-
-TEST_F(RelayCommandsTest, PreparedServerInfoRequestIsNotSent) {
-    CredRequestFarlink client;
-    client.SetServerId("S1");
+    // The prepared request is not sent until it is processed.
     std::unique_ptr<CredRequest> request(client.GetServerInfo());
     ASSERT_TRUE(request);
     EXPECT_EQ(Sim().HitCount(), 0u);
     ASSERT_TRUE(request->Process(true, 0));
     EXPECT_EQ(Sim().HitCount(), 1u);
-    Json::Value answer = ParseJson(request->GetResponse());
-    EXPECT_EQ(answer["server"]["serverID"], "S1");
+    EXPECT_EQ(ParseJson(request->GetResponse())["server"]["serverID"], "S1");
+
+    Json::Value info;
+    ASSERT_TRUE(client.GetServerInfo(info)) << client.GetErrors().toStyledString();
+    EXPECT_EQ(info, ParseJson(R"({"errno": 0,
+        "server": {"serverID": "S1", "interface": [{"ip": "10.0.0.5"}], "ddns": "s1.example"},
+        "service": {"id": "zon", "port": 5000, "ext_port": 0}})"));
+
+    // An unsupported service id travels as it stands.
+    client.SetServiceId("ftp");
+    EXPECT_FALSE(client.GetServerInfo(info));
+    ASSERT_EQ(Sim().HitCount(), 3u);
+    EXPECT_EQ(Sim().Hits()[2].request["id"], "ftp");
+    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_SERVER_ERRNO);
 }
 
 TEST_F(RelayCommandsTest, MissingServerIdIs401ForInformationAnd1ForTunnels) {
@@ -226,72 +217,69 @@ TEST_F(RelayCommandsTest, FailingSiteListLeavesTheServerName) {
     EXPECT_EQ(Sim().Hits("request_tunnel")[0].site, Host(3));
 }
 
-TEST_F(RelayCommandsTest, ErrnoAnswersGive23WithTheAnswer) {
-    Configure(R"({"answers": [{"command": "request_tunnel", "json": {"errno": 1}}],
-                  "servers": []})");
+TEST_F(RelayCommandsTest, UnusableAnswersGiveTheirErrorDocuments) {
+    // Answers that are no object or carry an errno give 23 with the answer (server information
+    // with its text); answers that are no JSON give 22 with the request document.
+    enum Command { kSites, kInfo, kTunnel };
+    const char *html = R"({"answers": [{"raw": "<html>busy</html>"}]})";
+    const char *zero = R"({"answers": [{"raw": "0"}]})";
+    const struct {
+        const char *config;
+        Command command;
+        const char *errors;
+    } cases[] = {
+        {R"({"answers": [{"command": "request_tunnel", "json": {"errno": 1}}]})", kTunnel,
+         R"({"code":23,"error":{"errno":1}})"},
+        {html, kInfo, R"({"code":23,"error":"<html>busy</html>"})"},
+        {html, kSites, R"({"code":22,"error":{"command":"get_site_list","version":1}})"},
+        {html, kTunnel, R"({"code":22,"error":{"command":"request_tunnel","id":"zon",
+                                               "serverID":"S1","version":1}})"},
+        {R"({"answers": [{"json": [1, 2]}]})", kSites, R"({"code":23,"error":[1,2]})"},
+        {zero, kSites, R"({"code":23,"error":0})"},
+        {zero, kInfo, R"({"code":23,"error":"0"})"},
+        {R"({"answers": [{"raw": ""}]})", kInfo, R"({"code":23,"error":""})"},
+    };
+    for (const auto &c : cases) {
+        SCOPED_TRACE(std::string(c.config) + " command " + std::to_string(c.command));
+        Configure(c.config);
+        CredRequestFarlink client;
+        client.SetServerId("S1");
+        Json::Value answer;
+        EXPECT_FALSE(c.command == kSites  ? client.GetSiteList(answer)
+                     : c.command == kInfo ? client.GetServerInfo(answer)
+                                          : client.RequestTunnel(answer));
+        EXPECT_EQ(client.GetErrors(), ParseJson(c.errors));
+    }
+}
+
+TEST_F(RelayCommandsTest, JsonThatIsNoObjectIsReceivedButNotAccepted) {
+    KOVA::CredRequestFarlinkPrivate core(nullptr);
+    Json::Value body = ParseJson(R"({"version":1,"command":"get_site_list"})");
+    const std::pair<const char *, const char *> answers[] = {
+        {R"({"answers": [{"json": [1, 2]}]})", "[1,2]"}, {R"({"answers": [{"raw": "0"}]})", "0"}};
+    for (const auto &a : answers) {
+        SCOPED_TRACE(a.second);
+        Configure(a.first);
+        Json::Value answer;
+        EXPECT_TRUE(core.SendFarlinkRequest(body, answer));
+        EXPECT_EQ(answer, ParseJson(a.second));
+        EXPECT_FALSE(core.CheckResponse(a.second, nullptr));
+    }
+}
+
+TEST_F(RelayCommandsTest, UnknownServerAndUnreachableDirectoryHostFailInformation) {
     CredRequestFarlink client;
     client.SetServerId("S9");
-    Json::Value answer;
-    EXPECT_FALSE(client.RequestTunnel(answer));
-    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":{"errno":1}})"));
-    // Server information gives the raw text as detail.
-    EXPECT_FALSE(client.GetServerInfo(answer));
+    Json::Value info;
+    // An errno answer to server information is detailed by its raw text.
+    EXPECT_FALSE(client.GetServerInfo(info));
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_SERVER_ERRNO);
     EXPECT_EQ(client.GetErrors()["error"], Sim().Hits("get_server_info")[0].answer);
     EXPECT_EQ(ParseJson(client.GetErrors()["error"].asString())["errno"], 4);
-}
-
-TEST_F(RelayCommandsTest, NonJsonAnswersGive23ForInformationAnd22ForTheOthers) {
-    Configure(R"({"answers": [{"raw": "<html>busy</html>"}]})");
-    CredRequestFarlink client;
-    client.SetServerId("S1");
-    Json::Value answer;
-    EXPECT_FALSE(client.GetServerInfo(answer));
-    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":"<html>busy</html>"})"));
-    EXPECT_FALSE(client.GetSiteList(answer));
-    EXPECT_EQ(client.GetErrors(),
-              ParseJson(R"({"code":22,"error":{"command":"get_site_list","version":1}})"));
-    EXPECT_FALSE(client.RequestTunnel(answer));
-    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":22,"error":{"command":"request_tunnel",
-                                            "id":"zon","serverID":"S1","version":1}})"));
-}
-
-TEST_F(RelayCommandsTest, JsonThatIsNoObjectIsSentButNotAccepted) {
-    Configure(R"({"answers": [{"json": [1, 2]}]})");
-    KOVA::CredRequestFarlinkPrivate core(nullptr);
-    Json::Value body = ParseJson(R"({"version":1,"command":"get_site_list"})");
-    Json::Value answer;
-    EXPECT_TRUE(core.SendFarlinkRequest(body, answer));
-    EXPECT_EQ(answer, ParseJson("[1,2]"));
-    EXPECT_FALSE(core.CheckResponse(kova::JsonToString(answer), nullptr));
-
-    CredRequestFarlink client;
-    EXPECT_FALSE(client.GetSiteList(answer));
-    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":[1,2]})"));
-
-    // A bare scalar is JSON as well: it is parsed and then refused as the answer.
-    Configure(R"({"answers": [{"raw": "0"}]})");
-    EXPECT_TRUE(core.SendFarlinkRequest(body, answer));
-    EXPECT_EQ(answer, Json::Value(0));
-    EXPECT_FALSE(core.CheckResponse("0", nullptr));
-    EXPECT_FALSE(client.GetSiteList(answer));
-    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":0})"));
-    client.SetServerId("S1");
-    EXPECT_FALSE(client.GetServerInfo(answer));
-    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":"0"})"));
-}
-
-TEST_F(RelayCommandsTest, TransportFailureGives22WithTheRequestError) {
-    CredRequestFarlink client;
-    client.SetServerId("S1");
-    client.SetServerName(kovasim::ProcessLoopbackAddress(9));  // nothing listens there
-    Json::Value info;
+    // Nothing listens at the directory host: 22 with the request's error.
+    client.SetServerName(kovasim::ProcessLoopbackAddress(9));
     EXPECT_FALSE(client.GetServerInfo(info));
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":22,"error":20})"));
-    client.SetServerName(Host(2));
-    Configure(R"({"answers": [{"raw": ""}]})");
-    EXPECT_FALSE(client.GetServerInfo(info));
-    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":""})"));
 }
 
 }  // namespace

@@ -39,6 +39,7 @@ class ScopedEnv {
 using kova_test::ParseJson;
 
 TEST(RelayConfig, ServiceIdsSelectTheirProtocol) {
+    kova_test::ClearLog();
     CredRequestFarlinkPrivate client(nullptr);
     EXPECT_EQ(client.GetServiceId(), "zon");
     EXPECT_EQ(client.GetServiceProtocol(), "http");
@@ -52,11 +53,8 @@ TEST(RelayConfig, ServiceIdsSelectTheirProtocol) {
         EXPECT_EQ(client.GetServiceProtocol(), row.second) << row.first;
     }
     EXPECT_EQ(kova_test::LogCount("is not supported"), 0u);
-}
 
-TEST(RelayConfig, UnsupportedServiceIdIsKeptWithTheOldProtocolAndLogged) {
-    kova_test::ClearLog();
-    CredRequestFarlinkPrivate client(nullptr);
+    // An unsupported id is kept with the protocol it replaces, and logged.
     client.SetServiceId("zon_https");
     client.SetServiceId("ftp");
     EXPECT_EQ(client.GetServiceId(), "ftp");
@@ -67,18 +65,13 @@ TEST(RelayConfig, UnsupportedServiceIdIsKeptWithTheOldProtocolAndLogged) {
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
 }
 
-TEST(RelayConfig, ServerIdMd5IsLowerCaseHex) {
+TEST(RelayConfig, ServerIdCarriesItsLowerCaseMd5) {
     CredRequestFarlinkPrivate client(nullptr);
     client.SetServerId("abc");
     EXPECT_EQ(client.GetServerId(), "abc");
     EXPECT_EQ(client.GetServerIdMd5(), "900150983cd24fb0d6963f7d28e17f72");
-    EXPECT_EQ(kovasim::Md5Hex("abc"), client.GetServerIdMd5());
-}
-
-TEST(RelayConfig, RepeatedServerIdKeepsItsDigestAndANewIdReplacesBoth) {
-    CredRequestFarlinkPrivate client(nullptr);
-    client.SetServerId("abc");
-    // Overwrite the digest behind the id's back: setting the same id again must not redo it.
+    // Overwrite the digest behind the id's back: setting the same id again must not redo it,
+    // while a new id replaces both.
     client.SetServerIdMd5("something else");
     const std::string planted = client.GetServerIdMd5();
     ASSERT_NE(planted, "900150983cd24fb0d6963f7d28e17f72");
@@ -87,11 +80,7 @@ TEST(RelayConfig, RepeatedServerIdKeepsItsDigestAndANewIdReplacesBoth) {
     client.SetServerId("abd");
     EXPECT_EQ(client.GetServerId(), "abd");
     EXPECT_EQ(client.GetServerIdMd5(), kovasim::Md5Hex("abd"));
-}
-
-TEST(RelayConfig, EmptyServerIdClearsTheDigestWith401) {
-    CredRequestFarlinkPrivate client(nullptr);
-    client.SetServerId("abc");
+    // An empty id clears the digest with 401.
     client.SetServerId("");
     EXPECT_EQ(client.GetServerId(), "");
     EXPECT_EQ(client.GetServerIdMd5(), "");
@@ -100,12 +89,9 @@ TEST(RelayConfig, EmptyServerIdClearsTheDigestWith401) {
 }
 
 TEST(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuild) {
-    {
-        ScopedEnv unset("kovacredential_farlink_server", nullptr);
-        EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
-    }
-    {
-        ScopedEnv empty("kovacredential_farlink_server", "");
+    const char *const unsetOrEmpty[] = {nullptr, ""};
+    for (const char *value : unsetOrEmpty) {
+        ScopedEnv env("kovacredential_farlink_server", value);
         EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
     }
     ScopedEnv server("kovacredential_farlink_server", "dir.example");
@@ -149,11 +135,9 @@ TEST(RelayConfig, ErrorDocumentCarriesTheDetailOnlyWhenThereIsOne) {
 TEST(RelayConfig, CheckResponseAcceptsOnlyObjectsWithErrnoZero) {
     CredRequestFarlinkPrivate client(nullptr);
     Json::Value out = "untouched";
-    EXPECT_FALSE(client.CheckResponse("", &out));
-    EXPECT_FALSE(client.CheckResponse("{\"errno\":0", &out));
-    EXPECT_FALSE(client.CheckResponse("[0]", &out));
-    EXPECT_FALSE(client.CheckResponse("{\"errno\":1}", &out));
-    EXPECT_FALSE(client.CheckResponse("{\"errno\":\"x\"}", &out));
+    for (const char *text : {"", "{\"errno\":0", "[0]", "{\"errno\":1}", "{\"errno\":\"x\"}"}) {
+        EXPECT_FALSE(client.CheckResponse(text, &out)) << text;
+    }
     EXPECT_EQ(out, Json::Value("untouched"));
     EXPECT_TRUE(client.CheckResponse("{\"a\":1}", nullptr));
     EXPECT_TRUE(client.CheckResponse("{\"errno\":0,\"sites\":[\"s\"]}", &out));
@@ -179,7 +163,7 @@ TEST(RelayConfig, MissingDirectoryHostIsReportedBeforeAnEmptyBody) {
     EXPECT_EQ(client.GetErrors()["error"], body);
 }
 
-TEST(RelayConfig, ResponseTimeoutIsSetOnlyWhenPositive) {
+TEST(RelayConfig, PreparedRequestFollowsTimeoutAndHttpsFlag) {
     Json::Value body(Json::objectValue);
     body["version"] = 1;
     CredRequestFarlinkPrivate client(nullptr);
@@ -187,28 +171,15 @@ TEST(RelayConfig, ResponseTimeoutIsSetOnlyWhenPositive) {
     std::unique_ptr<CredRequest> request(client.CreateFarlinkRequest(body));
     ASSERT_TRUE(request);
     EXPECT_EQ(request->GetResponseTimeout(), 5);
-    client.SetTimeout(0);
-    request.reset(client.CreateFarlinkRequest(body));
-    ASSERT_TRUE(request);
-    EXPECT_EQ(request->GetResponseTimeout(), 120);
-    client.SetTimeout(-3);
-    request.reset(client.CreateFarlinkRequest(body));
-    ASSERT_TRUE(request);
-    EXPECT_EQ(request->GetResponseTimeout(), 120);
-    client.SetTimeout(42);
-    request.reset(client.CreateFarlinkRequest(body));
-    ASSERT_TRUE(request);
-    EXPECT_EQ(request->GetResponseTimeout(), 42);
-}
-
-TEST(RelayConfig, PortAndSchemeFollowTheHttpsFlag) {
-    Json::Value body(Json::objectValue);
-    body["version"] = 1;
-    CredRequestFarlinkPrivate client(nullptr);
-    client.SetServerName("dir.example");
-    std::unique_ptr<CredRequest> request(client.CreateFarlinkRequest(body));
-    ASSERT_TRUE(request);
     EXPECT_EQ(request->GetURL().rfind("http://dir.example:80/", 0), 0u) << request->GetURL();
+    // The response time-out is set only when positive.
+    const std::pair<int, int> timeouts[] = {{0, 120}, {-3, 120}, {42, 42}};
+    for (const auto &row : timeouts) {
+        client.SetTimeout(row.first);
+        request.reset(client.CreateFarlinkRequest(body));
+        ASSERT_TRUE(request);
+        EXPECT_EQ(request->GetResponseTimeout(), row.second) << row.first;
+    }
     client.SetHTTPS(true, false);
     request.reset(client.CreateFarlinkRequest(body));
     ASSERT_TRUE(request);

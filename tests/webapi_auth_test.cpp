@@ -70,20 +70,6 @@ TEST_F(WebApiAuthTest, LoginSendsEveryParameterInsideTheRsaEnvelopeAndStoresTheS
     EXPECT_EQ(sess.csrf_token, stored.csrf_token);
 }
 
-TEST_F(WebApiAuthTest, EmptyApplicationAndOneTimeCodeAreNotSent) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    KOVA_CRED_SESS sess;
-    ASSERT_TRUE(CredRequestUtil::Login(&cred, &sess)) << LogDump();
-    kovasim::WebApiSim::LoginRecord login = Sim().LastLogin();
-    EXPECT_EQ(0u, login.params.count("session"));
-    EXPECT_EQ(0u, login.params.count("otp_code"));
-    // An unstored credential keeps its session in memory only.
-    KOVA_CRED_SESS *list = nullptr;
-    EXPECT_EQ(0, KOVACredSessListGet(&list, nullptr, nullptr));
-    KOVACredSessListFree(&list);
-}
-
 TEST_F(WebApiAuthTest, OneTimeCodeIsRequiredCheckedAndSent) {
     int id = StoreCred("otpuser", "secret");
     KOVA_CRED cred;
@@ -113,6 +99,9 @@ TEST_F(WebApiAuthTest, WrongPasswordStoresNothing) {
     EXPECT_TRUE(LogHas("Login response is invalid")) << LogDump();
     EXPECT_EQ(0, sess.filled);
     EXPECT_EQ("", SessionIdStored(id));
+    EXPECT_FALSE(CredRequestUtil::GetAccessToken(static_cast<long>(id), &sess));
+    EXPECT_TRUE(LogHas("Cannot get access token from id=[" + std::to_string(id) + "]"))
+        << LogDump();
 
     EXPECT_FALSE(CredRequestUtil::Login(4242L, &sess));
     EXPECT_TRUE(LogHas("Cannot find id[4242] in database")) << LogDump();
@@ -146,8 +135,7 @@ class WebApiAesTest : public WebApiAuthTest {
 
 TEST_F(WebApiAesTest, ParametersTravelInTheAesEnvelope) {
     KOVACloudServiceHxtokenSetProvider(&SimTokenProvider);
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     KOVA_CRED_SESS sess;
     sess.access_token = "S1";
     Json::Value params;
@@ -167,12 +155,22 @@ TEST_F(WebApiAesTest, ParametersTravelInTheAesEnvelope) {
     EXPECT_TRUE(wire.HasParam("__tXeTrEhPiC"));
     EXPECT_EQ("\"tok-0123456789\"", wire.Param("__nEkOtReHpIc"));
     EXPECT_FALSE(wire.HasParam("color"));
+
+    // A key other than the server's is a bad envelope.
+    KOVACloudServiceHxtokenSetProvider(&WrongKeyProvider);
+    CredRequest wrongKey;
+    ASSERT_TRUE(CredRequest::CreateWebAPIRequest(&wrongKey, &cred, &sess, "KOVA.Demo.Echo", 1,
+                                                 "echo", params));
+    ASSERT_TRUE(wrongKey.SetEncryptMode(KOVA::CRED_REQ_CRYPTO_AES));
+    ASSERT_TRUE(wrongKey.Process(true, 0));
+    answer = ParseBody(wrongKey.GetResponse());
+    EXPECT_FALSE(answer["success"].asBool());
+    EXPECT_EQ(kovasim::WebApiSim::kErrBadEnvelope, answer["error"]["code"].asInt());
 }
 
 TEST_F(WebApiAesTest, LoginThroughTheAesEnvelope) {
     KOVACloudServiceHxtokenSetProvider(&SimTokenProvider);
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     CredRequest request;
     ASSERT_TRUE(CredRequestUtil::SetWebAPIURL(&cred, "KOVA.API.Auth", 3, "login", &request));
     request.AddPostParam("account", "admin");
@@ -186,24 +184,8 @@ TEST_F(WebApiAesTest, LoginThroughTheAesEnvelope) {
     EXPECT_EQ("admin", Sim().LastLogin().params["account"]);
 }
 
-TEST_F(WebApiAesTest, WrongKeyIsABadEnvelope) {
-    KOVACloudServiceHxtokenSetProvider(&WrongKeyProvider);
-    KOVA_CRED cred;
-    FillCred(cred);
-    KOVA_CRED_SESS sess;
-    CredRequest request;
-    ASSERT_TRUE(CredRequest::CreateWebAPIRequest(&request, &cred, &sess, "KOVA.Demo.Echo", 1,
-                                                 "echo", Json::Value()));
-    ASSERT_TRUE(request.SetEncryptMode(KOVA::CRED_REQ_CRYPTO_AES));
-    ASSERT_TRUE(request.Process(true, 0));
-    Json::Value answer = ParseBody(request.GetResponse());
-    EXPECT_FALSE(answer["success"].asBool());
-    EXPECT_EQ(kovasim::WebApiSim::kErrBadEnvelope, answer["error"]["code"].asInt());
-}
-
 TEST_F(WebApiAuthTest, StaleCiphertokenIsRefused) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     Sim().SetTokenWindow(-1);  // every server time is already too old
     Json::Value response;
     EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "", nullptr, &response));
@@ -236,14 +218,6 @@ TEST_F(WebApiAuthTest, AccessTokenReusesTheStoredSessionWithoutTraffic) {
     EXPECT_EQ(2u, LogCount("Bad parameters"));
 }
 
-TEST_F(WebApiAuthTest, AccessTokenFailsWhenTheLoginFails) {
-    int id = StoreCred("admin", "wrong");
-    KOVA_CRED_SESS sess;
-    EXPECT_FALSE(CredRequestUtil::GetAccessToken(static_cast<long>(id), &sess));
-    EXPECT_TRUE(LogHas("Cannot get access token from id=[" + std::to_string(id) + "]"))
-        << LogDump();
-}
-
 TEST_F(WebApiAuthTest, LogoutSendsSidAndCookieAndEndsTheSession) {
     int id = StoreCred();
     KOVA_CRED_SESS sess;
@@ -273,8 +247,7 @@ TEST_F(WebApiAuthTest, LogoutRefusesMissingInputs) {
     EXPECT_TRUE(LogHas("Cannot find id[" + std::to_string(id) + "] in sess")) << LogDump();
     EXPECT_FALSE(CredRequestUtil::Logout(777L));
     EXPECT_TRUE(LogHas("Cannot find id[777] in cred"));
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     EXPECT_FALSE(CredRequestUtil::Logout(&cred, std::string()));
     EXPECT_FALSE(CredRequestUtil::Logout(&cred, static_cast<KOVA_CRED_SESS *>(nullptr)));
     EXPECT_EQ(2u, LogCount("Bad parameters"));
@@ -287,15 +260,9 @@ class WebApiBadAnswerTest : public WebApiAuthTest,
 
 TEST_P(WebApiBadAnswerTest, IsAnInvalidResponse) {
     const std::string body = GetParam();
-    kovasim::LoopbackServer bad;
-    bad.Route("*", "/webapi/auth.cgi", [body](const httplib::Request &, httplib::Response &res) {
-        res.set_content(body, "application/json");
-    });
-    Sim().Install(bad);  // discovery and encryption from the simulator
-    ASSERT_TRUE(bad.Start());
-    KOVA_CRED cred;
-    FillCred(cred);
-    cred.port = bad.Port();
+    auto bad = FixedAnswer("/webapi/auth.cgi", body, true);
+    KOVA_CRED cred = Cred();
+    cred.port = bad->Port();
     cred.id = 99;  // not stored: nothing to write back
     KOVA_CRED_SESS sess;
     Json::Value response(Json::objectValue);
@@ -322,16 +289,9 @@ TEST_F(WebApiAuthTest, LoginAnswerIsReadLenientlyButLogoutAnswerMustBeWhole) {
     const std::string body =
         "/* session */ {\"success\":true,\"data\":{\"sid\":\"S-1\",\"kovatoken\":\"T-1\"}}"
         "\n<!-- served in 1 ms -->";
-    kovasim::LoopbackServer lenient;
-    lenient.Route("*", "/webapi/auth.cgi",
-                  [body](const httplib::Request &, httplib::Response &res) {
-                      res.set_content(body, "application/json");
-                  });
-    Sim().Install(lenient);  // discovery and encryption from the simulator
-    ASSERT_TRUE(lenient.Start());
-    KOVA_CRED cred;
-    FillCred(cred);
-    cred.port = lenient.Port();
+    auto lenient = FixedAnswer("/webapi/auth.cgi", body, true);
+    KOVA_CRED cred = Cred();
+    cred.port = lenient->Port();
     KOVA_CRED_SESS sess;
     Json::Value response;
     ASSERT_TRUE(CredRequestUtil::LoginWithOTP(&cred, "", &sess, &response)) << LogDump();
@@ -345,8 +305,7 @@ TEST_F(WebApiAuthTest, LoginAnswerIsReadLenientlyButLogoutAnswerMustBeWhole) {
 }
 
 TEST_F(WebApiAuthTest, LoginTransferFailureIsReported) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     CredRequestUtil::GetWebAPIDesc(&cred);  // cached, so only the login itself fails
     kovasim::LoopbackServer failing;
     failing.Route("*", "/webapi/.*",
@@ -380,39 +339,32 @@ class WebApiRedirectTest : public WebApiAuthTest {
     std::unique_ptr<kovasim::LoopbackServer> redirect_;
 };
 
-TEST_F(WebApiRedirectTest, PlainHttpCredentialFollowsTheServersRedirect) {
-    for (const char *protocol : {"http", "Http", "HTTP"}) {
-        KOVA_CRED cred;
-        FillCred(cred);
-        cred.protocol = protocol;
+TEST_F(WebApiRedirectTest, OnlyPlainHttpCredentialsAreProbedAndFollowTheRedirect) {
+    const struct {
+        const char *protocol;
+        bool probed;
+    } cases[] = {{"http", true},   {"Http", true},   {"HTTP", true},
+                 {"https", false}, {"HTTPS", false}, {"Https", false}};
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.protocol);
+        KOVA_CRED cred = Cred();
+        cred.protocol = c.protocol;
         cred.port = redirect_->Port();
         redirect_->ClearRecords();
-        ASSERT_TRUE(CredRequestUtil::CheckRedirect(&cred)) << protocol << LogDump();
-        EXPECT_EQ("https", cred.protocol);
+        ASSERT_TRUE(CredRequestUtil::CheckRedirect(&cred)) << LogDump();
+        EXPECT_EQ(c.probed ? "https" : c.protocol, cred.protocol);
         EXPECT_EQ("127.0.0.1", cred.host);
-        EXPECT_EQ(https_->Port(), cred.port);
-        ASSERT_EQ(1u, redirect_->RequestCount());
-        EXPECT_EQ("/webapi/query.cgi", redirect_->Last().path);
+        EXPECT_EQ(c.probed ? https_->Port() : redirect_->Port(), cred.port);
+        ASSERT_EQ(c.probed ? 1u : 0u, redirect_->RequestCount());
+        if (c.probed) {
+            EXPECT_EQ("/webapi/query.cgi", redirect_->Last().path);
+        }
     }
-}
-
-TEST_F(WebApiRedirectTest, HttpsCredentialsAreNeverProbed) {
-    for (const char *protocol : {"https", "HTTPS", "Https"}) {
-        KOVA_CRED cred;
-        FillCred(cred);
-        cred.protocol = protocol;
-        cred.port = redirect_->Port();
-        EXPECT_TRUE(CredRequestUtil::CheckRedirect(&cred));
-        EXPECT_EQ(protocol, cred.protocol);
-        EXPECT_EQ(redirect_->Port(), cred.port);
-    }
-    EXPECT_EQ(0u, redirect_->RequestCount());
     EXPECT_FALSE(CredRequestUtil::CheckRedirect(nullptr));
 }
 
-TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTarget) {
-    KOVA_CRED cred;
-    FillCred(cred);
+TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTargetWithOnlyTheGivenFields) {
+    KOVA_CRED cred = Cred();
     cred.port = redirect_->Port();
     KOVA_CRED_SESS sess;
     ASSERT_TRUE(CredRequestUtil::Login(&cred, &sess)) << LogDump();
@@ -420,16 +372,20 @@ TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTarget) {
     EXPECT_EQ("https", cred.protocol);
     EXPECT_EQ(https_->Port(), cred.port);
     EXPECT_EQ(1u, https_->CountPath("/webapi/auth.cgi"));
+    // An empty application and one-time code are not sent.
+    kovasim::WebApiSim::LoginRecord login = Sim().LastLogin();
+    EXPECT_EQ(0u, login.params.count("session"));
+    EXPECT_EQ(0u, login.params.count("otp_code"));
+    // An unstored credential keeps its session in memory only.
+    KOVA_CRED_SESS *list = nullptr;
+    EXPECT_EQ(0, KOVACredSessListGet(&list, nullptr, nullptr));
+    KOVACredSessListFree(&list);
 }
 
 TEST_F(WebApiRedirectTest, RefusedProbeLetsTheRequestReportItsOwnError) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    {
-        kovasim::LoopbackServer closed;
-        ASSERT_TRUE(closed.Start());
-        cred.port = closed.Port();
-    }
+    KOVA_CRED cred = Cred();
+    kovasim::RefusedPort closed;
+    cred.port = closed.Port();
     int port = cred.port;
     EXPECT_TRUE(CredRequestUtil::CheckRedirect(&cred));
     EXPECT_EQ("http", cred.protocol);
@@ -438,58 +394,45 @@ TEST_F(WebApiRedirectTest, RefusedProbeLetsTheRequestReportItsOwnError) {
     EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, CredRequestUtil::m_errCode);
 }
 
-TEST_F(WebApiRedirectTest, RedirectWithoutUsableLocationFails) {
-    kovasim::LoopbackServer odd;
-    odd.Route("*", "/webapi/query.cgi", [](const httplib::Request &req, httplib::Response &res) {
-        res.status = 302;
-        if (req.has_header("X-Unused")) {
-            return;
-        }
-        res.set_header("X-Note", "no location");
-    });
-    odd.Route("*", "/bad/.*",
-              [](const httplib::Request &, httplib::Response &res) { res.status = 302; });
-    ASSERT_TRUE(odd.Start());
-    KOVA_CRED cred;
-    FillCred(cred);
-    cred.port = odd.Port();
-    EXPECT_FALSE(CredRequestUtil::CheckRedirect(&cred));
-    EXPECT_TRUE(LogHas("Return 302, but no Location in header.")) << LogDump();
-    EXPECT_FALSE(CredRequestUtil::Login(&cred, nullptr));
-    EXPECT_TRUE(LogHas("CheckRedirect failed.")) << LogDump();
-
-    kovasim::LoopbackServer unparsable;
-    unparsable.Route("*", "/webapi/query.cgi",
-                     [](const httplib::Request &, httplib::Response &res) {
-                         res.set_redirect("https://[fe80::1", 302);
-                     });
-    ASSERT_TRUE(unparsable.Start());
-    cred.port = unparsable.Port();
-    EXPECT_FALSE(CredRequestUtil::CheckRedirect(&cred));
-    EXPECT_TRUE(LogHas("Can not identify 302 Location: https://[fe80::1.")) << LogDump();
-}
-
-TEST_F(WebApiRedirectTest, LocationIsParsedAsTheServerSentIt) {
+TEST_F(WebApiRedirectTest, LocationIsTakenAsTheServerSentIt) {
     // A blank in front of the address hides its scheme from the split: the credential stays
     // plain HTTP and the text before the last colon becomes its host.
-    kovasim::LoopbackServer odd;
-    odd.Route("*", "/webapi/query.cgi", [](const httplib::Request &, httplib::Response &res) {
-        res.status = 302;
-        res.set_header("Location", " https://127.0.0.1:5001/");
-    });
-    ASSERT_TRUE(odd.Start());
-    KOVA_CRED cred;
-    FillCred(cred);
-    cred.port = odd.Port();
-    ASSERT_TRUE(CredRequestUtil::CheckRedirect(&cred)) << LogDump();
-    EXPECT_EQ("http", cred.protocol);
-    EXPECT_EQ(" https", cred.host);
-    EXPECT_EQ(0, cred.port);
+    const struct {
+        const char *location;  // nullptr: no Location header at all
+        const char *log;       // nullptr: the probe succeeds
+    } cases[] = {{nullptr, "Return 302, but no Location in header."},
+                 {"https://[fe80::1", "Can not identify 302 Location: https://[fe80::1."},
+                 {" https://127.0.0.1:5001/", nullptr}};
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.location ? c.location : "none");
+        ClearLog();
+        kovasim::LoopbackServer odd;
+        const char *location = c.location;
+        odd.Route("*", "/webapi/query.cgi",
+                  [location](const httplib::Request &, httplib::Response &res) {
+                      res.status = 302;
+                      if (location != nullptr) {
+                          res.set_header("Location", location);
+                      }
+                  });
+        ASSERT_TRUE(odd.Start());
+        KOVA_CRED cred = Cred();
+        cred.port = odd.Port();
+        EXPECT_EQ(c.log == nullptr, CredRequestUtil::CheckRedirect(&cred));
+        if (c.log != nullptr) {
+            EXPECT_TRUE(LogHas(c.log)) << LogDump();
+            EXPECT_FALSE(CredRequestUtil::Login(&cred, nullptr));
+            EXPECT_TRUE(LogHas("CheckRedirect failed.")) << LogDump();
+        } else {
+            EXPECT_EQ("http", cred.protocol);
+            EXPECT_EQ(" https", cred.host);
+            EXPECT_EQ(0, cred.port);
+        }
+    }
 }
 
 TEST_F(WebApiAuthTest, SetWebApiUrlPlacesStandardParametersByFormat) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     CredRequest json;
     ASSERT_TRUE(CredRequestUtil::SetWebAPIURL(&cred, "KOVA.Demo.Json", 1, "get", &json));
     EXPECT_EQ("JSON", json.GetRequestFormat());

@@ -10,27 +10,17 @@ namespace {
 
 using KOVA::CredRequestUtil;
 
-class WebApiDescTest : public WebApiTest {};
-
-// A server whose discovery CGI answers with a fixed body.
-class FixedAnswerServer {
-  public:
-    explicit FixedAnswerServer(const std::string &body) {
-        server_.Route("*", "/webapi/query.cgi",
-                      [body](const httplib::Request &, httplib::Response &res) {
-                          res.set_content(body, "text/html");
-                      });
-        EXPECT_TRUE(server_.Start());
+class WebApiDescTest : public WebApiTest {
+  protected:
+    // A credential of a server whose discovery CGI answers with `body` only.
+    static std::unique_ptr<kovasim::LoopbackServer> FixedQuery(const std::string &body,
+                                                               KOVA_CRED &cred, int id) {
+        auto server = FixedAnswer("/webapi/query.cgi", body, false);
+        FillCred(cred);
+        cred.port = server->Port();
+        cred.id = id;
+        return server;
     }
-    void Fill(KOVA_CRED &cred) const {
-        cred.protocol = "http";
-        cred.host = "127.0.0.1";
-        cred.port = server_.Port();
-    }
-    size_t Hits() const { return server_.CountPath("/webapi/query.cgi"); }
-
-  private:
-    kovasim::LoopbackServer server_;
 };
 
 TEST_F(WebApiDescTest, DiscoversOncePerCredentialAndAnswersFromTheCache) {
@@ -52,17 +42,13 @@ TEST_F(WebApiDescTest, DiscoversOncePerCredentialAndAnswersFromTheCache) {
     EXPECT_EQ(before + 1, Sim().QueryHits());
 
     // What reached the wire: one POST with the three standard parameters only.
-    ASSERT_EQ(1u, PathCount("/webapi/query.cgi"));
+    ASSERT_EQ(1u, Server().CountPath("/webapi/query.cgi"));
     kovasim::RecordedRequest query = Server().Requests().front();
     EXPECT_EQ("POST", query.method);
     EXPECT_EQ("KOVA.API.Info", query.Param("api"));
     EXPECT_EQ("1", query.Param("version"));
     EXPECT_EQ("query", query.Param("method"));
-    std::set<std::string> names;
-    for (const auto &p : query.params) {
-        names.insert(p.first);
-    }
-    EXPECT_EQ((std::set<std::string>{"api", "method", "version"}), names);
+    EXPECT_EQ((std::set<std::string>{"api", "method", "version"}), ParamNames(query));
 
     const Json::Value &entry = CredRequestUtil::m_jsData["webapiDesc"][std::to_string(id)];
     EXPECT_EQ("delay.cgi", entry["KOVA.Demo.Delay"]["path"].asString());
@@ -70,8 +56,7 @@ TEST_F(WebApiDescTest, DiscoversOncePerCredentialAndAnswersFromTheCache) {
 }
 
 TEST_F(WebApiDescTest, UnknownApiSetsErrorSixAndIsQueriedAgain) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     cred.id = 41;
     size_t before = Sim().QueryHits();
 
@@ -90,89 +75,60 @@ TEST_F(WebApiDescTest, UnknownApiSetsErrorSixAndIsQueriedAgain) {
     EXPECT_EQ(before + 2, Sim().QueryHits());
     EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&cred, "KOVA.Demo.Echo"));
     EXPECT_EQ(before + 2, Sim().QueryHits());
-}
-
-TEST_F(WebApiDescTest, FormatOfAnUnknownApiIsEmptyButSucceeds) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    cred.id = 42;
+    // The format of an unknown API is empty, yet the look-up succeeds.
     std::string format = "unchanged";
     EXPECT_TRUE(CredRequestUtil::GetWebAPIRequestFormat(&cred, "KOVA.No.Such", format));
     EXPECT_EQ("", format);
-    EXPECT_TRUE(CredRequestUtil::IsCredIdCached(42));
 }
 
-TEST_F(WebApiDescTest, HtmlInsteadOfJsonIsRejectedWithoutCacheEntry) {
-    FixedAnswerServer html("<html><body>It works</body></html>");
-    KOVA_CRED cred;
-    html.Fill(cred);
-    cred.id = 7;
-    EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
-    EXPECT_TRUE(LogHas("Query response is invalid")) << LogDump();
-    EXPECT_FALSE(CredRequestUtil::IsCredIdCached(7));
-    EXPECT_EQ(0, CredRequestUtil::m_errCode);
+TEST_F(WebApiDescTest, UnusableAnswersAreNotCached) {
+    const struct {
+        const char *body;
+        const char *log;
+    } cases[] = {{"<html><body>It works</body></html>", "Query response is invalid"},
+                 {"{\"success\":false,\"error\":{\"code\":105}}", "Query request fail!"},
+                 {"[\"success\"]", "Query request fail!"}};
+    int id = 7;
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.body);
+        ClearLog();
+        KOVA_CRED cred;
+        auto server = FixedQuery(c.body, cred, ++id);
+        EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
+        EXPECT_TRUE(LogHas(c.log)) << LogDump();
+        EXPECT_FALSE(CredRequestUtil::IsCredIdCached(id));
+        EXPECT_EQ(0, CredRequestUtil::m_errCode);
+    }
 
+    // Without a description every look-up asks again and fails.
     ClearLog();
+    KOVA_CRED cred;
+    auto html = FixedQuery(cases[0].body, cred, 7);
     EXPECT_EQ("", CredRequestUtil::GetWebAPIPath(&cred, "KOVA.Demo.Echo"));
     EXPECT_TRUE(LogHas("cannot get cgi path from id=[7]")) << LogDump();
     std::string format;
     EXPECT_FALSE(CredRequestUtil::GetWebAPIRequestFormat(&cred, "KOVA.Demo.Echo", format));
     EXPECT_TRUE(LogHas("Cannot find api[KOVA.Demo.Echo] description")) << LogDump();
-    EXPECT_EQ(3u, html.Hits());
-}
+    EXPECT_EQ(2u, html->CountPath("/webapi/query.cgi"));
 
-TEST_F(WebApiDescTest, UnsuccessfulAnswerIsNotCached) {
-    FixedAnswerServer refusing("{\"success\":false,\"error\":{\"code\":105}}");
-    KOVA_CRED cred;
-    refusing.Fill(cred);
-    cred.id = 8;
-    EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
-    EXPECT_TRUE(LogHas("Query request fail!")) << LogDump();
-    EXPECT_FALSE(CredRequestUtil::IsCredIdCached(8));
-    EXPECT_EQ(0, CredRequestUtil::m_errCode);
-}
-
-TEST_F(WebApiDescTest, OddlyShapedAnswersNeverThrow) {
-    FixedAnswerServer odd("{\"success\":true,\"data\":[1,2,3]}");
-    KOVA_CRED cred;
-    odd.Fill(cred);
-    cred.id = 9;
+    // A successful answer whose data is no object never throws.
+    auto odd = FixedQuery("{\"success\":true,\"data\":[1,2,3]}", cred, 20);
     EXPECT_EQ("", CredRequestUtil::GetWebAPIPath(&cred, "KOVA.Demo.Echo"));
-    std::string format = "x";
+    format = "x";
     EXPECT_TRUE(CredRequestUtil::GetWebAPIRequestFormat(&cred, "KOVA.Demo.Echo", format));
     EXPECT_EQ("", format);
-
-    FixedAnswerServer scalar("[\"success\"]");
-    scalar.Fill(cred);
-    cred.id = 10;
-    EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
-    EXPECT_TRUE(LogHas("Query request fail!"));
 }
 
 TEST_F(WebApiDescTest, FailedTransferSetsErrorFive) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    {
-        kovasim::LoopbackServer closed;
-        ASSERT_TRUE(closed.Start());
-        cred.port = closed.Port();
-        closed.Stop();
-    }
+    KOVA_CRED cred = Cred();
+    kovasim::RefusedPort closed;
+    cred.port = closed.Port();
     cred.id = 11;
     EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, CredRequestUtil::m_errCode);
     EXPECT_TRUE(LogHas("Cred Error:[http://127.0.0.1:" + std::to_string(cred.port) +
                        "/webapi/query.cgi][20]"))
         << LogDump();
-}
-
-TEST_F(WebApiDescTest, UnstoredCredentialIsCachedUnderMinusOne) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    ASSERT_EQ(-1, cred.id);
-    EXPECT_EQ("encryption.cgi", CredRequestUtil::GetWebAPIPath(&cred, "KOVA.API.Encryption"));
-    EXPECT_TRUE(CredRequestUtil::IsCredIdCached(-1));
-    EXPECT_TRUE(CredRequestUtil::m_jsData["webapiDesc"].isMember("-1"));
 }
 
 TEST_F(WebApiDescTest, TwoCredentialsOfOneServerAreCachedSeparately) {
@@ -197,6 +153,12 @@ TEST_F(WebApiDescTest, TwoCredentialsOfOneServerAreCachedSeparately) {
     EXPECT_EQ(before + 2, Sim().QueryHits());
     EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&a, "KOVA.Demo.Echo"));
     EXPECT_EQ(before + 3, Sim().QueryHits());
+
+    // An unstored credential is cached under -1.
+    KOVA_CRED unstored = Cred();
+    ASSERT_EQ(-1, unstored.id);
+    EXPECT_EQ("encryption.cgi", CredRequestUtil::GetWebAPIPath(&unstored, "KOVA.API.Encryption"));
+    EXPECT_TRUE(CredRequestUtil::m_jsData["webapiDesc"].isMember("-1"));
 }
 
 TEST_F(WebApiDescTest, BadArgumentsAndUnknownIdsAreRefusedWithoutTraffic) {

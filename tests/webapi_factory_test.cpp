@@ -26,67 +26,60 @@ File StreamWith(const std::string &text) {
     return f;
 }
 
-std::set<std::string> ParamNames(const kovasim::RecordedRequest &r) {
-    std::set<std::string> names;
-    for (const auto &p : r.params) {
-        names.insert(p.first);
-    }
-    return names;
-}
-
 class WebApiFactoryTest : public WebApiTest {
   protected:
     std::string EntryUrl() const { return Server().BaseUrl() + "/webapi/entry.cgi"; }
+
+    // A request for the entry CGI that asks who its session belongs to.
+    void WhoAmI(CredRequest &request) const {
+        request.SetURL(EntryUrl());
+        request.AddPostParam("api", "KOVA.Demo.Session");
+        request.AddPostParam("version", "1");
+        request.AddPostParam("method", "whoami");
+    }
 };
 
 TEST_F(WebApiFactoryTest, RecordFormSendsSessionAsPostCookieAndTokenInQuery) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    KOVA_CRED_SESS sess;
-    sess.access_token = "S1";
-    sess.csrf_token = "T1";
-    Json::Value params;
-    params["x"] = "1";
-    std::unique_ptr<CredRequest> request(
-        CredRequest::CreateWebAPIRequest(&cred, &sess, "KOVA.Demo.Echo", 2, "echo", params));
-    ASSERT_TRUE(request) << LogDump();
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError());
-    ASSERT_TRUE(request->Process(true, 0));
+    // An empty session still sends "_sid", but no cookie and no token.
+    const struct {
+        const char *sid, *token, *query, *cookie;  // cookie nullptr: no Cookie header
+        std::set<std::string> names;
+    } cases[] = {{"S1",
+                  "T1",
+                  "&KovaToken=T1",
+                  "id=S1",
+                  {"KovaToken", "_sid", "api", "method", "version", "x"}},
+                 {"", "", "", nullptr, {"_sid", "api", "method", "version", "x"}}};
+    KOVA_CRED cred = Cred();
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.sid);
+        KOVA_CRED_SESS sess;
+        sess.access_token = c.sid;
+        sess.csrf_token = c.token;
+        Json::Value params;
+        params["x"] = "1";
+        std::unique_ptr<CredRequest> request(
+            CredRequest::CreateWebAPIRequest(&cred, &sess, "KOVA.Demo.Echo", 2, "echo", params));
+        ASSERT_TRUE(request) << LogDump();
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError());
+        ASSERT_TRUE(request->Process(true, 0));
 
-    kovasim::RecordedRequest wire = Server().Last();
-    EXPECT_EQ("/webapi/entry.cgi", wire.path);
-    EXPECT_EQ("POST", wire.method);
-    // The token is appended behind the (here empty) encoded query parameters.
-    EXPECT_EQ("&KovaToken=T1", wire.query);
-    EXPECT_EQ("T1", wire.Param("KovaToken"));
-    EXPECT_EQ("id=S1", wire.Header("Cookie"));
-    EXPECT_EQ((std::set<std::string>{"KovaToken", "_sid", "api", "method", "version", "x"}),
-              ParamNames(wire));
-    EXPECT_EQ("S1", wire.Param("_sid"));
-    EXPECT_NE(std::string::npos, wire.body.find("_sid=S1"));
-    Json::Value answer = ParseBody(request->GetResponse());
-    EXPECT_EQ("1", answer["data"]["params"]["x"].asString());
-}
-
-TEST_F(WebApiFactoryTest, EmptySessionStillSendsSidButNoCookieOrToken) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    KOVA_CRED_SESS sess;
-    CredRequest request;
-    ASSERT_TRUE(CredRequest::CreateWebAPIRequest(&request, &cred, &sess, "KOVA.Demo.Echo", 1,
-                                                 "echo", Json::Value()));
-    ASSERT_TRUE(request.Process(true, 0));
-    kovasim::RecordedRequest wire = Server().Last();
-    EXPECT_TRUE(wire.HasParam("_sid"));
-    EXPECT_EQ("", wire.Param("_sid"));
-    EXPECT_FALSE(wire.HasHeader("Cookie"));
-    EXPECT_EQ("", wire.query);
-    EXPECT_EQ((std::set<std::string>{"_sid", "api", "method", "version"}), ParamNames(wire));
+        kovasim::RecordedRequest wire = Server().Last();
+        EXPECT_EQ("/webapi/entry.cgi", wire.path);
+        EXPECT_EQ("POST", wire.method);
+        // The token is appended behind the (here empty) encoded query parameters.
+        EXPECT_EQ(c.query, wire.query);
+        EXPECT_EQ(c.cookie != nullptr, wire.HasHeader("Cookie"));
+        EXPECT_EQ(c.cookie ? c.cookie : "", wire.Header("Cookie"));
+        EXPECT_EQ(c.names, ParamNames(wire));
+        EXPECT_EQ(c.sid, wire.Param("_sid"));
+        EXPECT_NE(std::string::npos, wire.body.find(std::string("_sid=") + c.sid));
+        EXPECT_EQ("1", ParseBody(request->GetResponse())["data"]["params"]["x"].asString());
+    }
 }
 
 TEST_F(WebApiFactoryTest, JsonFormatApiGetsJsonEncodedValues) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     KOVA_CRED_SESS sess;
     Json::Value params;
     params["count"] = 5;
@@ -104,8 +97,7 @@ TEST_F(WebApiFactoryTest, JsonFormatApiGetsJsonEncodedValues) {
 }
 
 TEST_F(WebApiFactoryTest, FillFormErrorCodes) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     KOVA_CRED_SESS sess;
     EXPECT_FALSE(CredRequest::CreateWebAPIRequest(nullptr, &cred, &sess, "KOVA.Demo.Echo", 1,
                                                   "echo", Json::Value()));
@@ -156,21 +148,15 @@ TEST_F(WebApiFactoryTest, FillFormErrorCodes) {
     EXPECT_TRUE(CredRequest::CreateWebAPIRequest(&reused, &cred, &sess, "KOVA.Demo.Echo", 1, "echo",
                                                  Json::Value()));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, reused.GetError());
-}
 
-TEST_F(WebApiFactoryTest, UnreachableServerLeavesQueryFailure) {
-    KOVA_CRED cred;
-    FillCred(cred);
-    {
-        kovasim::LoopbackServer closed;
-        ASSERT_TRUE(closed.Start());
-        cred.port = closed.Port();
-    }
-    KOVA_CRED_SESS sess;
-    CredRequest request;
-    EXPECT_FALSE(CredRequest::CreateWebAPIRequest(&request, &cred, &sess, "KOVA.Demo.Echo", 1,
+    // A server that cannot be reached leaves the query failure.
+    kovasim::RefusedPort closed;
+    cred.port = closed.Port();
+    cred.id = 50;  // not described yet
+    CredRequest unreachable;
+    EXPECT_FALSE(CredRequest::CreateWebAPIRequest(&unreachable, &cred, &sess, "KOVA.Demo.Echo", 1,
                                                   "echo", Json::Value()));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, request.GetError());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, unreachable.GetError());
 }
 
 TEST_F(WebApiFactoryTest, CredentialIdFormLogsInOnceAndReusesTheSession) {
@@ -195,18 +181,14 @@ TEST_F(WebApiFactoryTest, CredentialIdFormLogsInOnceAndReusesTheSession) {
     EXPECT_EQ(nullptr,
               CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Echo", 0, "echo", Json::Value()));
     EXPECT_TRUE(LogHas("Bad parameters"));
-}
 
-TEST_F(WebApiFactoryTest, CredentialIdFormFailsForUnknownIdOrFailedLogin) {
-    EXPECT_EQ(nullptr,
-              CredRequest::CreateWebAPIRequest(999L, "KOVA.Demo.Echo", 1, "echo", Json::Value()));
-    EXPECT_TRUE(LogHas("GetAccessToken fail")) << LogDump();
-
-    ClearLog();
-    int id = StoreCred("admin", "wrong");
-    EXPECT_EQ(nullptr,
-              CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Echo", 1, "echo", Json::Value()));
-    EXPECT_TRUE(LogHas("GetAccessToken fail")) << LogDump();
+    // An unknown id and a failed login both fail the access token.
+    for (long bad : {999L, static_cast<long>(StoreCred("admin", "wrong"))}) {
+        ClearLog();
+        EXPECT_EQ(nullptr, CredRequest::CreateWebAPIRequest(bad, "KOVA.Demo.Echo", 1, "echo",
+                                                            Json::Value()));
+        EXPECT_TRUE(LogHas("GetAccessToken fail")) << bad << LogDump();
+    }
 }
 
 TEST_F(WebApiFactoryTest, RelayRequestReadsItsBodyFromTheStreams) {
@@ -251,10 +233,7 @@ TEST_F(WebApiFactoryTest, ProcessWithLoginAttachesAFreshSession) {
 
     int id = StoreCred();
     CredRequest request;
-    request.SetURL(EntryUrl());
-    request.AddPostParam("api", "KOVA.Demo.Session");
-    request.AddPostParam("version", "1");
-    request.AddPostParam("method", "whoami");
+    WhoAmI(request);
     ASSERT_TRUE(request.ProcessWithLogin(id, true, 0)) << LogDump();
     Json::Value answer = ParseBody(request.GetResponse());
     ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
@@ -265,19 +244,22 @@ TEST_F(WebApiFactoryTest, ProcessWithLoginAttachesAFreshSession) {
 }
 
 TEST_F(WebApiFactoryTest, RequestLoginAndLogout) {
-    CredRequest empty;
-    EXPECT_FALSE(empty.Login("", "pw", ""));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, empty.GetError());
-
-    CredRequest badUrl;
-    EXPECT_FALSE(badUrl.Login("admin", "secret", "https://[fe80::1"));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, badUrl.GetError());
+    const struct {
+        const char *account;
+        const char *url;  // nullptr: the request's own URL
+        bool ownUrl;
+    } refused[] = {{"", "", false}, {"admin", "https://[fe80::1", false}, {"", nullptr, true}};
+    for (const auto &c : refused) {
+        SCOPED_TRACE(std::string(c.account) + "@" + (c.url ? c.url : "own URL"));
+        CredRequest request;
+        if (c.ownUrl) {
+            request.SetURL(EntryUrl());
+        }
+        EXPECT_FALSE(c.url ? request.Login(c.account, "secret", c.url)
+                           : request.Login(c.account, "secret"));
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, request.GetError());
+    }
     EXPECT_TRUE(LogHas("parseURL Failed: https://[fe80::1")) << LogDump();
-
-    CredRequest noAccount;
-    noAccount.SetURL(EntryUrl());
-    EXPECT_FALSE(noAccount.Login("", "secret"));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_PARAM, noAccount.GetError());
 
     CredRequest wrong;
     wrong.SetURL(EntryUrl());
@@ -286,10 +268,7 @@ TEST_F(WebApiFactoryTest, RequestLoginAndLogout) {
     EXPECT_FALSE(wrong.Logout());
 
     CredRequest request;
-    request.SetURL(EntryUrl());
-    request.AddPostParam("api", "KOVA.Demo.Session");
-    request.AddPostParam("version", "1");
-    request.AddPostParam("method", "whoami");
+    WhoAmI(request);
     ASSERT_TRUE(request.Login("admin", "secret")) << LogDump();
     ASSERT_TRUE(request.Process(true, 0));
     Json::Value answer = ParseBody(request.GetResponse());
@@ -312,9 +291,9 @@ TEST_F(WebApiFactoryTest, ApiValidityUsesTheRequestsUrl) {
     EXPECT_FALSE(request.isAPIValid("KOVA.No.Such"));
     EXPECT_TRUE(CredRequestUtil::IsCredIdCached(-1));
     // An API the server does not list is never cached, so asking for it queries again.
-    EXPECT_EQ(2u, PathCount("/webapi/query.cgi"));
+    EXPECT_EQ(2u, Server().CountPath("/webapi/query.cgi"));
     EXPECT_TRUE(request.isAPIValid("KOVA.Demo.Echo"));
-    EXPECT_EQ(2u, PathCount("/webapi/query.cgi"));
+    EXPECT_EQ(2u, Server().CountPath("/webapi/query.cgi"));
 
     CredRequest noUrl;
     EXPECT_FALSE(noUrl.isAPIValid("KOVA.Demo.Echo"));

@@ -5,6 +5,7 @@
 #define KOVA_TESTS_WEBAPI_FIXTURE_H
 
 #include <memory>
+#include <set>
 #include <string>
 
 #include <gtest/gtest.h>
@@ -15,6 +16,7 @@
 #include "kovacredential/kovacredsetter.h"
 #include "platform/json_text.h"
 #include "simlib/loopback_server.h"
+#include "simlib/relay_sim.h"
 #include "simlib/webapi_sim.h"
 #include "support/interpose.h"
 #include "support/temp_dir.h"
@@ -63,6 +65,12 @@ class WebApiTest : public ::testing::Test {
         cred.application = application;
     }
 
+    static KOVA_CRED Cred() {
+        KOVA_CRED cred;
+        FillCred(cred);
+        return cred;
+    }
+
     // Stores a credential for the simulator; returns its id.
     static int StoreCred(const std::string &account = "admin",
                          const std::string &password = "secret",
@@ -74,9 +82,29 @@ class WebApiTest : public ::testing::Test {
         return cred.id;
     }
 
-    // Requests that reached `path` and named `api` (wire parameters or the simulator's
-    // records).
-    static size_t PathCount(const std::string &path) { return Server().CountPath(path); }
+    // A started server answering `path` with `body`; with `withSim` the simulator serves its
+    // other CGIs (discovery, encryption).
+    static std::unique_ptr<kovasim::LoopbackServer> FixedAnswer(const std::string &path,
+                                                                const std::string &body,
+                                                                bool withSim) {
+        auto server = std::make_unique<kovasim::LoopbackServer>();
+        server->Route("*", path, [body](const httplib::Request &, httplib::Response &res) {
+            res.set_content(body, "application/json");
+        });
+        if (withSim) {
+            Sim().Install(*server);
+        }
+        EXPECT_TRUE(server->Start()) << server->Error();
+        return server;
+    }
+
+    static std::set<std::string> ParamNames(const kovasim::RecordedRequest &r) {
+        std::set<std::string> names;
+        for (const auto &p : r.params) {
+            names.insert(p.first);
+        }
+        return names;
+    }
 
     static Json::Value ParseBody(const std::string &body) {
         Json::Value v;
