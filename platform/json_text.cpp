@@ -40,4 +40,16 @@ std::string JsonToString(const Json::Value &value) {
     return out.str();
 }
 
+std::string JsonText(const Json::Value &value) {
+    return value.isConvertibleTo(Json::stringValue) ? value.asString() : std::string();
+}
+
+bool JsonIsSuccess(const Json::Value &answer) {
+    if (!answer.isObject()) {
+        return false;
+    }
+    const Json::Value &success = answer["success"];
+    return success.isConvertibleTo(Json::booleanValue) && success.asBool();
+}
+
 }  // namespace kova

@@ -16,6 +16,12 @@ bool JsonFromString(const std::string &text, Json::Value &value);
 // The compact JSON text of `value` (no white space, UTF-8 kept as it is).
 std::string JsonToString(const Json::Value &value);
 
+// The text of a string, number or bool value; "" for null, arrays and objects.
+std::string JsonText(const Json::Value &value);
+
+// Whether a WebAPI answer is an object whose "success" reads as true.
+bool JsonIsSuccess(const Json::Value &answer);
+
 }  // namespace kova
 
 #endif  // KOVA_PLATFORM_JSON_TEXT_H

@@ -58,20 +58,28 @@ CredRequestPrivate::~CredRequestPrivate() {
     }
 }
 
+Json::Value *CredRequestPrivate::ObjectSlot(const std::string &key) {
+    Json::Value &slot = settings[key];
+    if (slot.isNull()) {
+        slot = Json::Value(Json::objectValue);
+    } else if (!slot.isObject()) {
+        error = CRED_REQ_ERR_BAD_PARAM;
+        return nullptr;
+    }
+    return &slot;
+}
+
 bool CredRequestPrivate::SetData(const std::string &key, const std::string &name,
                                  const std::string &value) {
     if (key.empty() || name.empty()) {
         error = CRED_REQ_ERR_BAD_PARAM;
         return false;
     }
-    Json::Value &slot = settings[key];
-    if (slot.isNull()) {
-        slot = Json::Value(Json::objectValue);
-    } else if (!slot.isObject()) {
-        error = CRED_REQ_ERR_BAD_PARAM;
+    Json::Value *slot = ObjectSlot(key);
+    if (slot == nullptr) {
         return false;
     }
-    slot[name] = value;
+    (*slot)[name] = value;
     return true;
 }
 
@@ -83,15 +91,12 @@ bool CredRequestPrivate::SetData(const std::string &key, const Json::Value &memb
     if (members.empty()) {
         return true;
     }
-    Json::Value &slot = settings[key];
-    if (slot.isNull()) {
-        slot = Json::Value(Json::objectValue);
-    } else if (!slot.isObject()) {
-        error = CRED_REQ_ERR_BAD_PARAM;
+    Json::Value *slot = ObjectSlot(key);
+    if (slot == nullptr) {
         return false;
     }
     for (auto it = members.begin(); it != members.end(); ++it) {
-        slot[it.name()] = *it;
+        (*slot)[it.name()] = *it;
     }
     return true;
 }

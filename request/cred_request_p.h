@@ -28,6 +28,9 @@ class CredRequestPrivate {
     bool SetData(const std::string &key, const std::string &name, const std::string &value);
     // Merges the members of an object into settings[key].
     bool SetData(const std::string &key, const Json::Value &members);
+    // settings[key] as an object (made when missing); null, with CRED_REQ_ERR_BAD_PARAM, when
+    // the key holds another type.
+    Json::Value *ObjectSlot(const std::string &key);
     // settings[key] = value; null, empty arrays and empty objects are rejected.
     bool SetRawData(const std::string &key, const Json::Value &value);
     // The whole document for an empty key; settings[key] for an empty name; the member;

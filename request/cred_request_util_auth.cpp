@@ -22,18 +22,6 @@ namespace {
 const char kUnit[] = "cred_request_util";
 const char kAuthApi[] = "KOVA.API.Auth";
 
-std::string Text(const Json::Value &v) {
-    return v.isConvertibleTo(Json::stringValue) ? v.asString() : "";
-}
-
-bool SuccessOf(const Json::Value &answer) {
-    if (!answer.isObject()) {
-        return false;
-    }
-    const Json::Value &v = answer["success"];
-    return v.isConvertibleTo(Json::booleanValue) && v.asBool();
-}
-
 // The response header `name`, compared without regard to case (servers differ in the case
 // they send); null when absent.
 Json::Value HeaderValue(const Json::Value &headers, const std::string &name) {
@@ -210,15 +198,15 @@ bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
         if (response != nullptr) {
             *response = answer;
         }
-        if (!parsed || !SuccessOf(answer) || !answer["data"].isObject()) {
+        if (!parsed || !kova::JsonIsSuccess(answer) || !answer["data"].isObject()) {
             request.SetError(CRED_REQ_ERR_INVALID_RESPONSE);
             kova::Log("%s:%d Login response is invalid", kUnit, kLineLoginInvalid);
             return false;
         }
         KOVA_CRED_SESS local;
         local.filled = 1;
-        local.access_token = Text(answer["data"]["sid"]);
-        local.csrf_token = Text(answer["data"]["kovatoken"]);
+        local.access_token = kova::JsonText(answer["data"]["sid"]);
+        local.csrf_token = kova::JsonText(answer["data"]["kovatoken"]);
         if (cred->id >= 0 && KOVACredSessSetByID(cred->id, &local) < 0) {
             kova::Log("%s:%d Set cred_sess fail. id=%ld", kUnit, kLineLoginStore,
                       static_cast<long>(cred->id));
@@ -335,7 +323,7 @@ bool CredRequestUtil::Logout(KOVA_CRED *cred, const std::string &sid) {
             return false;
         }
         Json::Value answer;
-        if (kova::JsonFromString(request.GetResponse(), answer) && SuccessOf(answer)) {
+        if (kova::JsonFromString(request.GetResponse(), answer) && kova::JsonIsSuccess(answer)) {
             return true;
         }
         request.SetError(CRED_REQ_ERR_INVALID_RESPONSE);

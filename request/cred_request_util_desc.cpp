@@ -64,16 +64,7 @@ std::string TextMember(const Json::Value &object, const char *name) {
     if (!object.isObject()) {
         return "";
     }
-    const Json::Value &v = object[name];
-    return v.isConvertibleTo(Json::stringValue) ? v.asString() : "";
-}
-
-bool SuccessOf(const Json::Value &answer) {
-    if (!answer.isObject()) {
-        return false;
-    }
-    const Json::Value &v = answer["success"];
-    return v.isConvertibleTo(Json::booleanValue) && v.asBool();
+    return kova::JsonText(object[name]);
 }
 
 }  // namespace
@@ -118,7 +109,7 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
             kova::Log("%s:%d Query response is invalid", kUnit, kLineDescInvalid);
             return false;
         }
-        if (!SuccessOf(answer)) {
+        if (!kova::JsonIsSuccess(answer)) {
             kova::Log("%s:%d Query request fail!", kUnit, kLineDescFail);
             return false;
         }

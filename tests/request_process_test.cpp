@@ -15,16 +15,11 @@
 #include "kovacredential/cred_request_util.h"
 #include "simlib/loopback_server.h"
 #include "support/interpose.h"
+#include "support/temp_dir.h"
 
 namespace {
 
-struct FileCloser {
-    void operator()(FILE *f) const {
-        if (f != nullptr)
-            fclose(f);
-    }
-};
-using File = std::unique_ptr<FILE, FileCloser>;
+using kova_test::File;
 
 std::string ReadAll(FILE *f) {
     fflush(f);

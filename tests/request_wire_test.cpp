@@ -16,13 +16,7 @@
 
 namespace {
 
-struct FileCloser {
-    void operator()(FILE *f) const {
-        if (f != nullptr)
-            fclose(f);
-    }
-};
-using File = std::unique_ptr<FILE, FileCloser>;
+using kova_test::File;
 
 // A temporary stream holding `text`, positioned at its start.
 File StreamWith(const std::string &text) {

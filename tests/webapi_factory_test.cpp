@@ -14,10 +14,7 @@ namespace {
 using KOVA::CredRequest;
 using KOVA::CredRequestUtil;
 
-struct FileCloser {
-    void operator()(FILE *f) const { fclose(f); }
-};
-using File = std::unique_ptr<FILE, FileCloser>;
+using kova_test::File;
 
 File StreamWith(const std::string &text) {
     File f(tmpfile());

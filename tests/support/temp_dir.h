@@ -2,6 +2,9 @@
 #ifndef KOVA_TESTS_SUPPORT_TEMP_DIR_H
 #define KOVA_TESTS_SUPPORT_TEMP_DIR_H
 
+#include <stdio.h>
+
+#include <memory>
 #include <string>
 
 namespace kova_test {
@@ -34,6 +37,16 @@ class TempDatabase {
     bool hadOld_ = false;
     std::string old_;
 };
+
+// An owned stdio stream, closed when it goes.
+struct FileCloser {
+    void operator()(FILE *f) const {
+        if (f != nullptr) {
+            fclose(f);
+        }
+    }
+};
+using File = std::unique_ptr<FILE, FileCloser>;
 
 // Runs a shell command, returning its exit status and (optionally) its standard output.
 int RunCommand(const std::string &command, std::string *out = nullptr);
