@@ -122,7 +122,7 @@ SqlText FormatListStatement(const char *base, const char *whereFormat, const cha
 }  // namespace
 
 std::string DatabasePath() {
-    const char *path = getenv("kovacredential_db");
+    const char *path = secure_getenv("kovacredential_db");
     return (path != nullptr && *path != '\0') ? path : kDefaultDatabasePath;
 }
 

@@ -8,8 +8,12 @@
 
 namespace kova {
 
-bool JsonFromString(const std::string &text, Json::Value &value) {
-    static const std::unique_ptr<Json::CharReader> reader = [] {
+namespace {
+
+// jsoncpp's readers and writers keep per-parse state, so each thread has its own pair; no
+// object is shared between threads.
+Json::CharReader &StrictReader() {
+    thread_local const std::unique_ptr<Json::CharReader> reader = [] {
         Json::CharReaderBuilder builder;
         Json::CharReaderBuilder::strictMode(&builder.settings_);
         builder["allowSpecialFloats"] = false;
@@ -18,9 +22,33 @@ bool JsonFromString(const std::string &text, Json::Value &value) {
         builder["strictRoot"] = false;
         return std::unique_ptr<Json::CharReader>(builder.newCharReader());
     }();
+    return *reader;
+}
+
+Json::StreamWriter &CompactWriter() {
+    thread_local const std::unique_ptr<Json::StreamWriter> writer = [] {
+        Json::StreamWriterBuilder builder;
+        builder["indentation"] = "";
+        builder["emitUTF8"] = true;
+        return std::unique_ptr<Json::StreamWriter>(builder.newStreamWriter());
+    }();
+    return *writer;
+}
+
+}  // namespace
+
+bool JsonFromString(const std::string &text, Json::Value &value) {
     Json::Value parsed;
     std::string errors;
-    if (text.empty() || !reader->parse(text.data(), text.data() + text.size(), &parsed, &errors)) {
+    bool ok = false;
+    try {
+        // A text nested deeper than the reader's limit makes jsoncpp throw instead of failing.
+        ok = !text.empty() &&
+             StrictReader().parse(text.data(), text.data() + text.size(), &parsed, &errors);
+    } catch (const Json::Exception &) {
+        ok = false;
+    }
+    if (!ok) {
         value = Json::Value();
         return false;
     }
@@ -29,14 +57,8 @@ bool JsonFromString(const std::string &text, Json::Value &value) {
 }
 
 std::string JsonToString(const Json::Value &value) {
-    static const std::unique_ptr<Json::StreamWriter> writer = [] {
-        Json::StreamWriterBuilder builder;
-        builder["indentation"] = "";
-        builder["emitUTF8"] = true;
-        return std::unique_ptr<Json::StreamWriter>(builder.newStreamWriter());
-    }();
     std::ostringstream out;
-    writer->write(value, &out);
+    CompactWriter().write(value, &out);
     return out.str();
 }
 

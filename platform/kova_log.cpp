@@ -4,6 +4,7 @@
 #include <stdio.h>
 #include <syslog.h>
 
+#include <exception>
 #include <string>
 
 #include "kovacredential/kovaplatform.h"
@@ -31,6 +32,16 @@ void LogInnerFailure(const char *file, int line, const char *fmt, ...) {
     va_end(ap);
     Log("%s:%d %s[0x%04X %s:%d]", file, line, text, VLIBCErrGet(), VLIBCErrorGetFile(),
         VLIBCErrorGetLine());
+}
+
+void LogCaughtException(const char *unit, int line) {
+    try {
+        throw;
+    } catch (const std::exception &e) {
+        Log("%s:%d Exception: %s", unit, line, e.what());
+    } catch (...) {
+        Log("%s:%d Exception", unit, line);
+    }
 }
 
 }  // namespace kova

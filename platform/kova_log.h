@@ -2,8 +2,6 @@
 #ifndef KOVA_PLATFORM_KOVA_LOG_H
 #define KOVA_PLATFORM_KOVA_LOG_H
 
-#include <exception>
-
 namespace kova {
 
 // Writes one record to the system log at priority error (syslog LOG_ERR). Formats in the
@@ -20,19 +18,32 @@ int ArgInvalid(const char *file, int line, const char *check);
 void LogInnerFailure(const char *file, int line, const char *fmt, ...)
     __attribute__((format(printf, 3, 4)));
 
-// Runs `body` and returns its result. An exception escaping it (std::bad_alloc from a string or
-// a JSON value) is logged as "<unit>:<line> Exception: <what>" and turns into `failure`, so
-// that none leaves the library through a public entry point.
+// Logs the exception being handled as "<unit>:<line> Exception: <what>". Call it only from a
+// catch block.
+void LogCaughtException(const char *unit, int line);
+
+// The one exception guard of the library's public entry points: runs `body` and returns its
+// result. An exception escaping it (std::bad_alloc from a string or a JSON value, a jsoncpp
+// type error) is logged by LogCaughtException and turns into `failure`, so that none leaves
+// the library.
 template <typename Result, typename Body>
 Result Guarded(const char *unit, int line, Result failure, Body &&body) {
     try {
         return body();
-    } catch (const std::exception &e) {
-        Log("%s:%d Exception: %s", unit, line, e.what());
     } catch (...) {
-        Log("%s:%d Exception", unit, line);
+        LogCaughtException(unit, line);
     }
     return failure;
+}
+
+// The same guard for a body without a result.
+template <typename Body>
+void Guarded(const char *unit, int line, Body &&body) {
+    try {
+        body();
+    } catch (...) {
+        LogCaughtException(unit, line);
+    }
 }
 
 }  // namespace kova

@@ -2,6 +2,7 @@
 // public setters and getters built on them.
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
+#include "platform/kova_log.h"
 #include "request/cred_request_p.h"
 
 namespace KOVA {
@@ -14,16 +15,9 @@ namespace {
 
 const Json::Value kNull;
 
-// jsoncpp and std::string may throw (bad_alloc, Json::LogicError on a type mismatch); nothing
-// may leave the library, so public operations run their body through this guard.
-template <typename Fn, typename R>
-R Guarded(Fn &&fn, R onError) {
-    try {
-        return fn();
-    } catch (...) {
-        return onError;
-    }
-}
+constexpr char kUnit[] = "cred_request";
+// Line of the settings' exception-guard records.
+constexpr int kLineSettingsException = 30;
 
 }  // namespace
 
@@ -151,58 +145,66 @@ CredRequest::~CredRequest() {
 }
 
 bool CredRequest::SetURL(const std::string &url) {
-    return Guarded([&] { return d->SetRawData("URL", Json::Value(url)); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetRawData("URL", Json::Value(url)); });
 }
 
 bool CredRequest::SetURL(const std::string &scheme, const std::string &host, int port,
                          const std::string &path) {
-    return Guarded([&] { return SetURL(CredRequestUtil::GetURL(scheme, host, port, path)); },
-                   false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return SetURL(CredRequestUtil::GetURL(scheme, host, port, path)); });
 }
 
 bool CredRequest::SetEncURL(const std::string &url) {
-    return Guarded([&] { return d->SetRawData("EncURL", Json::Value(url)); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetRawData("EncURL", Json::Value(url)); });
 }
 
 std::string CredRequest::GetURL() {
-    return Guarded(
-        [&] {
-            const Json::Value &url = d->GetData("URL", "", kNull);
-            return url.isString() ? url.asString() : std::string();
-        },
-        std::string());
+    return kova::Guarded(kUnit, kLineSettingsException, std::string(), [&] {
+        const Json::Value &url = d->GetData("URL", "", kNull);
+        return url.isString() ? url.asString() : std::string();
+    });
 }
 
 bool CredRequest::AddHeader(const Json::Value &headers) {
-    return Guarded([&] { return d->SetData("Header", headers); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetData("Header", headers); });
 }
 
 bool CredRequest::AddHeader(const std::string &name, const std::string &value) {
-    return Guarded([&] { return d->SetData("Header", name, value); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetData("Header", name, value); });
 }
 
 bool CredRequest::AddCookie(const std::string &name, const std::string &value) {
-    return Guarded([&] { return d->SetData("Cookie", name, value); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetData("Cookie", name, value); });
 }
 
 bool CredRequest::AddGetParam(const Json::Value &params) {
-    return Guarded([&] { return d->SetData("GetParam", params); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetData("GetParam", params); });
 }
 
 bool CredRequest::AddGetParam(const std::string &name, const std::string &value) {
-    return Guarded([&] { return d->SetData("GetParam", name, value); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetData("GetParam", name, value); });
 }
 
 bool CredRequest::AddPostParam(const Json::Value &params) {
-    return Guarded([&] { return d->SetData("PostParam", params); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetData("PostParam", params); });
 }
 
 bool CredRequest::AddPostParam(const std::string &name, const std::string &value) {
-    return Guarded([&] { return d->SetData("PostParam", name, value); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetData("PostParam", name, value); });
 }
 
 bool CredRequest::AddRawParam(const std::string &body) {
-    return Guarded([&] { return d->SetRawData("RawParam", Json::Value(body)); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetRawData("RawParam", Json::Value(body)); });
 }
 
 bool CredRequest::SetReqStream(FILE *stream) {
@@ -227,7 +229,8 @@ bool CredRequest::SetUploadFile(const char *field, const char *path) {
     }
     // Once both are given the call reports success; an empty field name is still refused by
     // the document (CRED_REQ_ERR_BAD_PARAM, nothing stored).
-    Guarded([&] { return d->SetData("File", field, path); }, false);
+    kova::Guarded(kUnit, kLineSettingsException, false,
+                  [&] { return d->SetData("File", field, path); });
     return true;
 }
 
@@ -237,22 +240,22 @@ void CredRequest::SetSSLVerify(void (*fn)(void *, void *, void *), void *data) {
 }
 
 void CredRequest::SetHTTPSVerify(bool verify) {
-    Guarded([&] { return d->SetRawData("VerifySSL", Json::Value(verify)); }, false);
+    kova::Guarded(kUnit, kLineSettingsException, false,
+                  [&] { return d->SetRawData("VerifySSL", Json::Value(verify)); });
 }
 
 bool CredRequest::SetRespHeaderToJsonValue(bool on) {
-    return Guarded([&] { return d->SetData("RespHeader", "MODE", on ? "JSON" : ""); }, false);
+    return kova::Guarded(kUnit, kLineSettingsException, false,
+                         [&] { return d->SetData("RespHeader", "MODE", on ? "JSON" : ""); });
 }
 
 bool CredRequest::SetRespHeaderToStdout(bool on, const std::string &message) {
-    return Guarded(
-        [&] {
-            if (!message.empty() && !d->SetData("RespHeader", "MESSAGE", message)) {
-                return false;
-            }
-            return d->SetData("RespHeader", "MODE", on ? "STDOUT" : "");
-        },
-        false);
+    return kova::Guarded(kUnit, kLineSettingsException, false, [&] {
+        if (!message.empty() && !d->SetData("RespHeader", "MESSAGE", message)) {
+            return false;
+        }
+        return d->SetData("RespHeader", "MODE", on ? "STDOUT" : "");
+    });
 }
 
 bool CredRequest::SetRespStream(FILE *stream, size_t (*fn)(char *, size_t, size_t, void *)) {
@@ -268,16 +271,15 @@ bool CredRequest::SetRespStream(FILE *stream, size_t (*fn)(char *, size_t, size_
 }
 
 void CredRequest::SetRequestFormat(const std::string &format) {
-    Guarded([&] { return d->SetRawData("Format", Json::Value(format)); }, false);
+    kova::Guarded(kUnit, kLineSettingsException, false,
+                  [&] { return d->SetRawData("Format", Json::Value(format)); });
 }
 
 std::string CredRequest::GetRequestFormat() {
-    return Guarded(
-        [&] {
-            const Json::Value &format = d->GetData("Format", "", kNull);
-            return format.isString() ? format.asString() : std::string();
-        },
-        std::string());
+    return kova::Guarded(kUnit, kLineSettingsException, std::string(), [&] {
+        const Json::Value &format = d->GetData("Format", "", kNull);
+        return format.isString() ? format.asString() : std::string();
+    });
 }
 
 bool CredRequest::SetDefaultTimeout(long seconds) {
@@ -293,37 +295,36 @@ long CredRequest::GetDefaultTimeout() const {
 }
 
 bool CredRequest::SetResponseTimeout(long seconds) {
-    return Guarded(
-        [&] { return d->SetRawData("RespTime", Json::Value(static_cast<Json::Int64>(seconds))); },
-        false);
+    return kova::Guarded(kUnit, kLineSettingsException, false, [&] {
+        return d->SetRawData("RespTime", Json::Value(static_cast<Json::Int64>(seconds)));
+    });
 }
 
 long CredRequest::GetResponseTimeout() {
     constexpr long kUnsetResponseTimeout = 120;
-    return Guarded(
-        [&] {
-            const Json::Value &value = d->GetData("RespTime", "", kNull);
-            if (!value.isIntegral()) {
-                return kUnsetResponseTimeout;
-            }
-            return static_cast<long>(value.asInt64());
-        },
-        kUnsetResponseTimeout);
+    return kova::Guarded(kUnit, kLineSettingsException, kUnsetResponseTimeout, [&] {
+        const Json::Value &value = d->GetData("RespTime", "", kNull);
+        if (!value.isIntegral()) {
+            return kUnsetResponseTimeout;
+        }
+        return static_cast<long>(value.asInt64());
+    });
 }
 
 bool CredRequest::SetEncryptParam(bool /*encrypt*/) {
     // Selects the RSA envelope whatever the argument; SetEncryptMode(0) switches back.
-    return Guarded(
-        [&] { return d->SetRawData("Crypto", Json::Value(static_cast<int>(CRED_REQ_CRYPTO_RSA))); },
-        false);
+    return kova::Guarded(kUnit, kLineSettingsException, false, [&] {
+        return d->SetRawData("Crypto", Json::Value(static_cast<int>(CRED_REQ_CRYPTO_RSA)));
+    });
 }
 
 bool CredRequest::SetEncryptMode(KOVA::_tag_CRED_REQ_CRYPTO mode) {
     if (static_cast<int>(mode) > CRED_REQ_CRYPTO_AES) {
         return false;
     }
-    return Guarded([&] { return d->SetRawData("Crypto", Json::Value(static_cast<int>(mode))); },
-                   false);
+    return kova::Guarded(kUnit, kLineSettingsException, false, [&] {
+        return d->SetRawData("Crypto", Json::Value(static_cast<int>(mode)));
+    });
 }
 
 void CredRequest::SetFollowLocation(bool follow) {
@@ -347,7 +348,7 @@ CURL *CredRequest::GetCurlHandler() {
 }
 
 std::string CredRequest::GetResponse() {
-    return Guarded([&] { return d->response; }, std::string());
+    return kova::Guarded(kUnit, kLineSettingsException, std::string(), [&] { return d->response; });
 }
 
 const Json::Value &CredRequest::GetResponseHeader() {

@@ -39,7 +39,7 @@ bool IsJsonFormat(const CredRequestPrivate &p) {
 
 constexpr int kLineParamStringRsaFail = 61;
 constexpr int kLineParamStringAesFail = 72;
-constexpr int kLineParamStringPairFail = 80;
+constexpr int kLineParamStringPairFail = 78;
 
 std::string CredRequestPrivate::GetParamString(const Json::Value &params) {
     const int mode = CryptoMode(*this);
@@ -87,7 +87,7 @@ std::string CredRequestPrivate::GetParamString(const Json::Value &params) {
 }
 
 constexpr int kLineParamJsonRsaFail = 105;
-constexpr int kLineParamJsonAesFail = 117;
+constexpr int kLineParamJsonAesFail = 112;
 
 Json::Value CredRequestPrivate::GetParamJsonObj(const Json::Value &params) {
     Json::Value result;

@@ -15,6 +15,9 @@
 
 namespace KOVA {
 
+// Line of this file's exception-guard records.
+constexpr int kLineFarlinkException = 220;
+
 namespace {
 
 // The unit name that the client's log records carry.
@@ -23,7 +26,9 @@ const char kDirectoryPath[] = "/Serv.php";
 const long kDefaultTimeout = 5;
 
 std::string HostFromEnv(const char *variable, const char *fallback) {
-    const char *value = getenv(variable);
+    // Ignored in setuid and setgid processes, so that whoever starts them cannot redirect
+    // look-ups to a directory of their own.
+    const char *value = secure_getenv(variable);
     return (value != nullptr && value[0] != '\0') ? std::string(value) : std::string(fallback);
 }
 
@@ -223,7 +228,7 @@ void CredRequestFarlink::SetHTTPS(bool https, bool verify) {
 }
 
 void CredRequestFarlink::SetServerName(const std::string &name) {
-    FarlinkGuarded([&] { d->SetServerName(name); });
+    kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, [&] { d->SetServerName(name); });
 }
 
 void CredRequestFarlink::SetTimeout(long seconds) {
@@ -231,11 +236,11 @@ void CredRequestFarlink::SetTimeout(long seconds) {
 }
 
 void CredRequestFarlink::SetServerId(const std::string &serverId) {
-    FarlinkGuarded([&] { d->SetServerId(serverId); });
+    kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, [&] { d->SetServerId(serverId); });
 }
 
 void CredRequestFarlink::SetServiceId(const std::string &serviceId) {
-    FarlinkGuarded([&] { d->SetServiceId(serviceId); });
+    kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, [&] { d->SetServiceId(serviceId); });
 }
 
 KOVA::_tag_CRED_REQ_ERR CredRequestFarlink::GetError() {
@@ -243,11 +248,12 @@ KOVA::_tag_CRED_REQ_ERR CredRequestFarlink::GetError() {
 }
 
 Json::Value CredRequestFarlink::GetErrors() {
-    return FarlinkGuarded([&] { return d->GetErrors(); }, Json::Value());
+    return kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, Json::Value(),
+                         [&] { return d->GetErrors(); });
 }
 
 void CredRequestFarlink::SetError(KOVA::_tag_CRED_REQ_ERR error, const Json::Value &detail) {
-    FarlinkGuarded([&] { d->SetError(error, detail); });
+    kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, [&] { d->SetError(error, detail); });
 }
 
 }  // namespace KOVA

@@ -8,6 +8,9 @@
 
 namespace KOVA {
 
+// Line of this file's exception-guard records.
+constexpr int kLineConnException = 140;
+
 namespace {
 
 const char kProbePath[] = "/webman/pingpong.cgi";
@@ -142,23 +145,21 @@ bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tun
 
 bool CredRequestFarlink::GetAvailableConnInfo(const Json::Value &serverInfo,
                                               Json::Value &candidate) {
-    return FarlinkGuarded(
-        [&]() -> bool {
-            if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
-                d->SetError(CRED_REQ_ERR_NO_CONN_INFO, serverInfo);
-                return false;
-            }
-            if (d->GetAvailableDirectConnInfo(serverInfo, candidate)) {
-                return true;
-            }
-            // The tunnel is asked of the site that gave the server information.
-            Json::Value tunnelAnswer;
-            if (!RequestTunnel(tunnelAnswer)) {
-                return false;
-            }
-            return d->GetAvailableRelayConnInfo(tunnelAnswer, candidate);
-        },
-        false);
+    return kova::Guarded(kFarlinkGuardUnit, kLineConnException, false, [&]() -> bool {
+        if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
+            d->SetError(CRED_REQ_ERR_NO_CONN_INFO, serverInfo);
+            return false;
+        }
+        if (d->GetAvailableDirectConnInfo(serverInfo, candidate)) {
+            return true;
+        }
+        // The tunnel is asked of the site that gave the server information.
+        Json::Value tunnelAnswer;
+        if (!RequestTunnel(tunnelAnswer)) {
+            return false;
+        }
+        return d->GetAvailableRelayConnInfo(tunnelAnswer, candidate);
+    });
 }
 
 namespace {
@@ -166,28 +167,26 @@ namespace {
 // One whole look-up with a client of its own: the HTTPS service first, then the plain one.
 bool ResolveServer(const std::string &serverId, const char *httpsService, const char *plainService,
                    Json::Value &candidate, Json::Value *errors) {
-    return FarlinkGuarded(
-        [&]() -> bool {
-            CredRequestFarlink client;
-            if (serverId.empty()) {
-                client.SetError(CRED_REQ_ERR_NO_SERVER_ID);
-            } else {
-                client.SetServerId(serverId);
-                for (const char *service : {httpsService, plainService}) {
-                    client.SetServiceId(service);
-                    Json::Value info;
-                    if (client.GetAvailableServerInfo(info) &&
-                        client.GetAvailableConnInfo(info, candidate)) {
-                        return true;
-                    }
+    return kova::Guarded(kFarlinkGuardUnit, kLineConnException, false, [&]() -> bool {
+        CredRequestFarlink client;
+        if (serverId.empty()) {
+            client.SetError(CRED_REQ_ERR_NO_SERVER_ID);
+        } else {
+            client.SetServerId(serverId);
+            for (const char *service : {httpsService, plainService}) {
+                client.SetServiceId(service);
+                Json::Value info;
+                if (client.GetAvailableServerInfo(info) &&
+                    client.GetAvailableConnInfo(info, candidate)) {
+                    return true;
                 }
             }
-            if (errors != nullptr) {
-                *errors = client.GetErrors();
-            }
-            return false;
-        },
-        false);
+        }
+        if (errors != nullptr) {
+            *errors = client.GetErrors();
+        }
+        return false;
+    });
 }
 
 }  // namespace

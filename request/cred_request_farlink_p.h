@@ -10,27 +10,12 @@
 
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_farlink.h"
+#include "platform/kova_log.h"
 
 namespace KOVA {
 
-// Runs `fn` and turns any exception (out of memory in string or JSON handling, a JSON value of
-// an unexpected type) into `onError`, so that none leaves the library.
-template <typename Fn, typename R>
-R FarlinkGuarded(Fn &&fn, R onError) {
-    try {
-        return fn();
-    } catch (...) {
-        return onError;
-    }
-}
-
-template <typename Fn>
-void FarlinkGuarded(Fn &&fn) {
-    try {
-        fn();
-    } catch (...) {
-    }
-}
+// Unit name of the relay client's exception-guard records (kova::Guarded).
+constexpr char kFarlinkGuardUnit[] = "cred_request_farlink";
 
 class CredRequestFarlinkPrivate {
   public:

@@ -42,7 +42,7 @@ Json::Value HeaderValue(const Json::Value &headers, const std::string &name) {
 }  // namespace
 
 constexpr int kLineAuthException = 75;
-constexpr int kLineUrlBadParam = 80;
+constexpr int kLineUrlBadParam = 81;
 constexpr int kLineUrlEncUrl = 87;
 constexpr int kLineUrlNoPath = 94;
 constexpr int kLineUrlSetUrl = 99;
@@ -93,7 +93,7 @@ constexpr int kLineRedirSetUrl = 142;
 constexpr int kLineRedirHeaderMode = 149;
 constexpr int kLineRedirNoHeaders = 161;
 constexpr int kLineRedirNoLocation = 166;
-constexpr int kLineRedirBadLocation = 172;
+constexpr int kLineRedirBadLocation = 173;
 
 bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
     return kova::Guarded(kUnit, kLineAuthException, false, [&] {

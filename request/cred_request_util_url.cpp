@@ -92,7 +92,7 @@ std::string CredRequestUtil::GetURL(const std::string &scheme, const std::string
     }
 }
 
-constexpr int kLineTestSetUrl = 96;
+constexpr int kLineTestSetUrl = 97;
 constexpr int kLineTestFailed = 103;
 
 bool CredRequestUtil::TestURL(const std::string &url) {
