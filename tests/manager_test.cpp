@@ -30,9 +30,11 @@ class ManagerTest : public ::testing::Test {
         server_->Route("*", "/hello", [](const httplib::Request &, httplib::Response &res) {
             res.set_content("hello", "text/plain");
         });
-        // Answers after 300 ms with "slow <n>", n taken from the query.
+        // Answers after 300 ms (or "ms" from the query) with "slow <n>", n from the query.
         server_->Route("*", "/slow", [](const httplib::Request &req, httplib::Response &res) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(300));
+            const std::string ms = req.get_param_value("ms");
+            std::this_thread::sleep_for(
+                std::chrono::milliseconds(ms.empty() ? 300 : std::stoi(ms)));
             res.set_content("slow " + req.get_param_value("n"), "text/plain");
         });
         ASSERT_TRUE(server_->Start()) << server_->Error();
@@ -52,29 +54,7 @@ class ManagerTest : public ::testing::Test {
     std::unique_ptr<kovasim::LoopbackServer> server_;
 };
 
-TEST_F(ManagerTest, BadIndexesGiveErrorOne) {
-    CredRequestMgr mgr;
-    CredRequest *request = NewRequest(Url("/hello"));
-    ASSERT_EQ(0, mgr.AddCredRequest(request));
-
-    const std::pair<const char *, std::function<bool()>> calls[] = {
-        {"GetRequest(-1)", [&] { return mgr.GetRequest(-1) == nullptr; }},
-        {"GetRequest(size)", [&] { return mgr.GetRequest(mgr.Size()) == nullptr; }},
-        {"GetResponse(1)", [&] { return mgr.GetResponse(1).empty(); }},
-        {"RemoveRequest(-1)", [&] { return mgr.RemoveRequest(-1) == nullptr; }}};
-    for (const auto &call : calls) {
-        SCOPED_TRACE(call.first);
-        mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
-        EXPECT_TRUE(call.second());
-        EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
-    }
-
-    // The manager never clears its error by itself.
-    EXPECT_EQ(request, mgr.GetRequest(0));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
-}
-
-TEST_F(ManagerTest, AddingAssignsConsecutiveIndexesAndClearEmpties) {
+TEST_F(ManagerTest, ConsecutiveIndexesBadIndexesAndClear) {
     CredRequestMgr mgr;
     EXPECT_TRUE(mgr.IsEmpty());
     EXPECT_TRUE(mgr.Run());
@@ -82,17 +62,31 @@ TEST_F(ManagerTest, AddingAssignsConsecutiveIndexesAndClearEmpties) {
     EXPECT_EQ(Json::Value(Json::arrayValue), mgr.GetAllResponse());
     EXPECT_EQ(0u, server_->RequestCount());
 
-    CredRequest *first = NewRequest(Url("/hello"));
-    CredRequest *second = NewRequest(Url("/hello"));
-    CredRequest *third = NewRequest(Url("/hello"));
-    EXPECT_EQ(0, mgr.AddCredRequest(first));
-    EXPECT_EQ(1, mgr.AddCredRequest(second));
-    EXPECT_EQ(2, mgr.AddCredRequest(third));
+    CredRequest *requests[3];
+    for (int i = 0; i < 3; ++i) {
+        requests[i] = NewRequest(Url("/hello"));
+        EXPECT_EQ(i, mgr.AddCredRequest(requests[i]));
+    }
     EXPECT_EQ(3, mgr.Size());
     EXPECT_FALSE(mgr.IsEmpty());
-    EXPECT_EQ(first, mgr.GetRequest(0));
-    EXPECT_EQ(second, mgr.GetRequest(1));
-    EXPECT_EQ(third, mgr.GetRequest(2));
+
+    const std::pair<const char *, std::function<bool()>> calls[] = {
+        {"GetRequest(-1)", [&] { return mgr.GetRequest(-1) == nullptr; }},
+        {"GetRequest(size)", [&] { return mgr.GetRequest(mgr.Size()) == nullptr; }},
+        {"GetResponse(size)", [&] { return mgr.GetResponse(mgr.Size()).empty(); }},
+        {"RemoveRequest(-1)", [&] { return mgr.RemoveRequest(-1) == nullptr; }}};
+    for (const auto &call : calls) {
+        SCOPED_TRACE(call.first);
+        mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
+        EXPECT_TRUE(call.second());
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
+    }
+    // Bad indexes change nothing, and the manager never clears its error by itself.
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_EQ(requests[i], mgr.GetRequest(i));
+    }
+    EXPECT_EQ(3, mgr.Size());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
 
     mgr.Clear();
     EXPECT_TRUE(mgr.IsEmpty());
@@ -184,12 +178,33 @@ TEST_F(ManagerTest, DelayedRequestsRunConcurrentlyInAddingOrder) {
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
 }
 
-TEST_F(ManagerTest, RequestWithFailedSetUpIsLeftOut) {
+// Run lifts every request's response time-out: a request allowed 1 s of silence still gets its
+// answer after 2 s, although the other request's answer after 1.5 s makes libcurl look at it.
+TEST_F(ManagerTest, RunLiftsResponseTimeouts) {
+    CredRequestMgr mgr;
+    CredRequest *limited = NewRequest(Url("/slow?n=1&ms=2000"));
+    limited->SetResponseTimeout(1);
+    CredRequest *other = NewRequest(Url("/slow?n=2&ms=1500"));
+    ASSERT_EQ(0, mgr.AddCredRequest(limited));
+    ASSERT_EQ(1, mgr.AddCredRequest(other));
+    EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+    EXPECT_EQ("slow 1", mgr.GetResponse(0));
+    EXPECT_EQ("slow 2", mgr.GetResponse(1));
+    EXPECT_EQ(0, limited->GetResponseTimeout());
+    EXPECT_EQ(0, other->GetResponseTimeout());
+}
+
+// A request whose set-up fails is left out; a refused connection ends only its own transfer.
+TEST_F(ManagerTest, FailedSetUpOrRefusedConnectionDoesNotStopTheOthers) {
+    kovasim::RefusedPort refused;
+    ASSERT_NE(0, refused.Port());
     CredRequestMgr mgr;
     ASSERT_EQ(0, mgr.AddCredRequest(NewRequest(Url("/hello"))));
     auto *noUrl = new CredRequest();
     ASSERT_EQ(1, mgr.AddCredRequest(noUrl));
-    ASSERT_EQ(2, mgr.AddCredRequest(NewRequest(Url("/slow?n=2"))));
+    ASSERT_EQ(2, mgr.AddCredRequest(
+                     NewRequest("http://127.0.0.1:" + std::to_string(refused.Port()) + "/")));
+    ASSERT_EQ(3, mgr.AddCredRequest(NewRequest(Url("/slow?n=3"))));
 
     EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
     // A second run starts from empty responses.
@@ -198,7 +213,12 @@ TEST_F(ManagerTest, RequestWithFailedSetUpIsLeftOut) {
     EXPECT_EQ("hello", mgr.GetResponse(0));
     EXPECT_EQ("", mgr.GetResponse(1));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NO_URL, noUrl->GetError());
-    EXPECT_EQ("slow 2", mgr.GetResponse(2));
+    EXPECT_EQ("", mgr.GetResponse(2));
+    long status = -1;
+    ASSERT_NE(nullptr, mgr.GetRequest(2)->GetCurlHandler());
+    curl_easy_getinfo(mgr.GetRequest(2)->GetCurlHandler(), CURLINFO_RESPONSE_CODE, &status);
+    EXPECT_EQ(0, status);
+    EXPECT_EQ("slow 3", mgr.GetResponse(3));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
 }
 
@@ -229,24 +249,6 @@ TEST_F(ManagerTest, SilentServerEndsRunThroughTimeout) {
     // The answering server was served in the same run.
     EXPECT_EQ("hello", mgr.GetResponse(2));
     EXPECT_EQ("", mgr.GetResponse(0));
-}
-
-TEST_F(ManagerTest, RefusedConnectionDoesNotStopTheOthers) {
-    kovasim::RefusedPort refused;
-    ASSERT_NE(0, refused.Port());
-    CredRequestMgr mgr;
-    ASSERT_EQ(0, mgr.AddCredRequest(
-                     NewRequest("http://127.0.0.1:" + std::to_string(refused.Port()) + "/")));
-    ASSERT_EQ(1, mgr.AddCredRequest(NewRequest(Url("/slow?n=1"))));
-
-    EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
-    EXPECT_EQ("", mgr.GetResponse(0));
-    EXPECT_EQ("slow 1", mgr.GetResponse(1));
-    long status = -1;
-    ASSERT_NE(nullptr, mgr.GetRequest(0)->GetCurlHandler());
-    curl_easy_getinfo(mgr.GetRequest(0)->GetCurlHandler(), CURLINFO_RESPONSE_CODE, &status);
-    EXPECT_EQ(0, status);
 }
 
 TEST_F(ManagerTest, SocketCallbackMarksOnlyTheRemovedHeldRequest) {

@@ -2,10 +2,12 @@
 // which they are probed, what a probe must prove, and the whole look-ups by server id.
 #include <stdlib.h>
 
+#include <atomic>
 #include <chrono>
 #include <memory>
 #include <mutex>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -235,21 +237,31 @@ TEST_F(RelayProbeTest, UnusableServerInformationIs402) {
     }
 }
 
-TEST_F(RelayProbeTest, DeadHostsAndHostsAnsweringAsAnotherServerAreSkipped) {
-    const int port = targets_.Start("impostor", Addr(1), 0, "S2");
-    ASSERT_GT(port, 0);
-    ASSERT_EQ(targets_.Start("real", Addr(2), port, "S1"), port);
-    // Nothing listens on Addr(0) at that port: the connection is refused and passed over
-    // quickly.
-    Json::Value info = LanInfo({Addr(0), Addr(1), Addr(2)}, port);
+TEST_F(RelayProbeTest, DeadSilentAndImpostorHostsAreSkipped) {
+    // Addr(1) accepts and never answers. The probe must hang up within its response time-out of
+    // 5 s; without it the wait would last 10 s (the probe's default time-out) or more, and the
+    // silent host would close first.
+    std::atomic<int> probeHungUp{-1};
+    kovasim::RawServer silent(
+        [&probeHungUp](kovasim::RawServer::Connection &c) { probeHungUp = c.WaitForClose(9000); },
+        Addr(1));
+    ASSERT_TRUE(silent.Start());
+    const int port = silent.Port();
+    ASSERT_EQ(targets_.Start("impostor", Addr(2), port, "S2"), port);
+    ASSERT_EQ(targets_.Start("real", Addr(3), port, "S1"), port);
+    // Nothing listens on Addr(0) at that port: the connection is refused.
+    Json::Value info = LanInfo({Addr(0), Addr(1), Addr(2), Addr(3)}, port);
     CredRequestFarlinkPrivate client(nullptr);
     Json::Value candidate;
-    auto start = std::chrono::steady_clock::now();
     ASSERT_TRUE(client.GetAvailableDirectConnInfo(info, candidate));
-    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
-    EXPECT_EQ(candidate, Candidate("http", Addr(2), port));
+    EXPECT_EQ(candidate, Candidate("http", Addr(3), port));
     EXPECT_EQ(targets_.Order(), (std::vector<std::string>{"impostor", "real"}));
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
+    for (int i = 0; i < 500 && probeHungUp < 0; ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    EXPECT_EQ(silent.ConnectionCount(), 1);
+    EXPECT_EQ(probeHungUp, 1);
 }
 
 TEST_F(RelayProbeTest, RelayAddressComesBeforeItsNameOnTheSamePort) {

@@ -89,6 +89,12 @@ TEST_F(WebApiSimTest, UploadNeedsASessionAndAFile) {
     EXPECT_EQ("data.bin", answer["data"]["name"].asString());
     ASSERT_FALSE(Sim().Uploads().empty());
     EXPECT_EQ("0123456789", Sim().Uploads().back().content);
+    // The session id travels in the query, not in the multipart form.
+    const kovasim::RecordedRequest wire = Server().Last();
+    EXPECT_EQ(0u, wire.query.find("_sid=" + sess.access_token)) << wire.query;
+    for (const auto &part : wire.parts) {
+        EXPECT_NE("_sid", part.name);
+    }
 
     EXPECT_EQ(
         kovasim::WebApiSim::kErrMissingParam,
