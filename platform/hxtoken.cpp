@@ -2,10 +2,12 @@
 // (AES) parameters. The host installs a provider; without one every request for a token fails.
 #include <stddef.h>
 
+#include <atomic>
+
 #include "kovacredential/kovaplatform.h"
 
 namespace {
-KOVACloudServiceHxtokenProvider gProvider = nullptr;
+std::atomic<KOVACloudServiceHxtokenProvider> gProvider{nullptr};
 }
 
 extern "C" void KOVACloudServiceHxtokenSetProvider(KOVACloudServiceHxtokenProvider provider) {
@@ -14,13 +16,14 @@ extern "C" void KOVACloudServiceHxtokenSetProvider(KOVACloudServiceHxtokenProvid
 
 extern "C" int KOVACloudServiceHxtokenGetToken(char *token, size_t tokenSize, char *key,
                                                size_t keySize) {
-    if (gProvider == nullptr || token == nullptr || key == nullptr || tokenSize == 0 ||
+    const KOVACloudServiceHxtokenProvider provider = gProvider;
+    if (provider == nullptr || token == nullptr || key == nullptr || tokenSize == 0 ||
         keySize == 0) {
         return -1;
     }
     token[0] = '\0';
     key[0] = '\0';
-    int ret = gProvider(token, tokenSize, key, keySize);
+    int ret = provider(token, tokenSize, key, keySize);
     token[tokenSize - 1] = '\0';
     key[keySize - 1] = '\0';
     return ret;

@@ -36,6 +36,17 @@ Result Guarded(const char *unit, int line, Result failure, Body &&body) {
     return failure;
 }
 
+// The guard for an operation on an implementation object that may be missing (its
+// construction failed): without one the operation fails with `failure` at once; otherwise
+// `body` gets the object.
+template <typename Impl, typename Result, typename Body>
+Result GuardedOn(const char *unit, int line, Impl *impl, Result failure, Body &&body) {
+    if (impl == nullptr) {
+        return failure;
+    }
+    return Guarded(unit, line, failure, [&] { return body(*impl); });
+}
+
 // The same guard for a body without a result.
 template <typename Body>
 void Guarded(const char *unit, int line, Body &&body) {

@@ -1,5 +1,7 @@
 // KOVA::CredRequest settings: the request settings document, its low-level operations and the
 // public setters and getters built on them.
+#include <utility>
+
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
@@ -7,9 +9,9 @@
 
 namespace KOVA {
 
-bool CredRequestPrivate::reqStreamLimited = false;
-uint32_t CredRequestPrivate::reqStreamRemaining = 0;
-bool CredRequestPrivate::headerMessageShown = false;
+std::atomic<bool> CredRequestPrivate::reqStreamLimited{false};
+std::atomic<uint32_t> CredRequestPrivate::reqStreamRemaining{0};
+std::atomic<bool> CredRequestPrivate::headerMessageShown{false};
 
 namespace {
 
@@ -18,6 +20,8 @@ const Json::Value kNull;
 constexpr char kUnit[] = "cred_request";
 // Line of the settings' exception-guard records.
 constexpr int kLineSettingsException = 30;
+// Line of the record of a request whose construction failed.
+constexpr int kLineConstructException = 25;
 
 }  // namespace
 
@@ -138,172 +142,198 @@ bool CredRequestPrivate::HasData(const std::string &key, const std::string &name
 
 // ---- KOVA::CredRequest ----
 
-CredRequest::CredRequest() : d(new CredRequestPrivate(this)) {}
+CredRequest::CredRequest()
+    : d(kova::Guarded(kUnit, kLineConstructException, static_cast<CredRequestPrivate *>(nullptr),
+                      [this] { return new CredRequestPrivate(this); })) {}
 
 CredRequest::~CredRequest() {
     delete d;
 }
 
+namespace {
+
+// Runs a body on the implementation object under the exception guard. A request whose
+// construction failed has none; every operation on it fails.
+template <typename Result, typename Body>
+Result OnPrivate(CredRequestPrivate *d, Result failure, Body &&body) {
+    return kova::GuardedOn(kUnit, kLineSettingsException, d, failure, std::forward<Body>(body));
+}
+
+std::string StringData(const CredRequestPrivate &p, const char *key) {
+    const Json::Value &value = p.GetData(key, "", kNull);
+    return value.isString() ? value.asString() : std::string();
+}
+
+}  // namespace
+
 bool CredRequest::SetURL(const std::string &url) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetRawData("URL", Json::Value(url)); });
+    return OnPrivate(d, false,
+                     [&](CredRequestPrivate &p) { return p.SetRawData("URL", Json::Value(url)); });
 }
 
 bool CredRequest::SetURL(const std::string &scheme, const std::string &host, int port,
                          const std::string &path) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return SetURL(CredRequestUtil::GetURL(scheme, host, port, path)); });
-}
-
-bool CredRequest::SetEncURL(const std::string &url) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetRawData("EncURL", Json::Value(url)); });
-}
-
-std::string CredRequest::GetURL() {
-    return kova::Guarded(kUnit, kLineSettingsException, std::string(), [&] {
-        const Json::Value &url = d->GetData("URL", "", kNull);
-        return url.isString() ? url.asString() : std::string();
+    return OnPrivate(d, false, [&](CredRequestPrivate &) {
+        return SetURL(CredRequestUtil::GetURL(scheme, host, port, path));
     });
 }
 
+bool CredRequest::SetEncURL(const std::string &url) {
+    return OnPrivate(
+        d, false, [&](CredRequestPrivate &p) { return p.SetRawData("EncURL", Json::Value(url)); });
+}
+
+std::string CredRequest::GetURL() {
+    return OnPrivate(d, std::string(), [](CredRequestPrivate &p) { return StringData(p, "URL"); });
+}
+
 bool CredRequest::AddHeader(const Json::Value &headers) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetData("Header", headers); });
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) { return p.SetData("Header", headers); });
 }
 
 bool CredRequest::AddHeader(const std::string &name, const std::string &value) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetData("Header", name, value); });
+    return OnPrivate(d, false,
+                     [&](CredRequestPrivate &p) { return p.SetData("Header", name, value); });
 }
 
 bool CredRequest::AddCookie(const std::string &name, const std::string &value) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetData("Cookie", name, value); });
+    return OnPrivate(d, false,
+                     [&](CredRequestPrivate &p) { return p.SetData("Cookie", name, value); });
 }
 
 bool CredRequest::AddGetParam(const Json::Value &params) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetData("GetParam", params); });
+    return OnPrivate(d, false,
+                     [&](CredRequestPrivate &p) { return p.SetData("GetParam", params); });
 }
 
 bool CredRequest::AddGetParam(const std::string &name, const std::string &value) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetData("GetParam", name, value); });
+    return OnPrivate(d, false,
+                     [&](CredRequestPrivate &p) { return p.SetData("GetParam", name, value); });
 }
 
 bool CredRequest::AddPostParam(const Json::Value &params) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetData("PostParam", params); });
+    return OnPrivate(d, false,
+                     [&](CredRequestPrivate &p) { return p.SetData("PostParam", params); });
 }
 
 bool CredRequest::AddPostParam(const std::string &name, const std::string &value) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetData("PostParam", name, value); });
+    return OnPrivate(d, false,
+                     [&](CredRequestPrivate &p) { return p.SetData("PostParam", name, value); });
 }
 
 bool CredRequest::AddRawParam(const std::string &body) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetRawData("RawParam", Json::Value(body)); });
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        return p.SetRawData("RawParam", Json::Value(body));
+    });
 }
 
 bool CredRequest::SetReqStream(FILE *stream) {
-    if (stream == nullptr) {
-        d->error = CRED_REQ_ERR_BAD_PARAM;
-        return false;
-    }
-    d->reqStream = stream;
-    return true;
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        if (stream == nullptr) {
+            p.error = CRED_REQ_ERR_BAD_PARAM;
+            return false;
+        }
+        p.reqStream = stream;
+        return true;
+    });
 }
 
 bool CredRequest::SetReqStreamSize(unsigned int size) {
-    CredRequestPrivate::reqStreamLimited = true;
     CredRequestPrivate::reqStreamRemaining = size;
+    CredRequestPrivate::reqStreamLimited = true;
     return true;
 }
 
 bool CredRequest::SetUploadFile(const char *field, const char *path) {
-    if (field == nullptr || path == nullptr) {
-        d->error = CRED_REQ_ERR_BAD_PARAM;
-        return false;
-    }
-    // Once both are given the call reports success; an empty field name is still refused by
-    // the document (CRED_REQ_ERR_BAD_PARAM, nothing stored).
-    kova::Guarded(kUnit, kLineSettingsException, false,
-                  [&] { return d->SetData("File", field, path); });
-    return true;
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        if (field == nullptr || path == nullptr) {
+            p.error = CRED_REQ_ERR_BAD_PARAM;
+            return false;
+        }
+        // Once both are given the call reports success; an empty field name is still refused
+        // by the document (CRED_REQ_ERR_BAD_PARAM, nothing stored).
+        p.SetData("File", field, path);
+        return true;
+    });
 }
 
 void CredRequest::SetSSLVerify(void (*fn)(void *, void *, void *), void *data) {
-    d->sslCtxFn = fn;
-    d->sslCtxData = data;
+    OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        p.sslCtxFn = fn;
+        p.sslCtxData = data;
+        return true;
+    });
 }
 
 void CredRequest::SetHTTPSVerify(bool verify) {
-    kova::Guarded(kUnit, kLineSettingsException, false,
-                  [&] { return d->SetRawData("VerifySSL", Json::Value(verify)); });
+    OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        return p.SetRawData("VerifySSL", Json::Value(verify));
+    });
 }
 
 bool CredRequest::SetRespHeaderToJsonValue(bool on) {
-    return kova::Guarded(kUnit, kLineSettingsException, false,
-                         [&] { return d->SetData("RespHeader", "MODE", on ? "JSON" : ""); });
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        return p.SetData("RespHeader", "MODE", on ? "JSON" : "");
+    });
 }
 
 bool CredRequest::SetRespHeaderToStdout(bool on, const std::string &message) {
-    return kova::Guarded(kUnit, kLineSettingsException, false, [&] {
-        if (!message.empty() && !d->SetData("RespHeader", "MESSAGE", message)) {
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        if (!message.empty() && !p.SetData("RespHeader", "MESSAGE", message)) {
             return false;
         }
-        return d->SetData("RespHeader", "MODE", on ? "STDOUT" : "");
+        return p.SetData("RespHeader", "MODE", on ? "STDOUT" : "");
     });
 }
 
 bool CredRequest::SetRespStream(FILE *stream, size_t (*fn)(char *, size_t, size_t, void *)) {
-    if (stream == nullptr) {
-        d->error = CRED_REQ_ERR_BAD_PARAM;
-        return false;
-    }
-    d->respStream = stream;
-    if (fn != nullptr) {
-        d->respWriteFn = fn;
-    }
-    return true;
-}
-
-void CredRequest::SetRequestFormat(const std::string &format) {
-    kova::Guarded(kUnit, kLineSettingsException, false,
-                  [&] { return d->SetRawData("Format", Json::Value(format)); });
-}
-
-std::string CredRequest::GetRequestFormat() {
-    return kova::Guarded(kUnit, kLineSettingsException, std::string(), [&] {
-        const Json::Value &format = d->GetData("Format", "", kNull);
-        return format.isString() ? format.asString() : std::string();
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        if (stream == nullptr) {
+            p.error = CRED_REQ_ERR_BAD_PARAM;
+            return false;
+        }
+        p.respStream = stream;
+        if (fn != nullptr) {
+            p.respWriteFn = fn;
+        }
+        return true;
     });
 }
 
+void CredRequest::SetRequestFormat(const std::string &format) {
+    OnPrivate(d, false,
+              [&](CredRequestPrivate &p) { return p.SetRawData("Format", Json::Value(format)); });
+}
+
+std::string CredRequest::GetRequestFormat() {
+    return OnPrivate(d, std::string(),
+                     [](CredRequestPrivate &p) { return StringData(p, "Format"); });
+}
+
 bool CredRequest::SetDefaultTimeout(long seconds) {
-    if (seconds <= 0) {
-        return false;
-    }
-    d->defaultTimeout = seconds;
-    return true;
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        if (seconds <= 0) {
+            return false;
+        }
+        p.defaultTimeout = seconds;
+        return true;
+    });
 }
 
 long CredRequest::GetDefaultTimeout() const {
-    return d->defaultTimeout;
+    return d != nullptr ? d->defaultTimeout : 0;
 }
 
 bool CredRequest::SetResponseTimeout(long seconds) {
-    return kova::Guarded(kUnit, kLineSettingsException, false, [&] {
-        return d->SetRawData("RespTime", Json::Value(static_cast<Json::Int64>(seconds)));
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        return p.SetRawData("RespTime", Json::Value(static_cast<Json::Int64>(seconds)));
     });
 }
 
 long CredRequest::GetResponseTimeout() {
     constexpr long kUnsetResponseTimeout = 120;
-    return kova::Guarded(kUnit, kLineSettingsException, kUnsetResponseTimeout, [&] {
-        const Json::Value &value = d->GetData("RespTime", "", kNull);
+    return OnPrivate(d, kUnsetResponseTimeout, [&](CredRequestPrivate &p) {
+        const Json::Value &value = p.GetData("RespTime", "", kNull);
         if (!value.isIntegral()) {
             return kUnsetResponseTimeout;
         }
@@ -313,46 +343,55 @@ long CredRequest::GetResponseTimeout() {
 
 bool CredRequest::SetEncryptParam(bool /*encrypt*/) {
     // Selects the RSA envelope whatever the argument; SetEncryptMode(0) switches back.
-    return kova::Guarded(kUnit, kLineSettingsException, false, [&] {
-        return d->SetRawData("Crypto", Json::Value(static_cast<int>(CRED_REQ_CRYPTO_RSA)));
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        return p.SetRawData("Crypto", Json::Value(static_cast<int>(CRED_REQ_CRYPTO_RSA)));
     });
 }
 
 bool CredRequest::SetEncryptMode(KOVA::_tag_CRED_REQ_CRYPTO mode) {
-    if (static_cast<int>(mode) > CRED_REQ_CRYPTO_AES) {
-        return false;
-    }
-    return kova::Guarded(kUnit, kLineSettingsException, false, [&] {
-        return d->SetRawData("Crypto", Json::Value(static_cast<int>(mode)));
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        if (static_cast<int>(mode) > CRED_REQ_CRYPTO_AES) {
+            return false;
+        }
+        return p.SetRawData("Crypto", Json::Value(static_cast<int>(mode)));
     });
 }
 
 void CredRequest::SetFollowLocation(bool follow) {
-    d->followLocation = follow;
+    OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        p.followLocation = follow;
+        return true;
+    });
 }
 
 void CredRequest::SetEncoding(bool encoding) {
-    d->encoding = encoding;
+    OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        p.encoding = encoding;
+        return true;
+    });
 }
 
 KOVA::_tag_CRED_REQ_ERR CredRequest::GetError() {
-    return d->error;
+    // A request whose construction failed reports the generic failure.
+    return d != nullptr ? d->error : CRED_REQ_ERR_UNKNOWN;
 }
 
 void CredRequest::SetError(KOVA::_tag_CRED_REQ_ERR error) {
-    d->error = error;
+    if (d != nullptr) {
+        d->error = error;
+    }
 }
 
 CURL *CredRequest::GetCurlHandler() {
-    return d->curl;
+    return d != nullptr ? d->curl : nullptr;
 }
 
 std::string CredRequest::GetResponse() {
-    return kova::Guarded(kUnit, kLineSettingsException, std::string(), [&] { return d->response; });
+    return OnPrivate(d, std::string(), [](CredRequestPrivate &p) { return p.response; });
 }
 
 const Json::Value &CredRequest::GetResponseHeader() {
-    return d->GetResponseHeader();
+    return d != nullptr ? d->GetResponseHeader() : kNull;
 }
 
 }  // namespace KOVA

@@ -35,7 +35,7 @@ constexpr int kLineSetParams = 65;
 
 bool CredRequest::SetWebAPIRequest(const std::string &api, int version, const std::string &method,
                                    const Json::Value &params) {
-    return kova::Guarded(kUnit, kLineFactoryException, false, [&] {
+    return kova::GuardedOn(kUnit, kLineFactoryException, d, false, [&](CredRequestPrivate &) {
         if (!WebApiArgsValid(api, version, method)) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineSetBadParam);
             return false;

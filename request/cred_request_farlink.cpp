@@ -217,43 +217,62 @@ bool CredRequestFarlinkPrivate::SendFarlinkRequest(const Json::Value &body, Json
 
 // ---- CredRequestFarlink: the public object owns one implementation object.
 
-CredRequestFarlink::CredRequestFarlink() : d(new CredRequestFarlinkPrivate(this)) {}
+CredRequestFarlink::CredRequestFarlink()
+    : d(kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException,
+                      static_cast<CredRequestFarlinkPrivate *>(nullptr),
+                      [this] { return new CredRequestFarlinkPrivate(this); })) {}
 
 CredRequestFarlink::~CredRequestFarlink() {
     delete d;
 }
 
+namespace {
+
+// A setting on the implementation object; a client whose construction failed has none and
+// ignores it.
+template <typename Body>
+void Configure(CredRequestFarlinkPrivate *d, Body &&body) {
+    kova::GuardedOn(kFarlinkGuardUnit, kLineFarlinkException, d, false,
+                    [&](CredRequestFarlinkPrivate &p) {
+                        body(p);
+                        return true;
+                    });
+}
+
+}  // namespace
+
 void CredRequestFarlink::SetHTTPS(bool https, bool verify) {
-    d->SetHTTPS(https, verify);
+    Configure(d, [&](CredRequestFarlinkPrivate &p) { p.SetHTTPS(https, verify); });
 }
 
 void CredRequestFarlink::SetServerName(const std::string &name) {
-    kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, [&] { d->SetServerName(name); });
+    Configure(d, [&](CredRequestFarlinkPrivate &p) { p.SetServerName(name); });
 }
 
 void CredRequestFarlink::SetTimeout(long seconds) {
-    d->SetTimeout(seconds);
+    Configure(d, [&](CredRequestFarlinkPrivate &p) { p.SetTimeout(seconds); });
 }
 
 void CredRequestFarlink::SetServerId(const std::string &serverId) {
-    kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, [&] { d->SetServerId(serverId); });
+    Configure(d, [&](CredRequestFarlinkPrivate &p) { p.SetServerId(serverId); });
 }
 
 void CredRequestFarlink::SetServiceId(const std::string &serviceId) {
-    kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, [&] { d->SetServiceId(serviceId); });
+    Configure(d, [&](CredRequestFarlinkPrivate &p) { p.SetServiceId(serviceId); });
 }
 
 KOVA::_tag_CRED_REQ_ERR CredRequestFarlink::GetError() {
-    return d->GetError();
+    // A client whose construction failed reports the generic failure.
+    return d != nullptr ? d->GetError() : CRED_REQ_ERR_UNKNOWN;
 }
 
 Json::Value CredRequestFarlink::GetErrors() {
-    return kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, Json::Value(),
-                         [&] { return d->GetErrors(); });
+    return kova::GuardedOn(kFarlinkGuardUnit, kLineFarlinkException, d, Json::Value(),
+                           [](CredRequestFarlinkPrivate &p) { return p.GetErrors(); });
 }
 
 void CredRequestFarlink::SetError(KOVA::_tag_CRED_REQ_ERR error, const Json::Value &detail) {
-    kova::Guarded(kFarlinkGuardUnit, kLineFarlinkException, [&] { d->SetError(error, detail); });
+    Configure(d, [&](CredRequestFarlinkPrivate &p) { p.SetError(error, detail); });
 }
 
 }  // namespace KOVA

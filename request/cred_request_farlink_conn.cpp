@@ -145,21 +145,22 @@ bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tun
 
 bool CredRequestFarlink::GetAvailableConnInfo(const Json::Value &serverInfo,
                                               Json::Value &candidate) {
-    return kova::Guarded(kFarlinkGuardUnit, kLineConnException, false, [&]() -> bool {
-        if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
-            d->SetError(CRED_REQ_ERR_NO_CONN_INFO, serverInfo);
-            return false;
-        }
-        if (d->GetAvailableDirectConnInfo(serverInfo, candidate)) {
-            return true;
-        }
-        // The tunnel is asked of the site that gave the server information.
-        Json::Value tunnelAnswer;
-        if (!RequestTunnel(tunnelAnswer)) {
-            return false;
-        }
-        return d->GetAvailableRelayConnInfo(tunnelAnswer, candidate);
-    });
+    return kova::GuardedOn(kFarlinkGuardUnit, kLineConnException, d, false,
+                           [&](CredRequestFarlinkPrivate &) -> bool {
+                               if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
+                                   d->SetError(CRED_REQ_ERR_NO_CONN_INFO, serverInfo);
+                                   return false;
+                               }
+                               if (d->GetAvailableDirectConnInfo(serverInfo, candidate)) {
+                                   return true;
+                               }
+                               // The tunnel is asked of the site that gave the server information.
+                               Json::Value tunnelAnswer;
+                               if (!RequestTunnel(tunnelAnswer)) {
+                                   return false;
+                               }
+                               return d->GetAvailableRelayConnInfo(tunnelAnswer, candidate);
+                           });
 }
 
 namespace {

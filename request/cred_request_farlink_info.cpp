@@ -63,88 +63,93 @@ class ServerNameScope {
 }  // namespace
 
 CredRequest *CredRequestFarlink::GetServerInfo() {
-    return kova::Guarded(kFarlinkGuardUnit, kLineInfoException, static_cast<CredRequest *>(nullptr),
-                         [&]() -> CredRequest * {
-                             if (d->GetServerId().empty()) {
-                                 d->SetError(CRED_REQ_ERR_NO_SERVER_ID, Json::Value());
-                                 return nullptr;
-                             }
-                             Json::Value document = ServerCommand(
-                                 "get_server_info", d->GetServerId(), d->GetServiceId());
-                             CredRequest *request = d->CreateFarlinkRequest(document);
-                             if (request == nullptr) {
-                                 d->SetError(CRED_REQ_ERR_UNKNOWN, document);
-                             }
-                             return request;
-                         });
+    return kova::GuardedOn(
+        kFarlinkGuardUnit, kLineInfoException, d, static_cast<CredRequest *>(nullptr),
+        [&](CredRequestFarlinkPrivate &) -> CredRequest * {
+            if (d->GetServerId().empty()) {
+                d->SetError(CRED_REQ_ERR_NO_SERVER_ID, Json::Value());
+                return nullptr;
+            }
+            Json::Value document =
+                ServerCommand("get_server_info", d->GetServerId(), d->GetServiceId());
+            CredRequest *request = d->CreateFarlinkRequest(document);
+            if (request == nullptr) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, document);
+            }
+            return request;
+        });
 }
 
 bool CredRequestFarlink::GetServerInfo(Json::Value &info) {
-    return kova::Guarded(kFarlinkGuardUnit, kLineInfoException, false, [&]() -> bool {
-        std::unique_ptr<CredRequest> request(GetServerInfo());
-        if (!request) {
-            d->SetError(CRED_REQ_ERR_UNKNOWN, Json::Value());
-            return false;
-        }
-        if (!request->Process(true, 0)) {
-            d->SetError(CRED_REQ_ERR_UNKNOWN, static_cast<int>(request->GetError()));
-            return false;
-        }
-        std::string text = request->GetResponse();
-        if (!d->CheckResponse(text, &info)) {
-            d->SetError(CRED_REQ_ERR_SERVER_ERRNO, text);
-            return false;
-        }
-        return true;
-    });
+    return kova::GuardedOn(
+        kFarlinkGuardUnit, kLineInfoException, d, false, [&](CredRequestFarlinkPrivate &) -> bool {
+            std::unique_ptr<CredRequest> request(GetServerInfo());
+            if (!request) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, Json::Value());
+                return false;
+            }
+            if (!request->Process(true, 0)) {
+                d->SetError(CRED_REQ_ERR_UNKNOWN, static_cast<int>(request->GetError()));
+                return false;
+            }
+            std::string text = request->GetResponse();
+            if (!d->CheckResponse(text, &info)) {
+                d->SetError(CRED_REQ_ERR_SERVER_ERRNO, text);
+                return false;
+            }
+            return true;
+        });
 }
 
 bool CredRequestFarlink::GetSiteList(Json::Value &answer) {
-    return kova::Guarded(kFarlinkGuardUnit, kLineInfoException, false, [&]() -> bool {
-        // The site list always comes from the global directory host; the configured
-        // server name is put back on every path.
-        ServerNameScope global(*d, CredRequestFarlinkPrivate::GlobalServerName());
-        return SendCommand(*d, Command("get_site_list"), answer);
-    });
+    return kova::GuardedOn(
+        kFarlinkGuardUnit, kLineInfoException, d, false, [&](CredRequestFarlinkPrivate &) -> bool {
+            // The site list always comes from the global directory host; the configured
+            // server name is put back on every path.
+            ServerNameScope global(*d, CredRequestFarlinkPrivate::GlobalServerName());
+            return SendCommand(*d, Command("get_site_list"), answer);
+        });
 }
 
 bool CredRequestFarlink::GetAvailableServerInfo(Json::Value &info) {
-    return kova::Guarded(kFarlinkGuardUnit, kLineInfoException, false, [&]() -> bool {
-        Json::Value list;
-        if (!GetSiteList(list)) {
-            return false;
-        }
-        const Json::Value *sites = list.find("sites", "sites" + 5);
-        if (sites == nullptr || !sites->isArray()) {
-            return false;
-        }
-        info = Json::Value();
-        for (const Json::Value &site : *sites) {
-            // A failing site leaves its error recorded until a later one overwrites it; the
-            // server name stays at the site that answered so that a tunnel goes there too.
-            // Each entry is taken as text (a number or flag as its text); one that has
-            // none (an array or object) leaves no server name, which fails with 22.
-            d->SetServerName(site.isConvertibleTo(Json::stringValue) ? site.asString()
-                                                                     : std::string());
-            Json::Value candidate;
-            if (GetServerInfo(candidate)) {
-                info.swap(candidate);
-                break;
+    return kova::GuardedOn(
+        kFarlinkGuardUnit, kLineInfoException, d, false, [&](CredRequestFarlinkPrivate &) -> bool {
+            Json::Value list;
+            if (!GetSiteList(list)) {
+                return false;
             }
-        }
-        return !info.empty();
-    });
+            const Json::Value *sites = list.find("sites", "sites" + 5);
+            if (sites == nullptr || !sites->isArray()) {
+                return false;
+            }
+            info = Json::Value();
+            for (const Json::Value &site : *sites) {
+                // A failing site leaves its error recorded until a later one overwrites it; the
+                // server name stays at the site that answered so that a tunnel goes there too.
+                // Each entry is taken as text (a number or flag as its text); one that has
+                // none (an array or object) leaves no server name, which fails with 22.
+                d->SetServerName(site.isConvertibleTo(Json::stringValue) ? site.asString()
+                                                                         : std::string());
+                Json::Value candidate;
+                if (GetServerInfo(candidate)) {
+                    info.swap(candidate);
+                    break;
+                }
+            }
+            return !info.empty();
+        });
 }
 
 bool CredRequestFarlink::RequestTunnel(Json::Value &answer) {
-    return kova::Guarded(kFarlinkGuardUnit, kLineInfoException, false, [&]() -> bool {
-        if (d->GetServerId().empty()) {
-            d->SetError(CRED_REQ_ERR_BAD_PARAM, Json::Value());
-            return false;
-        }
-        return SendCommand(*d, ServerCommand("request_tunnel", d->GetServerId(), d->GetServiceId()),
-                           answer);
-    });
+    return kova::GuardedOn(
+        kFarlinkGuardUnit, kLineInfoException, d, false, [&](CredRequestFarlinkPrivate &) -> bool {
+            if (d->GetServerId().empty()) {
+                d->SetError(CRED_REQ_ERR_BAD_PARAM, Json::Value());
+                return false;
+            }
+            return SendCommand(
+                *d, ServerCommand("request_tunnel", d->GetServerId(), d->GetServiceId()), answer);
+        });
 }
 
 }  // namespace KOVA

@@ -42,7 +42,7 @@ constexpr int kLineLoginToken = 82;
 
 bool CredRequest::Login(const std::string &account, const std::string &password,
                         const std::string &url) {
-    return kova::Guarded(kUnit, kLineLoginException, false, [&] {
+    return kova::GuardedOn(kUnit, kLineLoginException, d, false, [&](CredRequestPrivate &) {
         const std::string target = url.empty() ? GetURL() : url;
         if (!d->buildCredByURL(target)) {
             SetError(CRED_REQ_ERR_LOGIN_PARAM);
@@ -74,7 +74,7 @@ bool CredRequest::Login(const std::string &account, const std::string &password,
 }
 
 bool CredRequest::Logout() {
-    return kova::Guarded(kUnit, kLineLoginException, false, [&] {
+    return kova::GuardedOn(kUnit, kLineLoginException, d, false, [&](CredRequestPrivate &) {
         if (d->cred == nullptr || d->sess == nullptr || d->cred->host.empty() ||
             d->cred->protocol.empty() || d->sess->access_token.empty()) {
             return false;
@@ -84,7 +84,7 @@ bool CredRequest::Logout() {
 }
 
 bool CredRequest::isAPIValid(const std::string &api) {
-    return kova::Guarded(kUnit, kLineLoginException, false, [&] {
+    return kova::GuardedOn(kUnit, kLineLoginException, d, false, [&](CredRequestPrivate &) {
         if (!d->buildCredByURL(GetURL())) {
             return false;
         }

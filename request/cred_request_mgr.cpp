@@ -3,15 +3,17 @@
 #include "kovacredential/cred_request_mgr.h"
 
 #include <errno.h>
+#include <limits.h>
 #include <string.h>
-#include <sys/select.h>
-#include <sys/time.h>
 
+#include <algorithm>
+#include <chrono>
 #include <memory>
 #include <new>
 
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
+#include "request/cred_request_util_p.h"
 
 namespace KOVA {
 
@@ -24,6 +26,8 @@ constexpr char kLoopName[] = "curlHandlerProcess";
 constexpr long kDefaultWaitSeconds = 120;
 // Quiet waits with a connection still in progress that one run tolerates.
 constexpr int kMaxSelectRetries = 30;
+// Line of the manager's exception-guard records.
+constexpr int kLineMgrException = 100;
 
 struct MultiDeleter {
     void operator()(CURLM *multi) const { curl_multi_cleanup(multi); }
@@ -61,13 +65,11 @@ int CredRequestMgr::AddCredRequest(KOVA::CredRequest *request) {
         SetError(CRED_REQ_ERR_BAD_PARAM);
         return -1;
     }
-    try {
+    // The caller keeps the request when it could not be taken.
+    return kova::Guarded(kUnit, kLineMgrException, -1, [&] {
         requests.push_back(request);
-    } catch (...) {
-        // The caller keeps the request when it could not be taken.
-        return -1;
-    }
-    return static_cast<int>(requests.size()) - 1;
+        return static_cast<int>(requests.size()) - 1;
+    });
 }
 
 namespace {
@@ -127,15 +129,18 @@ int CredRequestMgr::AddCredRequest(const std::string &protocol, const std::strin
         SetError(CRED_REQ_ERR_BAD_PARAM);
         return -1;
     }
-    try {
+    return kova::Guarded(kUnit, kLineMgrException, -1, [&] {
         // The scratch record gets the first negative id without a cached description, so
-        // that it collides neither with a stored credential nor with another server's entry.
+        // that it collides neither with a stored credential nor with another server's entry;
+        // the id is reserved at once, so that a manager on another thread picks another.
         KOVA_CRED cred;
-        long pseudoId = -1;
-        while (CredRequestUtil::IsCredIdCached(pseudoId)) {
-            --pseudoId;
-        }
-        cred.id = static_cast<int32_t>(pseudoId);
+        cred.id = static_cast<int32_t>(ReserveUncachedCredId());
+        // Whatever happens from here on, the description fetched under the pseudo-id goes
+        // again so that the id can be handed out next time.
+        struct DropDescription {
+            const KOVA_CRED *cred;
+            ~DropDescription() { CredRequestUtil::RemoveWebAPIDesc(cred); }
+        } dropDescription{&cred};
         cred.host = host;
         cred.protocol = protocol;
         cred.port = port;
@@ -144,18 +149,6 @@ int CredRequestMgr::AddCredRequest(const std::string &protocol, const std::strin
         if (!request) {
             return -1;
         }
-        // Whatever happens from here on, the description fetched under the pseudo-id goes
-        // again so that the id can be handed out next time.
-        struct DropDescription {
-            const KOVA_CRED *cred;
-            ~DropDescription() {
-                try {
-                    CredRequestUtil::RemoveWebAPIDesc(cred);
-                } catch (...) {
-                }
-            }
-        } dropDescription{&cred};
-
         if (!CredRequestUtil::SetWebAPIURL(&cred, api, version, method, request.get())) {
             SetError(CRED_REQ_ERR_QUERY_FAIL);
             return -1;
@@ -179,9 +172,7 @@ int CredRequestMgr::AddCredRequest(const std::string &protocol, const std::strin
             request.release();
         }
         return index;
-    } catch (...) {
-        return -1;
-    }
+    });
 }
 
 KOVA::CredRequest *CredRequestMgr::GetRequest(int index) {
@@ -221,6 +212,7 @@ void CredRequestMgr::Clear() {
 namespace {
 constexpr int kLineSocketFunctionFail = 230;
 constexpr int kLineSocketDataFail = 231;
+constexpr int kLineAddHandleFail = 262;
 }  // namespace
 
 bool CredRequestMgr::Run() {
@@ -258,7 +250,12 @@ bool CredRequestMgr::Run() {
         // The select loop below is the only time limit of a managed transfer.
         request->SetResponseTimeout(0);
         if (request->Process(false, 0)) {
-            curl_multi_add_handle(multi.get(), request->GetCurlHandler());
+            code = curl_multi_add_handle(multi.get(), request->GetCurlHandler());
+            if (code != CURLM_OK) {
+                // The request is left out, like one whose set-up failed.
+                request->SetError(CRED_REQ_ERR_CURL_INTERNAL);
+                LogMultiError(kLineAddHandleFail, code);
+            }
         }
     }
     return curlHandlerProcess(multi.get(),
@@ -275,13 +272,12 @@ std::string CredRequestMgr::GetResponse(int index) {
 
 Json::Value CredRequestMgr::GetAllResponse() {
     Json::Value all(Json::arrayValue);
-    try {
+    kova::Guarded(kUnit, kLineMgrException, [&] {
         for (CredRequest *request : requests) {
             // A slot emptied by RemoveRequest keeps its place with an empty text.
             all.append(request != nullptr ? request->GetResponse() : std::string());
         }
-    } catch (...) {
-    }
+    });
     return all;
 }
 
@@ -310,6 +306,33 @@ constexpr int kLineSelectTimeout = 339;
 constexpr int kLineReadyPerformFail = 343;
 }  // namespace
 
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using Millis = std::chrono::milliseconds;
+
+// Waits up to `ms` for activity on the multi handle's sockets. curl_multi_poll also sleeps
+// when libcurl has no socket yet; the older curl_multi_wait returns at once then.
+CURLMcode WaitForSockets(CURLM *multi, int ms, int *ready) {
+#if LIBCURL_VERSION_NUM >= 0x074200
+    return curl_multi_poll(multi, nullptr, 0, ms, ready);
+#else
+    return curl_multi_wait(multi, nullptr, 0, ms, ready);
+#endif
+}
+
+// Whether libcurl's wait failed in poll itself (errno tells why) rather than in its own state.
+bool IsPollFailure(CURLMcode code) {
+#if LIBCURL_VERSION_NUM >= 0x075400
+    return code == CURLM_UNRECOVERABLE_POLL;
+#else
+    (void)code;  // older libcurl does not report a failed poll
+    return false;
+#endif
+}
+
+}  // namespace
+
 bool CredRequestMgr::curlHandlerProcess(CURLM *multi, long waitSeconds) {
     int running = 0;
     CURLMcode code = curl_multi_perform(multi, &running);
@@ -318,77 +341,78 @@ bool CredRequestMgr::curlHandlerProcess(CURLM *multi, long waitSeconds) {
         LogMultiError(kLineFirstPerformFail, code);
         return false;
     }
+    // The run ends with a time-out once no socket has been ready for a whole wait. The wait is
+    // polled (descriptors of any number), never past libcurl's own next timer, and resumed
+    // after a signal; each wake-up lets libcurl advance.
+    const Millis wholeWait =
+        std::chrono::duration_cast<Millis>(std::chrono::seconds(std::max(waitSeconds, 0L)));
+    Clock::time_point quietSince = Clock::now();
     int retries = 0;
     for (;;) {
         errno = 0;
-        int maxFd = -1;
         long curlTimeout = -1;
-        fd_set readSet;
-        fd_set writeSet;
-        fd_set exceptSet;
-        FD_ZERO(&readSet);
-        FD_ZERO(&writeSet);
-        FD_ZERO(&exceptSet);
         curl_multi_timeout(multi, &curlTimeout);
-
-        struct timeval timeout;
-        if (curlTimeout > 1) {
-            timeout.tv_sec = waitSeconds;
-            timeout.tv_usec = 0;
-        } else {
-            timeout.tv_sec = 1;
-            timeout.tv_usec = 0;
+        const Millis quiet = std::chrono::duration_cast<Millis>(Clock::now() - quietSince);
+        Millis wait = std::max(wholeWait - quiet, Millis(0));
+        if (curlTimeout >= 0) {
+            wait = std::min(wait, Millis(curlTimeout));
         }
-        code = curl_multi_fdset(multi, &readSet, &writeSet, &exceptSet, &maxFd);
+        int ready = 0;
+        code = WaitForSockets(multi, static_cast<int>(std::min<Millis::rep>(wait.count(), INT_MAX)),
+                              &ready);
         if (code != CURLM_OK) {
-            SetError(CRED_REQ_ERR_CURL_INTERNAL);
-            LogMultiError(kLineFdsetFail, code);
-            return false;
-        }
-
-        int ready = select(maxFd + 1, &readSet, &writeSet, &exceptSet, &timeout);
-        if (ready == -1) {
-            int err = errno;
+            const int err = errno;
+            if (!IsPollFailure(code)) {
+                SetError(CRED_REQ_ERR_CURL_INTERNAL);
+                LogMultiError(kLineFdsetFail, code);
+                return false;
+            }
+            if (err == EINTR) {
+                continue;  // a signal cut the wait short; the quiet time goes on counting
+            }
             kova::Log("%s:%d %s select error: %s[%d]", kUnit, kLineSelectError, kLoopName,
                       strerror(err), err);
             SetError(CRED_REQ_ERR_SELECT);
             return false;
         }
         if (ready > 0) {
+            quietSince = Clock::now();
             code = curl_multi_perform(multi, &running);
             if (code != CURLM_OK) {
                 SetError(CRED_REQ_ERR_CURL_INTERNAL);
                 LogMultiError(kLineReadyPerformFail, code);
                 return false;
             }
+        } else if (Clock::now() - quietSince < wholeWait) {
+            // libcurl's timer is due (or a signal woke the wait): let it advance.
+            code = curl_multi_perform(multi, &running);
+            if (code != CURLM_OK) {
+                SetError(CRED_REQ_ERR_CURL_INTERNAL);
+                LogMultiError(kLineIdlePerformFail, code);
+                return false;
+            }
         } else {
-            int err = errno;
-            if (maxFd == -1) {
-                // libcurl has no socket to wait on yet; let it advance its own state.
-                code = curl_multi_perform(multi, &running);
-                if (code != CURLM_OK) {
-                    SetError(CRED_REQ_ERR_CURL_INTERNAL);
-                    LogMultiError(kLineIdlePerformFail, code);
-                    return false;
-                }
-            } else if (retries > kMaxSelectRetries) {
+            const int err = errno;
+            if (retries > kMaxSelectRetries) {
                 kova::Log("%s:%d Exceed max retries times!", kUnit, kLineMaxRetries);
                 kova::Log("%s:%d %s select timeout(%ld): %s[%d]", kUnit, kLineSelectTimeout,
                           kLoopName, waitSeconds, strerror(err), err);
                 SetError(CRED_REQ_ERR_TIMEOUT);
                 return false;
-            } else if (err == EINPROGRESS || err == EAGAIN) {
-                code = curl_multi_perform(multi, &running);
-                ++retries;
-                if (code != CURLM_OK) {
-                    SetError(CRED_REQ_ERR_CURL_INTERNAL);
-                    LogMultiError(kLineRetryPerformFail, code);
-                    return false;
-                }
-            } else {
+            }
+            if (err != EINPROGRESS && err != EAGAIN) {
                 kova::Log("%s:%d %s select timeout(%ld): %s[%d]", kUnit, kLineSelectTimeout,
                           kLoopName, waitSeconds, strerror(err), err);
                 SetError(CRED_REQ_ERR_TIMEOUT);
+                return false;
+            }
+            // A connection still in progress earns another whole wait, a limited number of times.
+            code = curl_multi_perform(multi, &running);
+            ++retries;
+            quietSince = Clock::now();
+            if (code != CURLM_OK) {
+                SetError(CRED_REQ_ERR_CURL_INTERNAL);
+                LogMultiError(kLineRetryPerformFail, code);
                 return false;
             }
         }

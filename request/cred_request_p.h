@@ -5,6 +5,9 @@
 
 #include <stdint.h>
 #include <stdio.h>
+#include <sys/types.h>
+
+#include <atomic>
 
 #include <string>
 
@@ -61,6 +64,21 @@ class CredRequestPrivate {
                                       const Json::Value *message);
     static int DebugCallback(void *handle, curl_infotype type, char *data, size_t size, void *user);
 
+    // ---- Streams across attempts. Every attempt of Process, and every re-send libcurl makes
+    // (a redirect that keeps the POST), starts from where the streams stood when Process began.
+    // Notes where the request and response streams stand and the shared stream limit.
+    void MarkStreams();
+    // Puts the streams back to the mark, cutting off what the last attempt wrote to the
+    // response stream (with `cutResponse` even when it wrote nothing). False when that cannot
+    // be done: a request stream that is not seekable (a pipe) and was partly sent, a response
+    // stream that cannot be cut back.
+    bool RewindStreams(bool cutResponse);
+    // libcurl's read, seek and write callbacks for the streams (data: this object). They call
+    // ReadFromStream and WriteToStream (or the caller's writer) and count what passed.
+    static size_t ReadBody(char *buffer, size_t size, size_t nmemb, void *self);
+    static int SeekBody(void *self, curl_off_t offset, int origin);
+    static size_t WriteBody(char *data, size_t size, size_t nmemb, void *self);
+
     // Fills protocol, host and port of the request's own credential from `url`.
     bool buildCredByURL(const std::string &url);
 
@@ -70,11 +88,12 @@ class CredRequestPrivate {
 
     // The request-stream limit, shared by every request of the process: SetReqStreamSize sets
     // it, constructing a request clears `reqStreamLimited`, and ReadFromStream consumes it.
-    static bool reqStreamLimited;
-    static uint32_t reqStreamRemaining;
+    // Atomic, so that requests on several threads share it without a data race.
+    static std::atomic<bool> reqStreamLimited;
+    static std::atomic<uint32_t> reqStreamRemaining;
     // Set the first time a response header reaches standard output; never cleared, so the
     // standard-output mode's message line is written once per process.
-    static bool headerMessageShown;
+    static std::atomic<bool> headerMessageShown;
 
     // Fields, in this order.
     KOVA_CRED *cred;
@@ -96,6 +115,16 @@ class CredRequestPrivate {
     long defaultTimeout = 120;
     bool followLocation = true;
     bool encoding = false;
+
+    // Stream positions of the current Process (see MarkStreams): -1 when a stream is not set
+    // or not seekable.
+    off_t reqStreamStart = -1;
+    off_t respStreamStart = -1;
+    bool markLimited = false;
+    uint32_t markRemaining = 0;
+    // Bytes that passed through the stream callbacks since the mark or the last rewind.
+    uint64_t reqStreamRead = 0;
+    uint64_t respStreamWritten = 0;
 };
 
 }  // namespace KOVA

@@ -20,26 +20,18 @@ bool PausesBeforeRetry(CURLcode rc) {
            rc == CURLE_OPERATION_TIMEDOUT;
 }
 
-// Empties the response stream so that the next attempt does not append to a partial body.
-bool RewindResponseStream(FILE *stream) {
-    // Buffered bytes of the failed attempt are flushed first: written after the truncation,
-    // they would land behind a hole at their old offset.
-    fflush(stream);
-    if (ftruncate(fileno(stream), 0) != 0) {
-        return false;
-    }
-    fseek(stream, 0, SEEK_SET);
-    return true;
-}
-
 }  // namespace
 
 constexpr int kLineInitFailed = 47;
 constexpr int kLineCurlError = 98;
 constexpr int kLineResponseCode = 110;
 constexpr int kLineHttpError = 117;
+constexpr int kLineProcessException = 133;
 
 bool CredRequest::Process(bool perform, int retries) {
+    if (d == nullptr) {
+        return false;
+    }
     try {
         if (!d->InitCurlHandler()) {
             kova::Log("%s:%d (pid=%d)InitCurlHandler failed", kUnit, kLineInitFailed,
@@ -47,6 +39,9 @@ bool CredRequest::Process(bool perform, int retries) {
             return false;
         }
         d->response.clear();
+        // Every attempt, and every re-send libcurl makes for a redirect, starts from where the
+        // streams stand now (the manager drives the transfer itself after a set-up only).
+        d->MarkStreams();
         if (!perform) {
             return true;
         }
@@ -55,20 +50,20 @@ bool CredRequest::Process(bool perform, int retries) {
         CURLcode rc = CURLE_OK;
         for (int attempt = 1; attempt <= attempts; ++attempt) {
             rc = curl_easy_perform(d->curl);
-            if (rc == CURLE_OK) {
+            if (rc == CURLE_OK || attempt == attempts) {
                 break;
             }
-            if (PausesBeforeRetry(rc)) {
-                if (attempt == attempts) {
-                    break;
-                }
-                if (d->respStream != nullptr && !RewindResponseStream(d->respStream)) {
-                    break;
-                }
+            // The next attempt starts clean: an empty response string, the streams back at
+            // their mark. An attempt whose streams cannot be put back is the result.
+            const bool pause = PausesBeforeRetry(rc);
+            d->response.clear();
+            if (!d->RewindStreams(pause)) {
+                break;
+            }
+            if (pause) {
                 sleep(1);
             }
         }
-
         const int code = static_cast<int>(rc);
         if (code != CURLE_OK) {
             switch (code) {
@@ -127,6 +122,7 @@ bool CredRequest::Process(bool perform, int retries) {
                 return false;
         }
     } catch (...) {
+        kova::LogCaughtException(kUnit, kLineProcessException);
         d->error = CRED_REQ_ERR_UNKNOWN;
         return false;
     }

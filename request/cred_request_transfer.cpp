@@ -1,6 +1,7 @@
 // Transfer set-up of KOVA::CredRequest: the settings document becomes one configured libcurl
 // easy handle, plus the body, header and trace callbacks that handle uses.
 #include <stdlib.h>
+#include <unistd.h>
 
 #include <stdexcept>
 
@@ -31,10 +32,14 @@ std::string ValueText(const Json::Value &value) {
 }
 
 // The caller's TLS context callback returns nothing, while libcurl reads a CURLcode from its
-// SSL context function; this adapter calls it with the caller's data and reports success.
+// SSL context function; this adapter calls it with the caller's data and reports success. It
+// reads the callback when the connection is made, so that SetSSLVerify may change or clear it
+// between transfers: a cleared callback is simply not called.
 CURLcode SslCtxAdapter(CURL *curl, void *sslCtx, void *user) {
     const auto *p = static_cast<const CredRequestPrivate *>(user);
-    p->sslCtxFn(curl, sslCtx, p->sslCtxData);
+    if (p->sslCtxFn != nullptr) {
+        p->sslCtxFn(curl, sslCtx, p->sslCtxData);
+    }
     return CURLE_OK;
 }
 
@@ -214,9 +219,13 @@ bool CredRequestPrivate::InitCurlHandler() {
         }
 #pragma GCC diagnostic pop
     } else if (reqStream != nullptr) {
+        // The body is read through ReadFromStream; the seek callback lets libcurl send it
+        // again from the start (a redirect that keeps the POST, an authentication round).
         if (!SetOption(CURLOPT_POST, 1L) ||
-            !SetOption(CURLOPT_READFUNCTION, &CredRequestPrivate::ReadFromStream) ||
-            !SetOption(CURLOPT_READDATA, reqStream)) {
+            !SetOption(CURLOPT_READFUNCTION, &CredRequestPrivate::ReadBody) ||
+            !SetOption(CURLOPT_READDATA, static_cast<void *>(this)) ||
+            !SetOption(CURLOPT_SEEKFUNCTION, &CredRequestPrivate::SeekBody) ||
+            !SetOption(CURLOPT_SEEKDATA, static_cast<void *>(this))) {
             return false;
         }
     } else if (HasData("PostParam")) {
@@ -244,9 +253,11 @@ bool CredRequestPrivate::InitCurlHandler() {
         }
     }
 
+    // A response stream is written through WriteToStream, or the caller's writer (which gets
+    // the stream as its data), counting what an attempt wrote.
     if (respStream != nullptr) {
-        if (!SetOption(CURLOPT_WRITEFUNCTION, &CredRequestPrivate::WriteToStream) ||
-            !SetOption(CURLOPT_WRITEDATA, respStream)) {
+        if (!SetOption(CURLOPT_WRITEFUNCTION, &CredRequestPrivate::WriteBody) ||
+            !SetOption(CURLOPT_WRITEDATA, static_cast<void *>(this))) {
             return false;
         }
     } else {
@@ -254,9 +265,6 @@ bool CredRequestPrivate::InitCurlHandler() {
             !SetOption(CURLOPT_WRITEDATA, &response)) {
             return false;
         }
-    }
-    if (respWriteFn != nullptr && !SetOption(CURLOPT_WRITEFUNCTION, respWriteFn)) {
-        return false;
     }
     return true;
 }
@@ -277,22 +285,121 @@ size_t CredRequestPrivate::WriteToStream(char *data, size_t size, size_t nmemb, 
 
 size_t CredRequestPrivate::ReadFromStream(char *buffer, size_t size, size_t nmemb, FILE *stream) {
     size_t n = nmemb;
-    if (reqStreamLimited) {
-        if (reqStreamRemaining == 0) {
+    const bool limited = reqStreamLimited;
+    if (limited) {
+        const uint32_t remaining = reqStreamRemaining;
+        if (remaining == 0) {
             return 0;
         }
-        if (size != 0 && reqStreamRemaining < size * nmemb) {
-            n = reqStreamRemaining / size;
+        if (size != 0 && remaining < size * nmemb) {
+            n = remaining / size;
         }
     }
     const size_t read = fread(buffer, size, n, stream);
     if (read < n) {
-        return read;
+        // A short read ends the body; a read error must not pass for its end, or the server
+        // would take a cut body for a whole one.
+        return ferror(stream) ? CURL_READFUNC_ABORT : read;
     }
-    if (reqStreamLimited) {
+    if (limited) {
         reqStreamRemaining -= static_cast<uint32_t>(read * size);
     }
     return read;
+}
+
+size_t CredRequestPrivate::ReadBody(char *buffer, size_t size, size_t nmemb, void *self) {
+    auto *p = static_cast<CredRequestPrivate *>(self);
+    const size_t read = ReadFromStream(buffer, size, nmemb, p->reqStream);
+    if (read != CURL_READFUNC_ABORT) {
+        p->reqStreamRead += read * size;
+    }
+    return read;
+}
+
+int CredRequestPrivate::SeekBody(void *self, curl_off_t offset, int origin) {
+    auto *p = static_cast<CredRequestPrivate *>(self);
+    // libcurl only asks for a position from the start of the body.
+    if (origin != SEEK_SET || offset < 0) {
+        return CURL_SEEKFUNC_CANTSEEK;
+    }
+    if (offset == 0 && p->reqStreamRead == 0) {
+        return CURL_SEEKFUNC_OK;  // nothing was read yet, also from a pipe
+    }
+    if (p->reqStreamStart < 0) {
+        return CURL_SEEKFUNC_CANTSEEK;
+    }
+    if (fseeko(p->reqStream, p->reqStreamStart + static_cast<off_t>(offset), SEEK_SET) != 0) {
+        return CURL_SEEKFUNC_FAIL;
+    }
+    clearerr(p->reqStream);
+    if (p->markLimited) {
+        const uint64_t skipped = static_cast<uint64_t>(offset);
+        reqStreamRemaining =
+            skipped < p->markRemaining ? p->markRemaining - static_cast<uint32_t>(skipped) : 0;
+        reqStreamLimited = true;
+    }
+    p->reqStreamRead = static_cast<uint64_t>(offset);
+    return CURL_SEEKFUNC_OK;
+}
+
+size_t CredRequestPrivate::WriteBody(char *data, size_t size, size_t nmemb, void *self) {
+    auto *p = static_cast<CredRequestPrivate *>(self);
+    const size_t written = p->respWriteFn != nullptr
+                               ? p->respWriteFn(data, size, nmemb, p->respStream)
+                               : WriteToStream(data, size, nmemb, p->respStream);
+    p->respStreamWritten += written * size;
+    return written;
+}
+
+namespace {
+
+// The position of a stream, -1 when it cannot be told (a pipe, a socket).
+off_t StreamPosition(FILE *stream) {
+    return stream != nullptr ? ftello(stream) : -1;
+}
+
+}  // namespace
+
+void CredRequestPrivate::MarkStreams() {
+    reqStreamStart = StreamPosition(reqStream);
+    // With a writer of the caller's the response "stream" is only that writer's data.
+    respStreamStart = respWriteFn == nullptr ? StreamPosition(respStream) : -1;
+    markLimited = reqStreamLimited;
+    markRemaining = reqStreamRemaining;
+    reqStreamRead = 0;
+    respStreamWritten = 0;
+}
+
+bool CredRequestPrivate::RewindStreams(bool cutResponse) {
+    if (reqStream != nullptr) {
+        // A body read from a pipe cannot be sent again.
+        if (reqStreamRead > 0 &&
+            (reqStreamStart < 0 || fseeko(reqStream, reqStreamStart, SEEK_SET) != 0)) {
+            return false;
+        }
+        clearerr(reqStream);
+        if (markLimited) {
+            reqStreamRemaining = markRemaining;
+            reqStreamLimited = true;
+        }
+    }
+    if (respStream != nullptr && respWriteFn != nullptr) {
+        // What the caller's writer took cannot be taken back.
+        if (respStreamWritten > 0) {
+            return false;
+        }
+    } else if (respStream != nullptr && (cutResponse || respStreamWritten > 0)) {
+        // Buffered bytes of the failed attempt are flushed first: written after the cut, they
+        // would land behind a hole at their old offset.
+        fflush(respStream);
+        if (respStreamStart < 0 || ftruncate(fileno(respStream), respStreamStart) != 0 ||
+            fseeko(respStream, respStreamStart, SEEK_SET) != 0) {
+            return false;
+        }
+    }
+    reqStreamRead = 0;
+    respStreamWritten = 0;
+    return true;
 }
 
 constexpr int kLineHeaderNoValue = 307;
@@ -325,8 +432,7 @@ size_t CredRequestPrivate::WriteHeaderToJsonValue(char *data, size_t size, size_
 size_t CredRequestPrivate::WriteHeaderToStdout(char *data, size_t size, size_t nmemb,
                                                const Json::Value *message) {
     const size_t total = size * nmemb;
-    if (!headerMessageShown) {
-        headerMessageShown = true;
+    if (!headerMessageShown.exchange(true)) {
         if (message != nullptr && message->isString()) {
             const char *begin = nullptr;
             const char *end = nullptr;

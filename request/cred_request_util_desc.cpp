@@ -5,11 +5,16 @@
 // The cache is read with jsoncpp's inserting subscript on purpose: a look-up of an API the
 // server does not list leaves a null member under that name, so the next look-up finds it
 // empty and queries the server again.
+//
+// The cache is process-wide; every access of the library takes gDescLock for the time of
+// one look-up or store, never across a query to a server.
 #include <exception>
+#include <mutex>
 #include <string>
 
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
+#include "request/cred_request_util_p.h"
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
 
@@ -18,6 +23,9 @@ namespace KOVA {
 namespace {
 
 const char kUnit[] = "cred_request_util";
+
+std::mutex gDescLock;
+using DescGuard = std::lock_guard<std::mutex>;
 
 // A credential id as the cache names it: through a JSON integer, so -1 is "-1".
 std::string CacheKey(long id) {
@@ -48,16 +56,24 @@ bool ApiCached(const std::string &key, const std::string &api) {
     return entry.isObject() && entry.isMember(api) && !entry[api].empty();
 }
 
-// The cached description of `api` through the inserting subscript (a missing API leaves a
-// null member); null when the entry is not an object at all.
-Json::Value &ApiEntry(const std::string &key, const std::string &api) {
-    static Json::Value none;
-    none = Json::Value();
+// A copy of the cached description of `api`, read through the inserting subscript (a missing
+// API leaves a null member); null when the entry is not an object at all.
+Json::Value ApiEntry(const std::string &key, const std::string &api) {
     Json::Value &entry = DescRoot()[key];
     if (!entry.isNull() && !entry.isObject()) {
-        return none;
+        return Json::Value();
     }
     return entry[api];
+}
+
+bool Cached(const std::string &key, const std::string &api) {
+    const DescGuard lock(gDescLock);
+    return ApiCached(key, api);
+}
+
+Json::Value LockedApiEntry(const std::string &key, const std::string &api) {
+    const DescGuard lock(gDescLock);
+    return ApiEntry(key, api);
 }
 
 std::string TextMember(const Json::Value &object, const char *name) {
@@ -113,6 +129,7 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
             kova::Log("%s:%d Query request fail!", kUnit, kLineDescFail);
             return false;
         }
+        const DescGuard lock(gDescLock);
         DescRoot()[key] = answer["data"];
         return true;
     });
@@ -121,6 +138,7 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
 void CredRequestUtil::RemoveWebAPIDesc(const KOVA_CRED *cred) {
     kova::Guarded(kUnit, kLineDescException, 0, [&] {
         if (cred != nullptr) {
+            const DescGuard lock(gDescLock);
             Json::Value &root = DescRoot();
             if (root.isObject()) {
                 root.removeMember(CacheKey(cred->id));
@@ -132,9 +150,22 @@ void CredRequestUtil::RemoveWebAPIDesc(const KOVA_CRED *cred) {
 
 bool CredRequestUtil::IsCredIdCached(long id) {
     return kova::Guarded(kUnit, kLineDescException, false, [&] {
+        const std::string key = CacheKey(id);
+        const DescGuard lock(gDescLock);
         Json::Value &root = DescRoot();
-        return root.isObject() && root.isMember(CacheKey(id));
+        return root.isObject() && root.isMember(key);
     });
+}
+
+long ReserveUncachedCredId() {
+    const DescGuard lock(gDescLock);
+    Json::Value &root = DescRoot();
+    long id = -1;
+    while (root.isMember(CacheKey(id))) {
+        --id;
+    }
+    root[CacheKey(id)] = Json::Value();
+    return id;
 }
 
 constexpr int kLinePathBadParam = 141;
@@ -148,12 +179,12 @@ std::string CredRequestUtil::GetWebAPIPath(const KOVA_CRED *cred, const std::str
             return "";
         }
         const std::string key = CacheKey(cred->id);
-        if (!ApiCached(key, api) && !GetWebAPIDesc(cred)) {
+        if (!Cached(key, api) && !GetWebAPIDesc(cred)) {
             kova::Log("%s:%d cannot get cgi path from id=[%s]", kUnit, kLinePathNoDesc,
                       key.c_str());
             return "";
         }
-        Json::Value desc = ApiEntry(key, api);
+        Json::Value desc = LockedApiEntry(key, api);
         if (desc.empty()) {
             kova::Log("%s:%d No such api: %s", kUnit, kLinePathNoApi, api.c_str());
             m_errCode = CRED_REQ_ERR_NO_SUCH_API;
@@ -187,13 +218,13 @@ bool CredRequestUtil::GetWebAPIRequestFormat(const KOVA_CRED *cred, const std::s
             return false;
         }
         const std::string key = CacheKey(cred->id);
-        if (!ApiCached(key, api) && !GetWebAPIDesc(cred)) {
+        if (!Cached(key, api) && !GetWebAPIDesc(cred)) {
             kova::Log("%s:%d Cannot find api[%s] description", kUnit, kLineFormatNoDesc,
                       api.c_str());
             return false;
         }
         // An API the server does not list gives "" here, not a failure.
-        format = TextMember(ApiEntry(key, api), "requestFormat");
+        format = TextMember(LockedApiEntry(key, api), "requestFormat");
         return true;
     });
 }

@@ -1,6 +1,13 @@
 // The request manager with plain requests against loopback servers: ownership and slots,
 // concurrent runs, set-up failures, silent and refusing servers, and the socket callback.
 
+#include <fcntl.h>
+#include <pthread.h>
+#include <signal.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <atomic>
 #include <chrono>
 #include <functional>
 #include <memory>
@@ -13,6 +20,7 @@
 #include "kovacredential/cred_request_mgr.h"
 #include "simlib/loopback_server.h"
 #include "simlib/relay_sim.h"
+#include "support/child.h"
 #include "support/interpose.h"
 
 namespace {
@@ -278,6 +286,91 @@ TEST_F(ManagerTest, SocketCallbackMarksOnlyTheRemovedHeldRequest) {
     EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, second->GetError());
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, first->GetError());
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+}
+
+// A large raw body makes libcurl ask for "100 Continue"; a server that never sends it is waited
+// for only as long as libcurl's own timer, not for the manager's whole wait.
+TEST_F(ManagerTest, WakesForLibcurlsOwnTimer) {
+    const size_t size = 2u << 20;
+    kovasim::RawServer server([size](kovasim::RawServer::Connection &c) {
+        const std::string got = std::to_string(c.ReadBody(size, 10000).size());
+        c.Send("HTTP/1.1 200 OK\r\nContent-Length: " + std::to_string(got.size()) + "\r\n\r\n" +
+               got);
+    });
+    ASSERT_TRUE(server.Start());
+    CredRequestMgr mgr;
+    CredRequest *request = NewRequest(server.BaseUrl() + "/upload");
+    ASSERT_TRUE(request->AddRawParam(std::string(size, 'x')));
+    request->SetResponseTimeout(5);
+    ASSERT_EQ(0, mgr.AddCredRequest(request));
+    EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+    EXPECT_EQ(std::to_string(size), mgr.GetResponse(0));
+}
+
+// With more descriptors open than a select set holds, a fast server is answered at once and a
+// silent one ends the run with the time-out, both within the child's alarm.
+TEST_F(ManagerTest, DescriptorsBeyondTheSelectLimit) {
+    kovasim::RawServer silent([](kovasim::RawServer::Connection &c) { c.WaitForClose(10000); });
+    ASSERT_TRUE(silent.Start());
+    const std::string fast = Url("/hello");
+    const std::string never = silent.BaseUrl() + "/never";
+    EXPECT_EQ(kova_test::RunInChild(
+                  60,
+                  [&] {
+                      struct rlimit limit;
+                      getrlimit(RLIMIT_NOFILE, &limit);
+                      limit.rlim_cur = limit.rlim_max;
+                      setrlimit(RLIMIT_NOFILE, &limit);
+                      for (int i = 0; i < 1100; ++i) {
+                          if (open("/dev/null", O_RDONLY) < 0) {
+                              return 2;
+                          }
+                      }
+                      CredRequestMgr answered;
+                      answered.AddCredRequest(NewRequest(fast));
+                      const bool ok = answered.Run() && answered.GetResponse(0) == "hello";
+                      CredRequestMgr quiet;
+                      CredRequest *request = NewRequest(never);
+                      request->SetResponseTimeout(2);
+                      quiet.AddCredRequest(request);
+                      const bool timedOut =
+                          !quiet.Run() && quiet.GetError() == KOVA::CRED_REQ_ERR_TIMEOUT;
+                      fprintf(stderr, "answered %d timed out %d\n", ok, timedOut);
+                      return ok && timedOut ? 0 : 1;
+                  }),
+              "exit 0");
+}
+
+void IgnoreSignal(int) {}
+
+// A signal that interrupts the wait does not end the run.
+TEST_F(ManagerTest, SignalsDuringTheWaitAreRidden) {
+    const std::string slow = Url("/slow?n=1");
+    EXPECT_EQ(kova_test::RunInChild(30,
+                                    [&] {
+                                        struct sigaction action = {};
+                                        action.sa_handler = IgnoreSignal;  // no SA_RESTART
+                                        sigaction(SIGUSR1, &action, nullptr);
+                                        const pthread_t runner = pthread_self();
+                                        std::atomic<bool> done{false};
+                                        std::thread signaller([&] {
+                                            while (!done) {
+                                                std::this_thread::sleep_for(
+                                                    std::chrono::milliseconds(50));
+                                                pthread_kill(runner, SIGUSR1);
+                                            }
+                                        });
+                                        CredRequestMgr mgr;
+                                        mgr.AddCredRequest(NewRequest(slow));
+                                        const bool ok = mgr.Run();
+                                        done = true;
+                                        signaller.join();
+                                        fprintf(stderr, "run %d error %d response %s\n", ok,
+                                                mgr.GetError(), mgr.GetResponse(0).c_str());
+                                        return ok && mgr.GetResponse(0) == "slow 1" ? 0 : 1;
+                                    }),
+              "exit 0");
 }
 
 }  // namespace

@@ -1,11 +1,17 @@
 // Process outcomes against loopback servers: statuses, redirects, libcurl failures, attempts
 // and pauses, stalls, cut-off bodies, response streams, header modes and HTTPS.
+#include <signal.h>
+#include <stdint.h>
 #include <stdio.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <memory>
+#include <mutex>
 #include <string>
+#include <thread>
+#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -13,6 +19,7 @@
 #include "kovacredential/cred_request_util.h"
 #include "simlib/loopback_server.h"
 #include "simlib/relay_sim.h"
+#include "support/child.h"
 #include "support/interpose.h"
 #include "support/temp_dir.h"
 
@@ -177,8 +184,8 @@ TEST_F(ProcessTest, MissingOrEmptyUrl) {
 
 // A refused connection is retried at once and logged; a host or proxy name that does not
 // resolve (".invalid" never does, RFC 6761, and the resolver answers that at once) pauses one
-// second between attempts, is not logged, and empties the response stream. Fewer than one retry
-// means a single attempt.
+// second between attempts and is not logged. Either way the response stream keeps what it held
+// before Process. Fewer than one retry means a single attempt.
 TEST_F(ProcessTest, ConnectFailuresRetryWithTheirOwnPauses) {
     kovasim::RefusedPort refused;
     const std::string refusedUrl = "http://127.0.0.1:" + std::to_string(refused.Port()) + "/";
@@ -199,7 +206,7 @@ TEST_F(ProcessTest, ConnectFailuresRetryWithTheirOwnPauses) {
                            "http://kova-proxy.invalid:3128"},
                           {unresolvable, -5, KOVA::CRED_REQ_ERR_RESOLVE, 0, 0, nullptr},
                           {unresolvable, 0, KOVA::CRED_REQ_ERR_RESOLVE, 0, 0, nullptr},
-                          {unresolvable, 2, KOVA::CRED_REQ_ERR_RESOLVE, 2, 0, ""}};
+                          {unresolvable, 2, KOVA::CRED_REQ_ERR_RESOLVE, 2, 0, "kept"}};
     for (const Case &c : cases) {
         SCOPED_TRACE(c.url + " retries " + std::to_string(c.retries) + " proxy " +
                      (c.proxy ? c.proxy : "none"));
@@ -232,35 +239,209 @@ TEST_F(ProcessTest, ConnectFailuresRetryWithTheirOwnPauses) {
     }
 }
 
-TEST_F(ProcessTest, BodyCutOffIsRetriedAndKeepsEveryPartialBody) {
-    // Every attempt reaches the server and fails mid-body, so attempts can be counted there.
-    auto raw = StartRaw("HTTP/1.1 200 OK\r\nContent-Length: 100\r\n\r\npart-");
+// A body cut off mid-way is retried at once and logged once. Every attempt starts clean: the
+// response string, and a response stream from where it stood when Process began, hold only the
+// last attempt's body.
+TEST_F(ProcessTest, CutOffBodyIsRetriedAndEachAttemptStartsClean) {
+    std::atomic<int> cuts{0};
+    kovasim::RawServer raw([&](kovasim::RawServer::Connection &c) {
+        c.Send(cuts-- > 0 ? "HTTP/1.1 200 OK\r\nContent-Length: 100\r\n\r\npart-"
+                          : "HTTP/1.1 200 OK\r\nContent-Length: 8\r\n\r\ncomplete");
+    });
+    ASSERT_TRUE(raw.Start());
     struct Case {
         int retries;
+        int cuts;
+        bool toStream;
         int attempts;
+        const char *response;  // in the string, or behind "kept" in the stream
     };
+    const Case cases[] = {{-5, 9, false, 1, "part-"},   {0, 9, false, 1, "part-"},
+                          {2, 9, false, 3, "part-"},    {2, 9, true, 3, "part-"},
+                          {2, 2, false, 3, "complete"}, {2, 2, true, 3, "complete"}};
     int before = 0;
-    for (Case c : {Case{-5, 1}, Case{0, 1}, Case{2, 3}}) {
-        SCOPED_TRACE(c.retries);
+    for (const Case &c : cases) {
+        SCOPED_TRACE(std::to_string(c.retries) + " retries, " + std::to_string(c.cuts) +
+                     " cuts, stream " + std::to_string(c.toStream));
         kova_test::FakeSleepScope fake;
         kova_test::ClearLog();
+        cuts = c.cuts;
+        File out = StreamWith("kept");
+        ASSERT_TRUE(out);
         KOVA::CredRequest req;
-        ASSERT_TRUE(req.SetURL(raw->BaseUrl() + "/cut"));
-        EXPECT_FALSE(req.Process(true, c.retries));
-        EXPECT_EQ(raw->ConnectionCount() - before, c.attempts);
-        before = raw->ConnectionCount();
-        EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_CURL_OTHER);
-        EXPECT_EQ(kova_test::LogCount("CURL Error(18)"), 1u) << kova_test::LogDump();
+        ASSERT_TRUE(req.SetURL(raw.BaseUrl() + "/cut"));
+        if (c.toStream) {
+            ASSERT_TRUE(req.SetRespStream(out.get()));
+        }
+        const bool whole = c.cuts < c.attempts;
+        EXPECT_EQ(req.Process(true, c.retries), whole);
+        EXPECT_EQ(raw.ConnectionCount() - before, c.attempts);
+        before = raw.ConnectionCount();
+        EXPECT_EQ(kova_test::LogCount("CURL Error(18)"), whole ? 0u : 1u) << kova_test::LogDump();
         EXPECT_TRUE(kova_test::SleepCalls().empty());
-        // Partial bodies of failed attempts stay in front of the next attempt's.
-        std::string expected;
-        for (int i = 0; i < c.attempts; ++i)
-            expected += "part-";
-        EXPECT_EQ(req.GetResponse(), expected);
+        if (!whole) {
+            EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_CURL_OTHER);
+        }
+        EXPECT_EQ(req.GetResponse(), c.toStream ? "" : c.response);
+        EXPECT_EQ(ReadAll(out.get()), c.toStream ? std::string("kept") + c.response : "kept");
     }
 }
 
-TEST_F(ProcessTest, StallTimesOutAndTruncatesResponseStreamBeforeNextAttempt) {
+// De-chunks a chunked request body; "" when it is malformed or incomplete.
+std::string Dechunk(const std::string &chunked) {
+    std::string body;
+    size_t pos = 0;
+    for (;;) {
+        const size_t eol = chunked.find("\r\n", pos);
+        if (eol == std::string::npos) {
+            return "";
+        }
+        const size_t size = std::stoul(chunked.substr(pos, eol - pos), nullptr, 16);
+        if (size == 0) {
+            return body;
+        }
+        if (eol + 2 + size + 2 > chunked.size()) {
+            return "";
+        }
+        body.append(chunked, eol + 2, size);
+        pos = eol + 2 + size + 2;
+    }
+}
+
+// A raw server that takes request bodies. For its connections, in order, it follows a plan:
+// "reset" cuts the connection off after 4 KB of the body, a status such as "302" takes the
+// whole body and redirects to /echo, "take" takes the whole body and answers 200. It keeps the
+// request line and the body of the last connection it took.
+class BodyServer {
+  public:
+    explicit BodyServer(std::vector<std::string> plan)
+        : plan_(std::move(plan)), raw_([this](kovasim::RawServer::Connection &c) { Serve(c); }) {}
+    bool Start() { return raw_.Start(); }
+    std::string Url() const { return raw_.BaseUrl() + "/upload"; }
+    int Connections() const { return raw_.ConnectionCount(); }
+    std::string Taken() {
+        std::lock_guard<std::mutex> lock(mutex_);
+        return taken_;
+    }
+    std::string RequestLine() {
+        std::lock_guard<std::mutex> lock(mutex_);
+        return requestLine_;
+    }
+
+  private:
+    void Serve(kovasim::RawServer::Connection &c) {
+        if (c.Head().find("Expect: 100-continue") != std::string::npos) {
+            c.Send("HTTP/1.1 100 Continue\r\n\r\n");
+        }
+        const std::string step = c.Index() < static_cast<int>(plan_.size()) ? plan_[c.Index()] : "";
+        if (step == "reset") {
+            c.ReadBody(4096, 5000);
+            return;  // closing with unread data resets the connection
+        }
+        const std::string body = Dechunk(c.ReadBody(SIZE_MAX, 10000, "\r\n0\r\n\r\n"));
+        if (step != "take") {
+            c.Send("HTTP/1.1 " + step + " Moved\r\nLocation: /echo\r\nContent-Length: 0\r\n" +
+                   "Connection: close\r\n\r\n");
+            return;
+        }
+        std::lock_guard<std::mutex> lock(mutex_);
+        taken_ = body;
+        requestLine_ = c.Head().substr(0, c.Head().find("\r\n"));
+        c.Send("HTTP/1.1 200 OK\r\nContent-Length: 2\r\n\r\nok");
+    }
+
+    const std::vector<std::string> plan_;
+    std::mutex mutex_;
+    std::string taken_;
+    std::string requestLine_;
+    kovasim::RawServer raw_;
+};
+
+std::string Pattern(size_t size) {
+    std::string text(size, '\0');
+    for (size_t i = 0; i < size; ++i) {
+        text[i] = static_cast<char>('a' + (i * 7 + i / 251) % 26);
+    }
+    return text;
+}
+
+// A request stream is sent from its start in every attempt (with the shared size limit as it
+// was), and again for a redirect that keeps the POST. A pipe cannot be sent twice: once part of
+// it has gone, the failure of that attempt is the result.
+TEST_F(ProcessTest, RequestStreamIsSentWholeAfterResetsAndRedirects) {
+    const std::string body = Pattern(1u << 20);
+    struct Case {
+        std::vector<std::string> plan;
+        unsigned limit;
+        int connections;
+        const char *requestLine;
+    };
+    const Case cases[] = {{{"reset", "take"}, 0, 2, "POST /upload HTTP/1.1"},
+                          {{"reset", "take"}, 600000, 2, "POST /upload HTTP/1.1"},
+                          {{"302", "take"}, 0, 2, "POST /echo HTTP/1.1"},
+                          {{"307", "take"}, 0, 2, "POST /echo HTTP/1.1"}};
+    for (const Case &c : cases) {
+        SCOPED_TRACE(c.plan[0] + " limit " + std::to_string(c.limit));
+        BodyServer server(c.plan);
+        ASSERT_TRUE(server.Start());
+        // The body starts behind a prefix the caller has already read.
+        File in = StreamWith("prefix" + body);
+        ASSERT_TRUE(in);
+        fseek(in.get(), 6, SEEK_SET);
+        KOVA::CredRequest req;
+        ASSERT_TRUE(req.SetURL(server.Url()));
+        ASSERT_TRUE(req.SetReqStream(in.get()));
+        if (c.limit > 0) {
+            req.SetReqStreamSize(c.limit);
+        }
+        EXPECT_TRUE(req.Process(true, 2)) << req.GetError() << kova_test::LogDump();
+        EXPECT_EQ(server.Connections(), c.connections);
+        EXPECT_EQ(server.RequestLine(), c.requestLine);
+        EXPECT_TRUE(server.Taken() == body.substr(0, c.limit > 0 ? c.limit : body.size()))
+            << server.Taken().size() << " bytes";
+    }
+
+    BodyServer server({"reset", "take"});
+    ASSERT_TRUE(server.Start());
+    EXPECT_EQ(kova_test::RunInChild(30,
+                                    [&] {
+                                        signal(SIGPIPE, SIG_IGN);
+                                        int fds[2];
+                                        if (pipe(fds) != 0) {
+                                            return 2;
+                                        }
+                                        std::thread writer([&] {
+                                            size_t sent = 0;
+                                            while (sent < body.size()) {
+                                                ssize_t n = write(fds[1], body.data() + sent,
+                                                                  body.size() - sent);
+                                                if (n <= 0) {
+                                                    break;
+                                                }
+                                                sent += static_cast<size_t>(n);
+                                            }
+                                            close(fds[1]);
+                                        });
+                                        FILE *in = fdopen(fds[0], "r");
+                                        KOVA::CredRequest req;
+                                        req.SetURL(server.Url());
+                                        req.SetReqStream(in);
+                                        const bool ok = req.Process(true, 2);
+                                        const KOVA::CRED_REQ_ERR error = req.GetError();
+                                        fclose(in);
+                                        writer.join();
+                                        fprintf(stderr, "ok %d error %d\n", ok, error);
+                                        return !ok && (error == KOVA::CRED_REQ_ERR_SEND ||
+                                                       error == KOVA::CRED_REQ_ERR_CONNECT)
+                                                   ? 0
+                                                   : 1;
+                                    }),
+              "exit 0");
+    // The child's request reached the parent's server once: nothing was sent again.
+    EXPECT_EQ(server.Connections(), 1);
+}
+
+TEST_F(ProcessTest, StallTimesOutAndCutsTheResponseStreamBackBeforeTheNextAttempt) {
     // The first two connections send one byte of the body and stall (libcurl averages the speed
     // over several seconds, so one byte is all it gets); the third sends the whole body.
     kovasim::RawServer raw([](kovasim::RawServer::Connection &c) {
@@ -292,7 +473,8 @@ TEST_F(ProcessTest, StallTimesOutAndTruncatesResponseStreamBeforeNextAttempt) {
     ASSERT_TRUE(req.SetRespStream(out.get()));
     EXPECT_TRUE(req.Process(true, 1)) << req.GetError();
     EXPECT_EQ(kova_test::SleepCalls(), std::vector<unsigned>{1u});
-    EXPECT_EQ(ReadAll(out.get()), "complete");
+    // The failed attempt's byte is cut off; what the stream held before Process stays.
+    EXPECT_EQ(ReadAll(out.get()), "stale content from beforecomplete");
     EXPECT_EQ(req.GetResponse(), "");
     raw.Stop();
 }
@@ -432,6 +614,22 @@ TEST_F(HttpsTest, SelfSignedCertificate) {
         EXPECT_TRUE(kova_test::LogHas("CURL Error(60)")) << kova_test::LogDump();
         EXPECT_EQ(server_->RequestCount(), 1u);
     }
+}
+
+// Clearing the context callback after a transfer is safe: the next connection has none.
+TEST_F(HttpsTest, ClearedContextCallbackIsNotCalled) {
+    EXPECT_EQ(kova_test::RunInChild(30,
+                                    [&] {
+                                        int calls = 0;
+                                        KOVA::CredRequest req;
+                                        req.SetURL(Url());
+                                        req.SetSSLVerify(CountingSslContext, &calls);
+                                        const bool first = req.Process(true, 0);
+                                        req.SetSSLVerify(nullptr, nullptr);
+                                        const bool second = req.Process(true, 0);
+                                        return !first && !second && calls == 1 ? 0 : 1;
+                                    }),
+              "exit 0");
 }
 
 }  // namespace

@@ -1,13 +1,44 @@
 // The request settings document: setters and getters, rejected arguments, and the parameter
 // and cookie encoders that read the document back.
+#include <stdlib.h>
+
+#include <atomic>
+#include <new>
 #include <string>
 
 #include <gtest/gtest.h>
 
 #include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_farlink.h"
 #include "platform/json_text.h"
 #include "request/cred_request_p.h"
 #include "support/interpose.h"
+
+namespace {
+// The next this many allocations through operator new fail, as they would without memory.
+std::atomic<int> gFailingAllocations{0};
+}  // namespace
+
+void *operator new(size_t size) {
+    if (gFailingAllocations > 0 && gFailingAllocations-- > 0) {
+        throw std::bad_alloc();
+    }
+    void *p = malloc(size == 0 ? 1 : size);
+    if (p == nullptr) {
+        throw std::bad_alloc();
+    }
+    return p;
+}
+// The replaced operator new takes its memory from malloc, so delete gives it back with free.
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wmismatched-new-delete"
+void operator delete(void *p) noexcept {
+    free(p);
+}
+void operator delete(void *p, size_t) noexcept {
+    free(p);
+}
+#pragma GCC diagnostic pop
 
 namespace {
 
@@ -158,6 +189,37 @@ TEST_F(SettingsTest, NonStringUrlFailsSetUp) {
     ASSERT_TRUE(p_.SetRawData("URL", 5));
     EXPECT_FALSE(p_.InitCurlHandler());
     EXPECT_EQ(p_.error, KOVA::CRED_REQ_ERR_NO_URL);
+}
+
+// The first allocation of a constructor fails: the object is still usable, reports the generic
+// failure, fails every operation, and the exception is logged instead of leaving the library.
+TEST_F(SettingsTest, ConstructionWithoutMemoryFailsEveryOperation) {
+    gFailingAllocations = 1;
+    CredRequest req;
+    gFailingAllocations = 1;
+    KOVA::CredRequestFarlink client;
+    gFailingAllocations = 0;
+    EXPECT_EQ(kova_test::LogCount("cred_request:25 Exception: std::bad_alloc"), 1u)
+        << kova_test::LogDump();
+    EXPECT_EQ(kova_test::LogCount("cred_request_farlink:220 Exception: std::bad_alloc"), 1u);
+
+    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_UNKNOWN);
+    EXPECT_FALSE(req.SetURL("http://127.0.0.1:1/"));
+    EXPECT_FALSE(req.AddPostParam("a", "b"));
+    EXPECT_FALSE(req.Process(true, 0));
+    EXPECT_FALSE(req.Login("admin", "secret", "http://127.0.0.1:1/"));
+    EXPECT_EQ(req.GetURL(), "");
+    EXPECT_EQ(req.GetResponse(), "");
+    EXPECT_EQ(req.GetCurlHandler(), nullptr);
+    EXPECT_TRUE(req.GetResponseHeader().empty());
+    req.SetError(KOVA::CRED_REQ_ERR_NONE);
+    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_UNKNOWN);
+
+    client.SetServerId("S1");
+    Json::Value info;
+    EXPECT_FALSE(client.GetServerInfo(info));
+    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_UNKNOWN);
+    EXPECT_TRUE(client.GetErrors().isNull());
 }
 
 }  // namespace

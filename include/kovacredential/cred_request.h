@@ -4,6 +4,10 @@
 //
 // Operations return true (or a non-null pointer, or a non-empty text) on success and leave a
 // KOVA::_tag_CRED_REQ_ERR code readable with GetError on failure. No exception leaves them.
+//
+// Concurrency: separate requests may be used on separate threads at once; one request is used
+// by one thread at a time. The request-stream limit (SetReqStreamSize) is shared by the whole
+// process.
 #ifndef KOVACREDENTIAL_CRED_REQUEST_H
 #define KOVACREDENTIAL_CRED_REQUEST_H
 

@@ -1,5 +1,9 @@
 // KOVA::CredRequestFarlink: resolves a server known only by its server id into a reachable
 // address through the relay directory (LAN interface, external address, DDNS name or relay).
+//
+// Concurrency: separate clients are independent and may run on separate threads at once, and
+// so may GetConnInfo and GetConnInfoPortal, which make a client of their own; one client is
+// used by one thread at a time.
 #ifndef KOVACREDENTIAL_CRED_REQUEST_FARLINK_H
 #define KOVACREDENTIAL_CRED_REQUEST_FARLINK_H
 

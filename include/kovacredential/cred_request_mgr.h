@@ -1,6 +1,9 @@
 // KOVA::CredRequestMgr: runs many requests at once on the caller's thread over one libcurl
 // multi handle. The manager owns the requests it holds until Clear, its destructor or
 // RemoveRequest.
+//
+// Concurrency: separate managers may run on separate threads at once; one manager, with the
+// requests it holds, is used by one thread at a time.
 #ifndef KOVACREDENTIAL_CRED_REQUEST_MGR_H
 #define KOVACREDENTIAL_CRED_REQUEST_MGR_H
 

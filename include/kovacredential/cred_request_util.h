@@ -2,8 +2,10 @@
 // building, the per-credential cache of API descriptions, the server's encryption parameters,
 // RSA and AES helpers, and the login, token and logout flows.
 //
-// The description cache (m_jsData) and the last error (m_errCode) are process-wide and not
-// synchronised: callers that use this class from several threads serialise it themselves.
+// Concurrency: every operation may run on several threads at once. The description cache
+// (m_jsData) is process-wide; the library's own reads and writes of it take a lock, while a
+// caller that touches m_jsData directly must serialise that access itself. The last error
+// (m_errCode) is kept per thread, like errno.
 #ifndef KOVACREDENTIAL_CRED_REQUEST_UTIL_H
 #define KOVACREDENTIAL_CRED_REQUEST_UTIL_H
 
@@ -21,9 +23,9 @@ class KOVA_EXPORT CredRequestUtil {
   public:
     // {"webapiDesc": {"<credential id>": <the server's "data" answer to KOVA.API.Info>}}
     static Json::Value m_jsData;
-    // Last error of these operations (CRED_REQ_ERR_QUERY_FAIL, CRED_REQ_ERR_NO_SUCH_API);
-    // never reset by them.
-    static int m_errCode;
+    // Last error of these operations on the calling thread (CRED_REQ_ERR_QUERY_FAIL,
+    // CRED_REQ_ERR_NO_SUCH_API); never reset by them.
+    static thread_local int m_errCode;
 
     // ---- URLs.
     // Splits url into scheme ("http"/"https"), host (IPv6 brackets kept) and port (defaults

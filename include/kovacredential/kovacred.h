@@ -11,6 +11,10 @@
 // not found on read-back, 512 out of memory. A statement SQLite rejects is logged with its
 // message and records no code. A failure caused by an inner step records nothing new; its log
 // line carries the inner code, file and line.
+//
+// Concurrency: every function may run on several threads and in several processes at once
+// (the error slot is per thread; the database is shared through SQLite's lock). A record or
+// list is used by one thread at a time.
 #ifndef KOVACREDENTIAL_KOVACRED_H
 #define KOVACREDENTIAL_KOVACRED_H
 

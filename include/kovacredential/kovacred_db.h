@@ -4,6 +4,9 @@
 //
 // Every statement is retried while SQLite reports "database is locked": it is executed at
 // most 101 times, with a random pause below one second before each retry.
+//
+// Concurrency: separate connections may be used on separate threads at once; one connection
+// is used by one thread at a time.
 #ifndef KOVACREDENTIAL_KOVACRED_DB_H
 #define KOVACREDENTIAL_KOVACRED_DB_H
 

@@ -2,6 +2,9 @@
 // logging "Invaild Argument" and recording error 3328 with this header's name and the getter's
 // number. String getters write at most cbBuf - 1 bytes and always a terminating NUL; a longer
 // value is cut without notice.
+//
+// Concurrency: separate records may be used on separate threads at once; one record is used
+// by one thread at a time.
 #ifndef KOVACREDENTIAL_KOVACREDGETTER_H
 #define KOVACREDENTIAL_KOVACREDGETTER_H
 

@@ -1,6 +1,9 @@
 // Host platform services that callers of the library use directly: the per-thread error slot
 // every failing store function fills, the token service behind encrypted (AES) parameters,
 // and the address-family query.
+//
+// Concurrency: every function may run on several threads at once; the error slot is per
+// thread.
 #ifndef KOVACREDENTIAL_KOVAPLATFORM_H
 #define KOVACREDENTIAL_KOVAPLATFORM_H
 
@@ -36,8 +39,8 @@ KOVA_EXPORT int VLIBCErrorGetLine(void);
 typedef int (*KOVACloudServiceHxtokenProvider)(char *token, size_t tokenSize, char *key,
                                                size_t keySize);
 
-// Installs the process-wide token provider; null removes it. Not synchronised: install it
-// before requests run.
+// Installs the process-wide token provider; null removes it. It may be replaced at any time;
+// a request already asking for a token may still use the old one.
 KOVA_EXPORT void KOVACloudServiceHxtokenSetProvider(KOVACloudServiceHxtokenProvider provider);
 
 // Asks the installed provider for a token and an AES key. Returns -1 when no provider is

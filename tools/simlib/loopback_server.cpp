@@ -9,6 +9,7 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 
 #include <openssl/bn.h>
@@ -386,6 +387,7 @@ void RawServer::Serve() {
         }
         size_t end = conn.head_.find("\r\n\r\n");
         if (end != std::string::npos) {
+            conn.pending_ = conn.head_.substr(end + 4);
             conn.head_.resize(end + 4);
         }
         if (handler_) {
@@ -421,6 +423,31 @@ bool RawServer::Connection::WaitForClose(int ms) {
         }
     }
     return false;
+}
+
+std::string RawServer::Connection::ReadBody(size_t bytes, int ms, const std::string &until) {
+    std::string body;
+    body.swap(pending_);
+    const auto done = [&] {
+        return body.size() >= bytes ||
+               (!until.empty() && body.size() >= until.size() &&
+                body.compare(body.size() - until.size(), until.size(), until) == 0);
+    };
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
+    char buf[65536];
+    while (!done() && !*stopping_ && std::chrono::steady_clock::now() < deadline) {
+        struct pollfd pfd = {fd_, POLLIN, 0};
+        if (poll(&pfd, 1, 10) <= 0) {
+            continue;
+        }
+        const size_t want = std::min(sizeof(buf), bytes - body.size());
+        ssize_t n = recv(fd_, buf, want, 0);
+        if (n <= 0) {
+            break;
+        }
+        body.append(buf, static_cast<size_t>(n));
+    }
+    return body;
 }
 
 void RawServer::Connection::Pause(int ms) {

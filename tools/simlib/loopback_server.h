@@ -123,6 +123,10 @@ class RawServer {
         bool WaitForClose(int ms);
         // The request head as received (request line and headers).
         const std::string &Head() const { return head_; }
+        // Reads the body that follows the head until `bytes` bytes have come, the received
+        // bytes end with `until` (when not empty), the peer closes or `ms` milliseconds pass;
+        // returns what came. Later calls go on where the last one stopped.
+        std::string ReadBody(size_t bytes, int ms, const std::string &until = "");
         // 0 for the first connection the server accepted, 1 for the next, ...
         int Index() const { return index_; }
 
@@ -134,6 +138,7 @@ class RawServer {
         int index_;
         const std::atomic<bool> *stopping_;
         std::string head_;
+        std::string pending_;  // body bytes that arrived with the head
     };
     using Handler = std::function<void(Connection &)>;
 

@@ -1,0 +1,42 @@
+#include "support/child.h"
+
+#include <signal.h>
+#include <stdio.h>
+#include <string.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace kova_test {
+
+std::string RunInChild(unsigned seconds, const std::function<int()> &body) {
+    fflush(nullptr);
+    const pid_t pid = fork();
+    if (pid < 0) {
+        return std::string("fork failed: ") + strerror(errno);
+    }
+    if (pid == 0) {
+        signal(SIGALRM, SIG_DFL);
+        alarm(seconds);
+        int status = 1;
+        try {
+            status = body();
+        } catch (...) {
+            fprintf(stderr, "exception in child\n");
+        }
+        fflush(nullptr);
+        _exit(status);
+    }
+    int status = 0;
+    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+    }
+    if (WIFEXITED(status)) {
+        return "exit " + std::to_string(WEXITSTATUS(status));
+    }
+    if (WIFSIGNALED(status)) {
+        return "signal " + std::to_string(WTERMSIG(status)) + " (" + strsignal(WTERMSIG(status)) +
+               ")";
+    }
+    return "status " + std::to_string(status);
+}
+
+}  // namespace kova_test

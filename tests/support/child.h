@@ -1,0 +1,18 @@
+// Runs a scenario that could crash or hang in a forked child, so that a failure fails one test
+// instead of the whole program.
+#ifndef KOVA_TESTS_SUPPORT_CHILD_H
+#define KOVA_TESTS_SUPPORT_CHILD_H
+
+#include <functional>
+#include <string>
+
+namespace kova_test {
+
+// Forks; the child runs `body`, whose result becomes its exit status, and is ended by SIGALRM
+// after `seconds`. Returns how the child ended: "exit 0" for success, "exit N", or
+// "signal N (name)". The child's standard error stays the test's, for diagnostics.
+std::string RunInChild(unsigned seconds, const std::function<int()> &body);
+
+}  // namespace kova_test
+
+#endif  // KOVA_TESTS_SUPPORT_CHILD_H
