@@ -21,24 +21,32 @@ struct ResolveOptions {
     bool json = false;
 };
 
-// Which of the server information's addresses the candidate is; anything else came through
-// the tunnel.
+// Which of the server information's addresses the candidate is, by host and port: the LAN
+// interfaces answer on the service's "port", the external address and the DDNS name on its
+// "ext_port". Anything else came through the tunnel.
 std::string CandidateKind(const Json::Value &info, const Json::Value &candidate) {
     const Json::Value &server = info["server"];
+    const Json::Value &service = info["service"];
     const std::string host = candidate["host"].asString();
-    if (server["interface"].isArray()) {
+    const int port = candidate["port"].asInt();
+    auto servicePort = [&service](const char *name) {
+        return service.isObject() && service[name].isIntegral() ? service[name].asInt() : 0;
+    };
+    if (port > 0 && port == servicePort("port") && server["interface"].isArray()) {
         for (const auto &nic : server["interface"]) {
             if (nic.isObject() && nic["ip"].isString() && nic["ip"].asString() == host) {
                 return "LAN";
             }
         }
     }
-    if (server["external"].isObject() && server["external"]["ip"].isString() &&
-        server["external"]["ip"].asString() == host) {
-        return "external";
-    }
-    if (server["ddns"].isString() && server["ddns"].asString() == host) {
-        return "DDNS";
+    if (port > 0 && port == servicePort("ext_port")) {
+        if (server["external"].isObject() && server["external"]["ip"].isString() &&
+            server["external"]["ip"].asString() == host) {
+            return "external";
+        }
+        if (server["ddns"].isString() && server["ddns"].asString() == host) {
+            return "DDNS";
+        }
     }
     return "relay";
 }
