@@ -398,7 +398,7 @@ TEST_F(KovacredTest, BatchSummarisesEveryCallAndFailsWhenOneDoes) {
 TEST_F(KovacredTest, BatchShowsProgressOnATerminal) {
     Add("admin", "secret");
     const std::string calls = R"([{"cred": 1, "api": "KOVA.Demo.Delay", "version": 1,
-        "method": "wait", "params": {"ms": "700"}}, {"url": ")" +
+        "method": "wait", "params": {"ms": "1500"}}, {"url": ")" +
                               Url("/missing") + "\"}]";
     const std::string file = db_.dir().File("calls.json");
     std::ofstream(file) << calls;
