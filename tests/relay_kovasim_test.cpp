@@ -54,6 +54,7 @@ class KovasimRelayTest : public ::testing::Test {
         std::string command = "kovacredential_farlink_global=" + global_ +
                               " kovacredential_farlink_server=" + site_ + " " + KOVACRED_BIN +
                               " --db " + dir_.File("unused.sqlite") + " resolve " + args + " 2>&1";
+        out->clear();
         return RunCommand(command, out);
     }
 

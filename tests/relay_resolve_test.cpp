@@ -67,6 +67,7 @@ TEST_F(RelayResolveTest, PrintsTheCandidate) {
     std::string command = "kovacredential_farlink_global=" + directory_.Host(0) +
                           " kovacredential_farlink_server=" + directory_.Host(1) + " '" +
                           KOVACRED_BIN + "' resolve S1";
+    out.clear();
     ASSERT_EQ(kova_test::RunCommand(command, &out), 0) << out;
     EXPECT_EQ(out, "S1  http://" + target_->Host() + ":" + std::to_string(target_->Port()) +
                        "  (external)\n");
