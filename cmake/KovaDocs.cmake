@@ -1,7 +1,8 @@
 # Build-time generator (cmake -P) for what is made from doc/error-codes.txt and the README.
 #
-#   -DMODE=header -DTABLE=<error-codes.txt> -DOUT=<header>
-#       writes the C++ table kovacred names error codes with.
+#   -DMODE=header -DTABLE=<error-codes.txt> -DOUT=<header> -DINCLUDE_DIR=<include/kovacredential>
+#       writes the C++ table kovacred names error codes with, after checking that the table
+#       lists exactly the codes the public headers define (cred_request.h, kovaplatform.h).
 #   -DMODE=man -DSOURCE=<page.scd> -DTABLE=<error-codes.txt> -DREADME=<README.md>
 #       -DVERSION=<x.y.z> -DSCDOC=<scdoc> -DGZIP=<gzip> -DOUT=<page.N.gz>
 #       fills the page's @ERROR_CODES@, @SAFETY_GUARANTEES@ and @VERSION@, turns it into roff
@@ -56,11 +57,39 @@ function(kova_safety_guarantees readme out)
   set(${out} "${text}" PARENT_SCOPE)
 endfunction()
 
+# Fails unless the table holds every code the public headers define, with the same name and
+# value, and no other.
+function(kova_check_error_table include_dir)
+  file(READ "${include_dir}/cred_request.h" request)
+  file(READ "${include_dir}/kovaplatform.h" platform)
+  string(REGEX MATCHALL "CRED_REQ_ERR_[A-Z_]+ = [0-9]+" defined "${request}")
+  string(REGEX MATCHALL "KOVA_ERR_[A-Z_]+ 0x[0-9A-F]+ +// [0-9]+" store "${platform}")
+  list(APPEND defined ${store})
+  set(expected)
+  foreach(entry IN LISTS defined)
+    string(REGEX REPLACE "^([A-Z_]+) .* ([0-9]+)$" "\\2 \\1" entry "${entry}")
+    if(NOT entry STREQUAL "0 CRED_REQ_ERR_NONE")
+      list(APPEND expected "${entry}")
+    endif()
+  endforeach()
+  set(listed)
+  foreach(code name IN ZIP_LISTS CODES NAMES)
+    list(APPEND listed "${code} ${name}")
+  endforeach()
+  list(SORT expected)
+  list(SORT listed)
+  if(NOT expected STREQUAL listed)
+    message(FATAL_ERROR "${TABLE} does not match the headers' codes:\n  headers: ${expected}\n"
+                        "  table: ${listed}")
+  endif()
+endfunction()
+
 kova_read_error_table("${TABLE}")
 list(LENGTH CODES count)
 math(EXPR last "${count} - 1")
 
 if(MODE STREQUAL "header")
+  kova_check_error_table("${INCLUDE_DIR}")
   set(body "")
   foreach(i RANGE ${last})
     list(GET CODES ${i} code)
