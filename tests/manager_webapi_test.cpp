@@ -1,7 +1,6 @@
 // The request manager with WebAPI requests against the in-process WebAPI simulator: requests
 // by credential id, by records and by bare server address, discovery under pseudo-ids, and
 // the factories' failures.
-#include <fstream>
 #include <memory>
 #include <string>
 
@@ -167,43 +166,6 @@ TEST_F(ManagerWebApiTest, FailuresAreLoggedAndAddNothing) {
     EXPECT_TRUE(kova_test::LogHas("cred_request_mgr:77 CreateRelayRequest fail"));
     EXPECT_EQ(0, mgr.Size());
     EXPECT_EQ(0u, Sim().Hits("KOVA.Demo.Echo") - echoes_);
-}
-
-TEST_F(ManagerWebApiTest, BatchCommandRunsCredentialAndUrlCalls) {
-    long credId = StoreCred();
-    Json::Value calls(Json::arrayValue);
-    Json::Value byCred;
-    byCred["cred"] = static_cast<Json::Int64>(credId);
-    byCred["api"] = "KOVA.Demo.Echo";
-    byCred["version"] = 1;
-    byCred["method"] = "echo";
-    byCred["params"]["word"] = "batch";
-    calls.append(byCred);
-    Json::Value byUrl;
-    byUrl["url"] = plain_->BaseUrl() + "/plain";
-    calls.append(byUrl);
-    Json::Value unknown = byCred;
-    unknown["cred"] = 4242;
-    calls.append(unknown);
-    std::string file = db_->dir().File("calls.json");
-    std::ofstream(file) << kova::JsonToString(calls);
-
-    std::string out;
-    std::string errFile = db_->dir().File("stderr.txt");
-    int status = kova_test::RunCommand(
-        std::string(KOVACRED_BIN) + " --db " + db_->path() + " batch " + file + " 2>" + errFile,
-        &out);
-    std::ifstream errIn(errFile);
-    std::string err((std::istreambuf_iterator<char>(errIn)), std::istreambuf_iterator<char>());
-    EXPECT_NE(0, status);
-    Json::Value answers = ParseBody(out.substr(0, out.find_last_not_of('\n') + 1));
-    ASSERT_EQ(3u, answers.size()) << out;
-    EXPECT_TRUE(answers[0]["success"].asBool()) << out;
-    EXPECT_EQ("batch", answers[0]["data"]["params"]["word"].asString());
-    EXPECT_EQ("plain answer", answers[1].asString());
-    EXPECT_TRUE(answers[2].isNull());
-    EXPECT_NE(std::string::npos, err.find("call 2 failed")) << err;
-    EXPECT_EQ(std::string::npos, err.find("call 0 failed")) << err;
 }
 
 }  // namespace

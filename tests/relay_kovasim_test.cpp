@@ -48,11 +48,13 @@ class KovasimRelayTest : public ::testing::Test {
         ASSERT_EQ(sim_->RelayHosts().size(), 2u) << sim_->ErrorOutput();
     }
 
-    // Runs kovacred resolve with the directory hosts pointed at the simulator.
+    // Runs kovacred resolve with the directory hosts pointed at the simulator; standard error
+    // is collected with standard output.
     int Resolve(const std::string &args, std::string *out) {
         std::string command = "kovacredential_farlink_global=" + global_ +
                               " kovacredential_farlink_server=" + site_ + " " + KOVACRED_BIN +
                               " --db " + dir_.File("unused.sqlite") + " resolve " + args + " 2>&1";
+        out->clear();
         return RunCommand(command, out);
     }
 
@@ -70,6 +72,8 @@ TEST_F(KovasimRelayTest, ListsItsDirectoryHostsOnPort80) {
 TEST_F(KovasimRelayTest, ResolvesToTheHttpsListenerFirst) {
     std::string out;
     ASSERT_EQ(Resolve("SIM-42", &out), 0) << out;
+    EXPECT_EQ(out, "SIM-42  https://127.0.0.1:" + std::to_string(sim_->HttpsPort()) + "  (LAN)\n");
+    ASSERT_EQ(Resolve("--json SIM-42", &out), 0) << out;
     Json::Value candidate;
     ASSERT_TRUE(kova::JsonFromString(out, candidate)) << out;
     EXPECT_EQ(candidate["protocol"].asString(), "https");
@@ -81,8 +85,11 @@ TEST_F(KovasimRelayTest, ResolvesToTheHttpsListenerFirst) {
 TEST_F(KovasimRelayTest, UnknownServerGivesTheErrorDocument) {
     std::string out;
     EXPECT_EQ(Resolve("NOBODY", &out), 23) << out;
+    EXPECT_EQ(out,
+              "kovacred: resolve NOBODY failed (error 23 CRED_REQ_ERR_SERVER_ERRNO: the relay "
+              "directory answered with an error)\n");
+    EXPECT_EQ(Resolve("--json NOBODY", &out), 23) << out;
     EXPECT_NE(out.find("\"code\":23"), std::string::npos) << out;
-    EXPECT_NE(out.find("resolve failed (error 23)"), std::string::npos) << out;
 }
 
 TEST(KovasimRelayConfig, RejectsARelayRoleWithoutHosts) {

@@ -40,12 +40,12 @@ class RelayResolveTest : public kova_test::RelayDirectoryTest {
         ASSERT_TRUE(directory_.Sim().Configure(config));
     }
 
-    // Runs kovacred resolve with the directory hosts in its environment; returns its exit
-    // status and its standard output.
+    // Runs kovacred resolve --json with the directory hosts in its environment; returns its
+    // exit status and its standard output.
     int Resolve(const std::string &arguments, std::string *out) {
         std::string command = "kovacredential_farlink_global=" + directory_.Host(0) +
                               " kovacredential_farlink_server=" + directory_.Host(1) + " '" +
-                              KOVACRED_BIN + "' resolve " + arguments + " 2>/dev/null";
+                              KOVACRED_BIN + "' resolve --json " + arguments + " 2>/dev/null";
         out->clear();
         return kova_test::RunCommand(command, out);
     }
@@ -61,6 +61,16 @@ TEST_F(RelayResolveTest, PrintsTheCandidate) {
     expected["host"] = target_->Host();
     expected["port"] = target_->Port();
     EXPECT_EQ(ParseJson(out), expected);
+
+    // Without --json, one line saying how the server is reached: the LAN interfaces have no
+    // port for this service, so it is the external address.
+    std::string command = "kovacredential_farlink_global=" + directory_.Host(0) +
+                          " kovacredential_farlink_server=" + directory_.Host(1) + " '" +
+                          KOVACRED_BIN + "' resolve S1";
+    out.clear();
+    ASSERT_EQ(kova_test::RunCommand(command, &out), 0) << out;
+    EXPECT_EQ(out, "S1  http://" + target_->Host() + ":" + std::to_string(target_->Port()) +
+                       "  (external)\n");
 }
 
 TEST_F(RelayResolveTest, PortalFlagLooksUpThePortalService) {

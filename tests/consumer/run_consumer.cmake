@@ -1,23 +1,36 @@
-# Installs the built library into a scratch prefix, builds the consumer against the CMake
-# package and the pkg-config file, and runs both.
-set(prefix ${BINARY_DIR}/consumer-prefix)
-set(build ${BINARY_DIR}/consumer-build)
-file(REMOVE_RECURSE ${prefix} ${build})
-execute_process(COMMAND ${CMAKE_COMMAND} --install ${BINARY_DIR} --prefix ${prefix}
-                RESULT_VARIABLE rc OUTPUT_QUIET)
-if(rc)
-  message(FATAL_ERROR "install failed: ${rc}")
+# Builds the consumer against an installed library, through the CMake package and through the
+# pkg-config file, and runs both. Without PREFIX the build tree is first installed into a
+# scratch prefix; with PREFIX (and LIBDIR, relative to it) the files already there are used,
+# such as an unpacked -dev package. WORK names the scratch folder (default: in BINARY_DIR).
+if(NOT WORK)
+  set(WORK ${BINARY_DIR})
 endif()
-foreach(f include/kovacredential/kovacredential.h lib/libkovacredential.so.6
-          lib/pkgconfig/kovacredential.pc lib/cmake/KovaCredential/KovaCredentialConfig.cmake
-          bin/kovacred)
+set(build ${WORK}/consumer-build)
+if(PREFIX)
+  set(prefix ${PREFIX})
+  set(libdir ${LIBDIR})
+else()
+  set(prefix ${WORK}/consumer-prefix)
+  set(libdir lib)
+  set(tools bin/kovacred bin/kovasim)
+  file(REMOVE_RECURSE ${prefix})
+  execute_process(COMMAND ${CMAKE_COMMAND} --install ${BINARY_DIR} --prefix ${prefix}
+                  RESULT_VARIABLE rc OUTPUT_QUIET)
+  if(rc)
+    message(FATAL_ERROR "install failed: ${rc}")
+  endif()
+endif()
+file(REMOVE_RECURSE ${build})
+foreach(f include/kovacredential/kovacredential.h ${libdir}/libkovacredential.so.6
+          ${libdir}/libkovacredential.so ${libdir}/pkgconfig/kovacredential.pc
+          ${libdir}/cmake/KovaCredential/KovaCredentialConfig.cmake ${tools})
   if(NOT EXISTS ${prefix}/${f})
     message(FATAL_ERROR "not installed: ${f}")
   endif()
 endforeach()
-set(ENV{PKG_CONFIG_PATH} ${prefix}/lib/pkgconfig)
+set(ENV{PKG_CONFIG_PATH} ${prefix}/${libdir}/pkgconfig)
 execute_process(COMMAND ${CMAKE_COMMAND} -S ${SOURCE_DIR}/tests/consumer -B ${build}
-                -DCMAKE_PREFIX_PATH=${prefix} -DCMAKE_INSTALL_LIBDIR=lib RESULT_VARIABLE rc)
+                -DCMAKE_PREFIX_PATH=${prefix} -DCMAKE_INSTALL_LIBDIR=${libdir} RESULT_VARIABLE rc)
 if(rc)
   message(FATAL_ERROR "consumer configure failed")
 endif()
@@ -27,7 +40,7 @@ if(rc)
 endif()
 foreach(exe consumer consumer_pc)
   file(REMOVE ${build}/${exe}.sqlite)
-  set(ENV{LD_LIBRARY_PATH} ${prefix}/lib)
+  set(ENV{LD_LIBRARY_PATH} ${prefix}/${libdir})
   execute_process(COMMAND ${build}/${exe} ${build}/${exe}.sqlite RESULT_VARIABLE rc)
   if(rc)
     message(FATAL_ERROR "${exe} failed: ${rc}")

@@ -1,11 +1,17 @@
-// kovacred batch FILE: runs a JSON array of calls together through the request manager and
-// prints their answers as one JSON array in input order.
+// kovacred batch FILE: runs a JSON array of calls together and ends with a summary of each
+// call's outcome. The request manager builds (logging in where needed) and owns the requests;
+// their transfers run together over one libcurl multi handle driven here, so that each
+// transfer's end is seen as it happens: for the progress line and each call's own time.
 #include <stdio.h>
+#include <unistd.h>
 
+#include <chrono>
+#include <cmath>
 #include <exception>
 #include <fstream>
+#include <iostream>
+#include <map>
 #include <memory>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -15,156 +21,328 @@
 #include "commands.h"
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_mgr.h"
+#include "kovacredential/cred_request_util.h"
 
 namespace kovacred {
 namespace {
 
-// Batches larger than this report their progress on standard error.
-constexpr size_t kQuietBatchSize = 20;
+using Clock = std::chrono::steady_clock;
 
 struct Call {
-    int index = -1;       // slot in the manager, -1 when the call could not be built
-    std::string problem;  // why it failed, empty while it has not
+    std::string target;   // what the summary names: the URL, or "cred ID API VERSION METHOD"
+    long credId = 0;      // the stored credential a WebAPI call uses; 0 for a URL
+    int index = -1;       // slot in the manager; -1 when the call could not be built
+    std::string problem;  // why a call could not be built
+    bool finished = false;
+    long code = 0;  // the library's error code; 0 for success
+    double seconds = -1;
 };
 
-bool ReadJsonFile(const std::string &path, Json::Value &value, std::string &problem) {
-    std::ifstream in(path);
-    if (!in) {
-        problem = "cannot read " + path;
-        return false;
+struct MultiCleanup {
+    void operator()(CURLM *multi) const { curl_multi_cleanup(multi); }
+};
+using Multi = std::unique_ptr<CURLM, MultiCleanup>;
+
+bool ReadCalls(const std::string &path, Json::Value &calls, std::string &problem) {
+    std::ifstream file;
+    std::istream *in = &std::cin;
+    if (path != "-") {
+        file.open(path);
+        if (!file) {
+            problem = "cannot read " + path;
+            return false;
+        }
+        in = &file;
     }
     Json::CharReaderBuilder builder;
     builder["collectComments"] = false;
     std::string errors;
-    if (!Json::parseFromStream(builder, in, &value, &errors)) {
-        problem = path + " is not JSON: " + errors;
+    if (!Json::parseFromStream(builder, *in, &calls, &errors)) {
+        problem = (path == "-" ? std::string("standard input") : path) + " is not JSON: " + errors;
+        return false;
+    }
+    if (!calls.isArray()) {
+        problem = (path == "-" ? std::string("standard input") : path) +
+                  " must hold a JSON array of calls";
         return false;
     }
     return true;
 }
 
-// Adds one call to the manager; fills `problem` when it cannot be made.
-int AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &call, std::string &problem) {
-    if (!call.isObject()) {
-        problem = "not an object";
-        return -1;
+// Adds one call to the manager; on failure leaves the reason and the error code in `call`.
+void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &spec, Call &call) {
+    call.code = KOVA::CRED_REQ_ERR_BAD_PARAM;
+    if (!spec.isObject()) {
+        call.problem = "not an object";
+        return;
     }
-    if (call.isMember("url")) {
-        if (!call["url"].isString() || call["url"].asString().empty()) {
-            problem = "\"url\" is not a non-empty string";
-            return -1;
+    mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
+    if (spec.isMember("url")) {
+        if (!spec["url"].isString() || spec["url"].asString().empty()) {
+            call.problem = "\"url\" is not a non-empty string";
+            return;
         }
+        call.target = spec["url"].asString();
         std::unique_ptr<KOVA::CredRequest> request(new KOVA::CredRequest());
-        if (!request->SetURL(call["url"].asString())) {
-            problem = "bad url (error " + std::to_string(request->GetError()) + ")";
-            return -1;
+        if (!request->SetURL(call.target)) {
+            call.problem = "bad url";
+            call.code = request->GetError();
+            return;
         }
-        int index = mgr.AddCredRequest(request.get());
-        if (index >= 0) {
+        call.index = mgr.AddCredRequest(request.get());
+        if (call.index >= 0) {
             request.release();
+            call.code = 0;
         } else {
-            problem = "cannot add request (error " + std::to_string(mgr.GetError()) + ")";
+            call.problem = "cannot add the request";
+            call.code = mgr.GetError();
         }
-        return index;
+        return;
     }
-    if (!call["cred"].isIntegral() || !call["api"].isString() || !call["method"].isString() ||
-        !call["version"].isIntegral()) {
-        problem = "needs \"url\", or \"cred\", \"api\", \"version\" and \"method\"";
-        return -1;
+    if (!spec["cred"].isIntegral() || !spec["api"].isString() || !spec["method"].isString() ||
+        !spec["version"].isIntegral()) {
+        call.problem = "needs \"url\", or \"cred\", \"api\", \"version\" and \"method\"";
+        return;
     }
-    Json::Value params = call.get("params", Json::Value());
+    const Json::Value params = spec.get("params", Json::Value());
     if (!params.isNull() && !params.isObject()) {
-        problem = "\"params\" is not an object";
-        return -1;
+        call.problem = "\"params\" is not an object";
+        return;
     }
-    int index =
-        mgr.AddWebAPIRequest(static_cast<long>(call["cred"].asInt64()), call["api"].asString(),
-                             call["version"].asInt(), call["method"].asString(), params);
-    if (index < 0) {
-        problem = "cannot build the WebAPI request for credential " +
-                  std::to_string(call["cred"].asInt64());
+    call.credId = static_cast<long>(spec["cred"].asInt64());
+    call.target = "cred " + std::to_string(call.credId) + " " + spec["api"].asString() + " " +
+                  std::to_string(spec["version"].asInt()) + " " + spec["method"].asString();
+    KOVA::CredRequestUtil::m_errCode = 0;
+    call.index = mgr.AddWebAPIRequest(call.credId, spec["api"].asString(), spec["version"].asInt(),
+                                      spec["method"].asString(), params);
+    if (call.index >= 0) {
+        call.code = 0;
+        return;
     }
-    return index;
+    call.problem = "cannot build the WebAPI request";
+    call.code = KOVA::CredRequestUtil::m_errCode != 0       ? KOVA::CredRequestUtil::m_errCode
+                : mgr.GetError() != KOVA::CRED_REQ_ERR_NONE ? mgr.GetError()
+                                                            : KOVA::CRED_REQ_ERR_UNKNOWN;
 }
 
-// The body as JSON when it is JSON, otherwise as a string.
+// The error code of a finished transfer: the mapping CredRequest::Process applies to a single
+// transfer (cred_request.h), so that a call reports what it would report on its own.
+KOVA::CRED_REQ_ERR Outcome(CURLcode rc, long status) {
+    switch (rc) {
+        case CURLE_OK:
+            break;
+        case CURLE_COULDNT_RESOLVE_PROXY:
+        case CURLE_COULDNT_RESOLVE_HOST:
+            return KOVA::CRED_REQ_ERR_RESOLVE;
+        case CURLE_OPERATION_TIMEDOUT:
+            return KOVA::CRED_REQ_ERR_TIMEOUT;
+        case CURLE_COULDNT_CONNECT:
+        case CURLE_RECV_ERROR:
+            return KOVA::CRED_REQ_ERR_CONNECT;
+        case CURLE_SSL_CONNECT_ERROR:
+            return KOVA::CRED_REQ_ERR_SSL_CONNECT;
+        case CURLE_SEND_ERROR:
+        case CURLE_AGAIN:
+            return KOVA::CRED_REQ_ERR_SEND;
+        default:
+            return KOVA::CRED_REQ_ERR_CURL_OTHER;
+    }
+    if (status >= 400 && status <= 499) {
+        return KOVA::CRED_REQ_ERR_HTTP_CLIENT;
+    }
+    if (status >= 500 && status <= 599) {
+        return KOVA::CRED_REQ_ERR_HTTP_SERVER;
+    }
+    switch (status) {
+        case 200:
+            return KOVA::CRED_REQ_ERR_NONE;
+        case 304:
+            return KOVA::CRED_REQ_ERR_NOT_MODIFIED;
+        case 302:
+            return KOVA::CRED_REQ_ERR_REDIRECT;
+        default:
+            return KOVA::CRED_REQ_ERR_HTTP_UNEXPECTED;
+    }
+}
+
+// "done/total, failed, elapsed" on one line of standard error, redrawn in place; only when
+// standard error is a terminal.
+class Progress {
+  public:
+    explicit Progress(size_t total) : total_(total), on_(isatty(STDERR_FILENO) != 0) {}
+
+    void Show(size_t done, size_t failed, bool last = false) {
+        if (!on_) {
+            return;
+        }
+        const Clock::time_point now = Clock::now();
+        if (!last && done == shownDone_ && now - shownAt_ < std::chrono::milliseconds(500)) {
+            return;
+        }
+        shownDone_ = done;
+        shownAt_ = now;
+        const double elapsed = std::chrono::duration<double>(now - start_).count();
+        fprintf(stderr, "\rkovacred: batch: %zu/%zu done, %zu failed, %.1f s%s", done, total_,
+                failed, elapsed, last ? "\n" : "");
+        fflush(stderr);
+    }
+
+  private:
+    size_t total_;
+    bool on_;
+    Clock::time_point start_ = Clock::now();
+    Clock::time_point shownAt_;
+    size_t shownDone_ = static_cast<size_t>(-1);
+};
+
+// Runs every built call's transfer together until all have finished.
+void RunTransfers(KOVA::CredRequestMgr &mgr, std::vector<Call> &calls) {
+    size_t done = 0;
+    size_t failed = 0;
+    auto finish = [&](Call &call, long code) {
+        call.finished = true;
+        call.code = code;
+        ++done;
+        failed += code != 0 ? 1 : 0;
+    };
+    for (Call &call : calls) {
+        if (call.index < 0) {
+            finish(call, call.code);
+        }
+    }
+    Progress progress(calls.size());
+    Multi multi(curl_multi_init());
+    std::map<CURL *, Call *> running;
+    for (Call &call : calls) {
+        if (call.index < 0) {
+            continue;
+        }
+        KOVA::CredRequest *request = mgr.GetRequest(call.index);
+        if (!request->Process(false, 0)) {
+            finish(call, request->GetError() != KOVA::CRED_REQ_ERR_NONE
+                             ? request->GetError()
+                             : KOVA::CRED_REQ_ERR_CURL_INTERNAL);
+            continue;
+        }
+        CURL *easy = request->GetCurlHandler();
+        if (!multi || curl_multi_add_handle(multi.get(), easy) != CURLM_OK) {
+            finish(call, KOVA::CRED_REQ_ERR_CURL_INTERNAL);
+            continue;
+        }
+        running[easy] = &call;
+    }
+    // Each transfer is bounded by its request's connect and low-speed time-outs.
+    while (!running.empty()) {
+        progress.Show(done, failed);
+        int active = 0;
+        if (curl_multi_perform(multi.get(), &active) != CURLM_OK) {
+            break;
+        }
+        int queued = 0;
+        while (CURLMsg *msg = curl_multi_info_read(multi.get(), &queued)) {
+            auto it = running.find(msg->easy_handle);
+            if (msg->msg != CURLMSG_DONE || it == running.end()) {
+                continue;
+            }
+            long status = 0;
+            double seconds = 0;
+            curl_easy_getinfo(msg->easy_handle, CURLINFO_RESPONSE_CODE, &status);
+            curl_easy_getinfo(msg->easy_handle, CURLINFO_TOTAL_TIME, &seconds);
+            Call &call = *it->second;
+            call.seconds = seconds;
+            finish(call, Outcome(msg->data.result, status));
+            mgr.GetRequest(call.index)->SetError(static_cast<KOVA::CRED_REQ_ERR>(call.code));
+            curl_multi_remove_handle(multi.get(), msg->easy_handle);
+            running.erase(it);
+        }
+        if (!running.empty() &&
+            curl_multi_poll(multi.get(), nullptr, 0, 200, nullptr) != CURLM_OK) {
+            break;
+        }
+    }
+    for (auto &entry : running) {
+        curl_multi_remove_handle(multi.get(), entry.first);
+        finish(*entry.second, KOVA::CRED_REQ_ERR_CURL_INTERNAL);
+    }
+    progress.Show(done, failed, true);
+}
+
+std::string ResultText(const Call &call) {
+    return call.index < 0 ? "not run" : call.code == 0 ? "ok" : "failed";
+}
+
+void PrintSummary(const std::vector<Call> &calls) {
+    std::vector<std::vector<std::string>> rows = {{"#", "TARGET", "RESULT", "ERROR", "TIME"}};
+    for (size_t i = 0; i < calls.size(); ++i) {
+        const Call &call = calls[i];
+        std::string error = "-";
+        if (call.code != 0) {
+            error = std::to_string(call.code) + " " + ErrorName(call.code);
+        }
+        char time[32] = "-";
+        if (call.seconds >= 0) {
+            snprintf(time, sizeof(time), "%.3f s", call.seconds);
+        }
+        const std::string target =
+            call.target.empty() ? "(" + call.problem + ")" : Printable(call.target);
+        rows.push_back({std::to_string(i), target, ResultText(call), error, time});
+    }
+    PrintTable(rows);
+}
+
 Json::Value Answer(const std::string &body) {
-    Json::CharReaderBuilder builder;
-    builder["collectComments"] = false;
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
     Json::Value value;
-    std::string errors;
-    if (!body.empty() && reader->parse(body.data(), body.data() + body.size(), &value, &errors)) {
-        return value;
-    }
-    return Json::Value(body);
+    return ParseJson(body, value) ? value : Json::Value(body);
 }
 
-void RunBatch(const std::string &path) {
-    Json::Value calls;
+void RunBatch(const std::string &path, bool json) {
+    Json::Value specs;
     std::string problem;
-    if (!ReadJsonFile(path, calls, problem)) {
+    if (!ReadCalls(path, specs, problem)) {
         FailText("batch: " + problem);
         return;
     }
-    if (!calls.isArray()) {
-        FailText("batch: " + path + " must hold a JSON array of calls");
-        return;
-    }
-
     KOVA::CredRequestMgr mgr;
-    std::vector<Call> states(calls.size());
-    for (Json::ArrayIndex i = 0; i < calls.size(); ++i) {
-        states[i].index = AddCall(mgr, calls[i], states[i].problem);
+    std::vector<Call> calls(specs.size());
+    for (Json::ArrayIndex i = 0; i < specs.size(); ++i) {
+        AddCall(mgr, specs[i], calls[i]);
+        if (calls[i].index < 0) {
+            fprintf(stderr, "kovacred: batch: call %u: %s\n", i, calls[i].problem.c_str());
+        }
     }
-    bool verbose = calls.size() > kQuietBatchSize;
-    if (verbose) {
-        fprintf(stderr, "kovacred: batch: running %u calls together\n", calls.size());
-    }
-    bool ran = mgr.Run();
+    RunTransfers(mgr, calls);
 
-    Json::Value answers(Json::arrayValue);
+    // Answers may echo a session's id or token, or a password.
+    Secrets secrets;
     size_t failed = 0;
-    for (Json::ArrayIndex i = 0; i < calls.size(); ++i) {
-        Call &state = states[i];
-        if (state.index < 0) {
-            answers.append(Json::Value());
-        } else {
-            KOVA::CredRequest *request = mgr.GetRequest(state.index);
-            answers.append(Answer(request->GetResponse()));
-            long status = 0;
-            CURL *easy = request->GetCurlHandler();
-            if (easy != nullptr) {
-                curl_easy_getinfo(easy, CURLINFO_RESPONSE_CODE, &status);
-            }
-            if (easy == nullptr) {
-                state.problem = "not started (error " + std::to_string(request->GetError()) + ")";
-            } else if (status == 0) {
-                state.problem = ran ? "no answer"
-                                    : "no answer, the run failed (error " +
-                                          std::to_string(mgr.GetError()) + ")";
-            } else if (status != 200) {
-                state.problem = "HTTP status " + std::to_string(status);
-            }
+    for (const Call &call : calls) {
+        if (call.credId != 0) {
+            secrets.AddCredential(call.credId);
         }
-        if (!state.problem.empty()) {
-            ++failed;
+        failed += call.code != 0 ? 1 : 0;
+    }
+    if (json) {
+        Json::Value out(Json::arrayValue);
+        for (size_t i = 0; i < calls.size(); ++i) {
+            const Call &call = calls[i];
+            Json::Value entry(Json::objectValue);
+            entry["index"] = static_cast<Json::UInt>(i);
+            entry["target"] = call.target;
+            entry["result"] = ResultText(call);
+            entry["code"] = static_cast<Json::Int64>(call.code);
+            entry["name"] = ErrorName(call.code);
+            entry["ms"] =
+                call.seconds >= 0
+                    ? Json::Value(static_cast<Json::Int64>(std::llround(call.seconds * 1000)))
+                    : Json::Value();
+            entry["answer"] = call.index >= 0 ? Answer(mgr.GetResponse(call.index)) : Json::Value();
+            out.append(entry);
         }
+        printf("%s\n", JsonText(secrets.Hide(out), false).c_str());
+    } else {
+        PrintSummary(calls);
     }
-    if (verbose) {
-        fprintf(stderr, "kovacred: batch: %u calls done, %zu failed\n", calls.size(), failed);
-    }
-
-    Json::StreamWriterBuilder writer;
-    writer["indentation"] = "";
-    printf("%s\n", Json::writeString(writer, answers).c_str());
     fflush(stdout);
-
-    for (Json::ArrayIndex i = 0; i < calls.size(); ++i) {
-        if (!states[i].problem.empty()) {
-            fprintf(stderr, "kovacred: batch: call %u failed: %s\n", i, states[i].problem.c_str());
-        }
-    }
     if (failed > 0) {
         FailText("batch: " + std::to_string(failed) + " of " + std::to_string(calls.size()) +
                  " calls failed");
@@ -173,15 +351,17 @@ void RunBatch(const std::string &path) {
 
 const Registrar registrar([](CLI::App &app) {
     CLI::App *cmd = app.add_subcommand(
-        "batch", "run a JSON array of calls together and print their answers in order");
+        "batch", "run a JSON array of calls together and summarise their outcomes");
     auto path = std::make_shared<std::string>();
+    auto json = std::make_shared<bool>(false);
     cmd->add_option("FILE", *path,
                     "JSON array of {\"cred\", \"api\", \"version\", \"method\", \"params\"} "
-                    "or {\"url\"} calls")
+                    "or {\"url\"} calls; - reads standard input")
         ->required();
-    cmd->callback([path] {
+    AddJsonFlag(cmd, json.get());
+    cmd->callback([path, json] {
         try {
-            RunBatch(*path);
+            RunBatch(*path, *json);
         } catch (const std::exception &e) {
             FailText(std::string("batch: ") + e.what());
         }

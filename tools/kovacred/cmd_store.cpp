@@ -6,7 +6,6 @@
 #include <time.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <iostream>
 #include <memory>
 #include <string>
@@ -44,21 +43,6 @@ void FailStore(const std::string &what) {
     } else {
         Fail(what, code);
     }
-}
-
-// Control characters would break the table's lines; they are shown as \xNN.
-std::string Printable(const std::string &text) {
-    std::string out;
-    for (unsigned char c : text) {
-        if (c < 0x20 || c == 0x7f) {
-            char esc[8];
-            snprintf(esc, sizeof(esc), "\\x%02X", c);
-            out += esc;
-        } else {
-            out += static_cast<char>(c);
-        }
-    }
-    return out;
 }
 
 std::string TimeText(int32_t seconds) {
@@ -186,34 +170,6 @@ Json::Value CredentialJson(const KOVA_CRED &cred) {
     return v;
 }
 
-// Columns on a terminal: UTF-8 continuation bytes take no column of their own.
-size_t DisplayWidth(const std::string &text) {
-    return static_cast<size_t>(std::count_if(text.begin(), text.end(), [](char c) {
-        return (static_cast<unsigned char>(c) & 0xC0) != 0x80;
-    }));
-}
-
-void PrintTable(const std::vector<std::vector<std::string>> &rows) {
-    std::vector<size_t> widths;
-    for (const auto &row : rows) {
-        widths.resize(std::max(widths.size(), row.size()), 0);
-        for (size_t i = 0; i < row.size(); ++i) {
-            widths[i] = std::max(widths[i], DisplayWidth(row[i]));
-        }
-    }
-    for (const auto &row : rows) {
-        std::string line;
-        for (size_t i = 0; i < row.size(); ++i) {
-            line += row[i];
-            if (i + 1 < row.size()) {
-                line.append(widths[i] - DisplayWidth(row[i]) + 2, ' ');
-            }
-        }
-        line.erase(line.find_last_not_of(' ') + 1);
-        printf("%s\n", line.c_str());
-    }
-}
-
 void RunList(bool json) {
     KOVA_CRED *list = nullptr;
     ResetError();
@@ -232,10 +188,7 @@ void RunList(bool json) {
         for (const KOVA_CRED *c : creds) {
             out.append(CredentialJson(*c));
         }
-        Json::StreamWriterBuilder builder;
-        builder["indentation"] = "  ";
-        builder["emitUTF8"] = true;
-        printf("%s\n", Json::writeString(builder, out).c_str());
+        PrintJson(out);
     } else if (creds.empty()) {
         printf("no credentials\n");
     } else {
@@ -252,13 +205,19 @@ void RunList(bool json) {
     KOVACredListFree(&list);
 }
 
-void RunShow(int id) {
+void RunShow(int id, bool json) {
     Cred cred = LoadCredential("show", id);
     if (!cred) {
         return;
     }
     Sess sess(KOVACredSessAlloc());
     const bool hasSession = sess && KOVACredSessGetByID(id, sess.get()) == 0 && sess->id != -1;
+    if (json) {
+        Json::Value out = CredentialJson(*cred);
+        out["session"] = hasSession;
+        PrintJson(out);
+        return;
+    }
     PrintTable({
         {"id:", std::to_string(cred->id)},
         {"host:", Printable(cred->host)},
@@ -287,9 +246,19 @@ void RunRemove(int id) {
     printf("removed credential %d\n", id);
 }
 
-void RunSessionShow(int id) {
+// The one place that prints a session id and token: the user asked for them by name.
+void RunSessionShow(int id, bool json) {
     Sess sess = LoadSession("session show", id);
     if (!sess) {
+        return;
+    }
+    if (json) {
+        Json::Value out(Json::objectValue);
+        out["id"] = sess->id;
+        out["sid"] = sess->access_token;
+        out["token"] = sess->csrf_token;
+        out["extra"] = sess->extra_info;
+        PrintJson(out);
         return;
     }
     PrintTable({
@@ -340,6 +309,11 @@ void RunSessionRemove(int id) {
     printf("removed session of credential %d\n", id);
 }
 
+struct IdOptions {
+    int id = 0;
+    bool json = false;
+};
+
 CLI::Option *AddIdArgument(CLI::App *cmd, int *id) {
     return cmd->add_option("id", *id, "credential id")->required()->check(CLI::PositiveNumber);
 }
@@ -361,13 +335,14 @@ void RegisterStore(CLI::App &app) {
 
     auto json = std::make_shared<bool>(false);
     CLI::App *list = app.add_subcommand("list", "list the stored credentials (no passwords)");
-    list->add_flag("--json", *json, "print a JSON array");
+    AddJsonFlag(list, json.get());
     list->callback([json] { RunList(*json); });
 
-    auto showId = std::make_shared<int>(0);
+    auto showOpts = std::make_shared<IdOptions>();
     CLI::App *show = app.add_subcommand("show", "show one credential (no password)");
-    AddIdArgument(show, showId.get());
-    show->callback([showId] { RunShow(*showId); });
+    AddIdArgument(show, &showOpts->id);
+    AddJsonFlag(show, &showOpts->json);
+    show->callback([showOpts] { RunShow(showOpts->id, showOpts->json); });
 
     auto removeId = std::make_shared<int>(0);
     CLI::App *remove = app.add_subcommand("remove", "remove a credential and its session");
@@ -377,10 +352,12 @@ void RegisterStore(CLI::App &app) {
     CLI::App *session = app.add_subcommand("session", "the stored session of a credential");
     session->require_subcommand(1);
 
-    auto sessShowId = std::make_shared<int>(0);
-    CLI::App *sessShow = session->add_subcommand("show", "show the session of a credential");
-    AddIdArgument(sessShow, sessShowId.get());
-    sessShow->callback([sessShowId] { RunSessionShow(*sessShowId); });
+    auto sessShowOpts = std::make_shared<IdOptions>();
+    CLI::App *sessShow = session->add_subcommand(
+        "show", "show the session of a credential (the only output with its id and token)");
+    AddIdArgument(sessShow, &sessShowOpts->id);
+    AddJsonFlag(sessShow, &sessShowOpts->json);
+    sessShow->callback([sessShowOpts] { RunSessionShow(sessShowOpts->id, sessShowOpts->json); });
 
     auto setOpts = std::make_shared<SessionSetOptions>();
     CLI::App *sessSet = session->add_subcommand("set", "store (replace) a credential's session");

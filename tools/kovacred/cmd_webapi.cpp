@@ -21,6 +21,7 @@ using KOVA::CredRequest;
 using KOVA::CredRequestUtil;
 
 // What a few answer codes of the WebAPI's login mean; other codes are shown as numbers only.
+// These are the server's codes, not the library's.
 std::string LoginCodeText(int code) {
     static const std::map<int, std::string> kTexts = {
         {400, "wrong account or password"},
@@ -31,35 +32,11 @@ std::string LoginCodeText(int code) {
     return it == kTexts.end() ? "" : it->second;
 }
 
-// One failure line with the error code, and its text when known.
-void FailWith(const std::string &what, long code, const std::string &text = "") {
-    if (text.empty()) {
-        Fail(what, code);
-        return;
-    }
-    fprintf(stderr, "kovacred: %s failed (error %ld: %s)\n", what.c_str(), code, text.c_str());
-    gExitCode = (code >= 1 && code <= 255) ? static_cast<int>(code) : 1;
-}
-
 int ErrorCodeOf(const Json::Value &answer) {
     if (answer.isObject() && answer["error"].isObject() && answer["error"]["code"].isInt()) {
         return answer["error"]["code"].asInt();
     }
     return 0;
-}
-
-std::string JsonText(const Json::Value &value, bool pretty) {
-    Json::StreamWriterBuilder builder;
-    builder["indentation"] = pretty ? "  " : "";
-    builder["emitUTF8"] = true;
-    return Json::writeString(builder, value);
-}
-
-bool ParseJson(const std::string &text, Json::Value &value) {
-    Json::CharReaderBuilder builder;
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-    std::string errors;
-    return !text.empty() && reader->parse(text.data(), text.data() + text.size(), &value, &errors);
 }
 
 // Loads credential `id`; prints the failure line when there is none.
@@ -87,13 +64,12 @@ void RunLogin(const LoginOptions &opts) {
     if (!CredRequestUtil::LoginWithOTP(&cred, opts.otp, &sess, &answer)) {
         const int code = ErrorCodeOf(answer);
         if (code != 0) {
-            FailWith("login", code, LoginCodeText(code));
+            FailServer("login", code, LoginCodeText(code));
         } else if (answer.isObject()) {
-            FailWith("login", KOVA::CRED_REQ_ERR_INVALID_RESPONSE, "unusable answer");
+            Fail("login", KOVA::CRED_REQ_ERR_INVALID_RESPONSE);
         } else {
-            const int err = CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
-                                                            : KOVA::CRED_REQ_ERR_QUERY_FAIL;
-            FailWith("login", err, "server not reachable or not answering as a WebAPI");
+            Fail("login", CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
+                                                          : KOVA::CRED_REQ_ERR_QUERY_FAIL);
         }
         return;
     }
@@ -113,8 +89,7 @@ void RunLogout(int id) {
         return;
     }
     if (!CredRequestUtil::Logout(&cred, &sess)) {
-        FailWith("logout", KOVA::CRED_REQ_ERR_INVALID_RESPONSE,
-                 "the server did not confirm the logout");
+        Fail("logout", KOVA::CRED_REQ_ERR_INVALID_RESPONSE);
         return;
     }
     KOVACredSessRemoveByID(id);
@@ -127,16 +102,16 @@ struct CallOptions {
     int version = 0;
     std::string method;
     std::vector<std::string> pairs;
-    std::string json;
+    std::string params;
     std::vector<std::string> files;
-    bool pretty = false;
+    bool json = false;
 };
 
 void RunCall(const CallOptions &opts) {
     Json::Value params(Json::objectValue);
-    if (!opts.json.empty()) {
-        if (!ParseJson(opts.json, params) || !params.isObject()) {
-            FailText("call failed: --json needs a JSON object");
+    if (!opts.params.empty()) {
+        if (!ParseJson(opts.params, params) || !params.isObject()) {
+            FailText("call failed: --params needs a JSON object");
             return;
         }
     }
@@ -156,12 +131,8 @@ void RunCall(const CallOptions &opts) {
     std::unique_ptr<CredRequest> request(
         CredRequest::CreateWebAPIRequest(opts.id, opts.api, opts.version, opts.method, params));
     if (!request) {
-        FailWith("call",
-                 CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
-                                                 : KOVA::CRED_REQ_ERR_UNKNOWN,
-                 CredRequestUtil::m_errCode == KOVA::CRED_REQ_ERR_NO_SUCH_API
-                     ? "the server does not offer " + opts.api
-                     : "");
+        Fail("call " + opts.api, CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
+                                                                 : KOVA::CRED_REQ_ERR_UNKNOWN);
         return;
     }
     for (const auto &file : opts.files) {
@@ -173,40 +144,47 @@ void RunCall(const CallOptions &opts) {
         }
     }
     if (!request->Process(true, 0)) {
-        Fail("call", request->GetError());
+        Fail("call " + opts.api, request->GetError());
         return;
     }
     Json::Value answer;
     if (!ParseJson(request->GetResponse(), answer)) {
-        FailWith("call", KOVA::CRED_REQ_ERR_INVALID_RESPONSE, "the answer is not JSON");
+        FailText("call " + opts.api + " failed: the answer is not JSON");
         return;
     }
     if (!answer.isObject() || !answer["success"].isBool() || !answer["success"].asBool()) {
-        FailWith(
-            "call",
-            ErrorCodeOf(answer) != 0 ? ErrorCodeOf(answer) : KOVA::CRED_REQ_ERR_INVALID_RESPONSE,
-            "the server refused the call");
+        FailServer("call " + opts.api, ErrorCodeOf(answer), "the server refused the call");
         return;
     }
-    printf("%s\n", JsonText(answer, opts.pretty).c_str());
+    // A server may echo the request's parameters, the session among them.
+    Secrets secrets;
+    secrets.AddCredential(opts.id);
+    answer = secrets.Hide(answer);
+    if (opts.json) {
+        printf("%s\n", JsonText(answer, false).c_str());
+    } else {
+        PrintJson(answer.isMember("data") ? answer["data"] : answer);
+    }
 }
 
-void RunApis(int id) {
+void RunApis(int id, bool json) {
     KOVA_CRED cred;
     if (!LoadCred("apis", id, cred)) {
         return;
     }
     CredRequestUtil::m_errCode = 0;
     if (!CredRequestUtil::GetWebAPIDesc(&cred)) {
-        FailWith("apis",
-                 CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
-                                                 : KOVA::CRED_REQ_ERR_QUERY_FAIL,
-                 "the server's API description could not be read");
+        Fail("apis", CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
+                                                     : KOVA::CRED_REQ_ERR_QUERY_FAIL);
         return;
     }
     const Json::Value &desc = CredRequestUtil::m_jsData["webapiDesc"][std::to_string(id)];
     if (!desc.isObject()) {
-        FailWith("apis", KOVA::CRED_REQ_ERR_INVALID_RESPONSE, "the description is not a table");
+        FailText("apis failed: the server's description is not an object");
+        return;
+    }
+    if (json) {
+        PrintJson(desc);
         return;
     }
     size_t width = 3;
@@ -255,15 +233,16 @@ void RegisterWebApi(CLI::App &app) {
         ->check(CLI::PositiveNumber);
     callCmd->add_option("method", call->method, "method name")->required();
     callCmd->add_option("params", call->pairs, "parameters as name=value");
-    callCmd->add_option("--json", call->json, "parameters as a JSON object");
+    callCmd->add_option("--params", call->params, "parameters as a JSON object");
     callCmd->add_option("--file", call->files, "upload a file as FIELD=PATH");
-    callCmd->add_flag("--pretty", call->pretty, "indent the JSON answer");
+    AddJsonFlag(callCmd, &call->json);
     callCmd->callback([call] { RunCall(*call); });
 
-    auto apisId = std::make_shared<int>(0);
+    auto apis = std::make_shared<std::pair<int, bool>>(0, false);
     CLI::App *apisCmd = app.add_subcommand("apis", "list the APIs the credential's server offers");
-    AddId(apisCmd, apisId.get());
-    apisCmd->callback([apisId] { RunApis(*apisId); });
+    AddId(apisCmd, &apis->first);
+    AddJsonFlag(apisCmd, &apis->second);
+    apisCmd->callback([apis] { RunApis(apis->first, apis->second); });
 }
 
 const Registrar kWebApiCommands(RegisterWebApi);

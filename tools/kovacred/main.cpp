@@ -5,6 +5,7 @@
 #include <string>
 
 #include "commands.h"
+#include "common/tool_version.h"
 
 namespace kovacred {
 
@@ -19,23 +20,14 @@ Registrar::Registrar(RegisterFn fn) {
     Registry().push_back(std::move(fn));
 }
 
-int Fail(const std::string &what, long code) {
-    fprintf(stderr, "kovacred: %s failed (error %ld)\n", what.c_str(), code);
-    gExitCode = (code >= 1 && code <= 255) ? static_cast<int>(code) : 1;
-    return gExitCode;
-}
-
-int FailText(const std::string &message) {
-    fprintf(stderr, "kovacred: %s\n", message.c_str());
-    gExitCode = 1;
-    return gExitCode;
-}
-
 }  // namespace kovacred
 
 int main(int argc, char **argv) {
     CLI::App app{"kovacred: keep credentials for remote servers and call their WebAPI"};
     app.require_subcommand(1);
+    app.set_version_flag(
+        "--version", [] { return kova_tools::VersionText("kovacred"); },
+        "print the versions of kovacred and the libraries it runs with");
     std::string db;
     app.add_option("--db", db, "credential database to use (sets kovacredential_db)");
     // The database must be chosen before any command callback runs, so --db is applied here

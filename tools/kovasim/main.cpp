@@ -31,6 +31,7 @@
 #include <json/reader.h>
 #include <json/value.h>
 
+#include "common/tool_version.h"
 #include "simlib/loopback_server.h"
 #include "simlib/relay_sim.h"
 #include "simlib/webapi_sim.h"
@@ -167,6 +168,9 @@ struct RelayRole {
 
 int main(int argc, char **argv) {
     CLI::App app{"kovasim: loopback WebAPI and relay-directory simulator"};
+    app.set_version_flag(
+        "--version", [] { return kova_tools::VersionText("kovasim"); },
+        "print the versions of kovasim and the libraries it runs with");
     Settings settings;
     app.add_option("--config", settings.configPath, "JSON configuration file")
         ->check(CLI::ExistingFile);

@@ -352,6 +352,9 @@ void WebApiSim::SetAesSecret(const std::string &token, const std::string &key) {
 void WebApiSim::Install(LoopbackServer &server) {
     server.Route("*", "/webapi/.*",
                  [this](const httplib::Request &req, httplib::Response &res) { Handle(req, res); });
+    server.Route("POST", "/raw/echo", [](const httplib::Request &req, httplib::Response &res) {
+        res.set_content(req.body, "application/octet-stream");
+    });
 }
 
 void WebApiSim::InstallRedirect(LoopbackServer &server, int httpsPort) {

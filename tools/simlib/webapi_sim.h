@@ -91,8 +91,9 @@ class WebApiSim {
     // False with a message for a malformed configuration; nothing is changed then.
     bool Configure(const Json::Value &config, std::string *error);
 
-    // Installs the WebAPI routes on `server`. Call before server.Start(). The simulator must
-    // outlive the server's serving.
+    // Installs the WebAPI routes on `server`, and "/raw/echo", which answers a POST with its
+    // body as it came (for streamed uploads and downloads). Call before server.Start(). The
+    // simulator must outlive the server's serving.
     void Install(LoopbackServer &server);
     // Makes `server` answer every request with a 302 to the same path on
     // https://127.0.0.1:httpsPort.

@@ -1,0 +1,594 @@
+// kovacred as a user runs it: against a kovasim process and a temporary database, every
+// command's text and --json output, the failure lines and exit statuses, the batch summary
+// and progress, streamed request bodies, the shell completion and the manual page.
+#include <fcntl.h>
+#include <poll.h>
+#include <pty.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <fstream>
+#include <memory>
+#include <random>
+#include <regex>
+#include <set>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include <curl/curl.h>
+#include <gtest/gtest.h>
+#include <json/version.h>
+#include <openssl/crypto.h>
+#include <sqlite3.h>
+
+#include "kovacredential/kovacredential.h"
+#include "platform/json_text.h"
+#include "simlib/loopback_server.h"
+#include "store_fixture.h"
+#include "support/sim_process.h"
+#include "support/temp_dir.h"
+
+namespace kova_test {
+namespace {
+
+constexpr char kPassword[] = "Kp-9f2e6c1d-x";  // the simulator's account "keeper"
+
+struct Result {
+    int status = -1;
+    std::string out;
+    std::string err;
+};
+
+std::string ReadFile(const std::string &path) {
+    std::ifstream in(path, std::ios::binary);
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str();
+}
+
+Json::Value ParseOut(const std::string &text) {
+    Json::Value value;
+    EXPECT_TRUE(kova::JsonFromString(text.substr(0, text.find_last_not_of('\n') + 1), value))
+        << text;
+    return value;
+}
+
+std::string Quote(const std::string &text) {
+    std::string quoted = "'";
+    for (char c : text) {
+        quoted += c == '\'' ? std::string("'\\''") : std::string(1, c);
+    }
+    return quoted + "'";
+}
+
+// One kovasim for the whole suite (its RSA key takes a while to make), with an account whose
+// password is easy to spot in output; each test has a database of its own.
+class KovacredTest : public ::testing::Test {
+  protected:
+    static void SetUpTestSuite() {
+        simDir_ = new TempDir();
+        Json::Value config;
+        Json::Value &accounts = config["webapi"]["accounts"];
+        accounts[0]["account"] = "admin";
+        accounts[0]["password"] = "secret";
+        accounts[1]["account"] = "otpuser";
+        accounts[1]["password"] = "secret";
+        accounts[1]["otp"] = "123456";
+        accounts[2]["account"] = "keeper";
+        accounts[2]["password"] = kPassword;
+        std::ofstream(simDir_->File("sim.json")) << kova::JsonToString(config);
+        sim_ = new SimProcess(*simDir_, "--config " + simDir_->File("sim.json"));
+    }
+    static void TearDownTestSuite() {
+        delete sim_;
+        delete simDir_;
+    }
+    void SetUp() override { ASSERT_GT(sim_->HttpPort(), 0) << sim_->ErrorOutput(); }
+
+    // Runs kovacred on the test's database with `input` on standard input.
+    Result Run(const std::string &args, const std::string &input = "") {
+        const std::string in = db_.dir().File("stdin");
+        const std::string err = db_.dir().File("stderr");
+        std::ofstream(in, std::ios::binary) << input;
+        Result result;
+        result.status = RunCommand(std::string(KOVACRED_BIN) + " --db " + db_.path() + " " + args +
+                                       " <" + in + " 2>" + err,
+                                   &result.out);
+        result.err = ReadFile(err);
+        return result;
+    }
+    static std::string Url(const std::string &path, bool https = false) {
+        return std::string(https ? "https" : "http") +
+               "://127.0.0.1:" + std::to_string(https ? sim_->HttpsPort() : sim_->HttpPort()) +
+               path;
+    }
+    void Add(const std::string &account, const std::string &password, bool https = false) {
+        Result r = Run("add --host 127.0.0.1 --port " +
+                           std::to_string(https ? sim_->HttpsPort() : sim_->HttpPort()) +
+                           " --protocol " + (https ? "https" : "http") + " --account " + account,
+                       password + "\n");
+        ASSERT_EQ(r.status, 0) << r.err;
+    }
+
+    TempDatabase db_;
+    static TempDir *simDir_;
+    static SimProcess *sim_;
+};
+
+TempDir *KovacredTest::simDir_ = nullptr;
+SimProcess *KovacredTest::sim_ = nullptr;
+
+TEST_F(KovacredTest, VersionNamesTheLibrariesTheToolsRunWith) {
+    const std::string libraries = std::string("libcurl ") +
+                                  curl_version_info(CURLVERSION_NOW)->version + "\nOpenSSL " +
+                                  OpenSSL_version(OPENSSL_VERSION_STRING) + "\nSQLite " +
+                                  sqlite3_libversion() + "\njsoncpp " JSONCPP_VERSION_STRING "\n";
+    std::string out;
+    EXPECT_EQ(RunCommand(std::string(KOVACRED_BIN) + " --version", &out), 0);
+    EXPECT_EQ(out, "kovacred " KOVA_VERSION "\nlibkovacredential " KOVA_VERSION "\n" + libraries);
+    // kovasim needs nothing of the library, so a release link leaves it out.
+    const bool linked =
+        RunCommand("readelf -d " KOVASIM_BIN " | grep -q 'libkovacredential\\.so'") == 0;
+    out.clear();
+    EXPECT_EQ(RunCommand(std::string(KOVASIM_BIN) + " --version", &out), 0);
+    EXPECT_EQ(out, std::string("kovasim " KOVA_VERSION "\nlibkovacredential ") +
+                       (linked ? KOVA_VERSION : "not loaded") + "\n" + libraries);
+}
+
+TEST_F(KovacredTest, StoreCommandsPrintTextOrJson) {
+    const std::string password = "pa$$'w0rd\"-SECRET";
+    Result r =
+        Run("add --host nas.example --port 5001 --protocol https --account admin "
+            "--application backup --extra '{\"note\":1}' --owner 1026",
+            password + "\n");
+    ASSERT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out, "added credential 1\n");
+    ASSERT_EQ(Run("add --host 10.0.0.7 --port 5000 --protocol http --account ops", "pw\r\n").status,
+              0);
+    KOVA_CRED stored;
+    ASSERT_EQ(KOVACredGetByID(1, &stored), 0);
+    EXPECT_EQ(stored.remote_passwd, password);  // one line, without its newline
+    KOVA_CRED second;
+    ASSERT_EQ(KOVACredGetByID(2, &second), 0);
+    EXPECT_EQ(second.remote_passwd, "pw");
+    EXPECT_EQ(second.owner, -1);
+
+    // Rows oldest first, columns aligned.
+    r = Run("list");
+    EXPECT_EQ(r.out.find("ID  HOST         PORT  PROTOCOL  ACCOUNT  APPLICATION  OWNER"), 0u)
+        << r.out;
+    EXPECT_LT(r.out.find("\n1   nas.example  5001  https     admin    backup       1026"),
+              r.out.find("\n2   10.0.0.7     5000  http      ops                   -1"))
+        << r.out;
+    Json::Value list = ParseOut(Run("list --json").out);
+    ASSERT_EQ(list.size(), 2u);
+    EXPECT_EQ(list[0]["host"], "nas.example");
+    EXPECT_EQ(list[0]["extra"], "{\"note\":1}");
+    EXPECT_EQ(list[1]["protocol"], "http");
+
+    r = Run("show 1");
+    EXPECT_NE(r.out.find("password:     (stored, not shown)\n"), std::string::npos) << r.out;
+    EXPECT_NE(r.out.find("owner:        1026\n"), std::string::npos) << r.out;
+    EXPECT_NE(r.out.find("session:      none\n"), std::string::npos) << r.out;
+
+    ASSERT_EQ(Run("session set 1 --sid SID-1 --token TOK-1 --extra e").out,
+              "stored session of credential 1\n");
+    EXPECT_EQ(Run("session show 1").out, "id:     1\nsid:    SID-1\ntoken:  TOK-1\nextra:  e\n");
+    EXPECT_EQ(ParseOut(Run("session show 1 --json").out),
+              ParseOut(R"({"id": 1, "sid": "SID-1", "token": "TOK-1", "extra": "e"})"));
+    Json::Value shown = ParseOut(Run("show 1 --json").out);
+    EXPECT_EQ(shown["session"], true);
+    EXPECT_EQ(shown["application"], "backup");
+    EXPECT_EQ(shown["owner"], 1026);
+
+    EXPECT_EQ(Run("session remove 1").out, "removed session of credential 1\n");
+    ASSERT_EQ(Run("session set 2 --sid s --token t").status, 0);
+    EXPECT_EQ(Run("remove 2").out, "removed credential 2\n");
+    EXPECT_EQ(store_test::RawQuery(db_.path(), "SELECT id FROM credentials;"),
+              (std::vector<store_test::Row>{{"1"}}));
+    EXPECT_TRUE(store_test::RawQuery(db_.path(), "SELECT * FROM credential_sessions;").empty());
+}
+
+TEST_F(KovacredTest, FailuresPrintOneLineWithTheCodesNameAndExitNonZero) {
+    Add("admin", "secret");
+    struct Case {
+        std::string args;
+        std::string input;
+        int status;
+        std::string err;
+    };
+    const Case cases[] = {
+        {"show 42", "", 1, "kovacred: show: no credential with id 42\n"},
+        {"remove 42", "", 1, "kovacred: remove: no credential with id 42\n"},
+        {"add --host h --port 1 --account a", "", 1,
+         "kovacred: add: no password on standard input (give it as one line)\n"},
+        {"session show 1", "", 1, "kovacred: session show: no session for credential 1\n"},
+        {"session remove 1", "", 1, "kovacred: session remove: no session for credential 1\n"},
+        {"session set 9 --sid x", "", 1, "kovacred: session set: no credential with id 9\n"},
+        {"call 9 KOVA.Demo.Echo 1 echo", "", 1, "kovacred: call failed: no credential with id 9\n"},
+        {"logout 1", "", 1, "kovacred: logout failed: no stored session for credential 1\n"},
+        {"call 1 KOVA.No.Such 1 get", "", 6,
+         "kovacred: call KOVA.No.Such failed (error 6 CRED_REQ_ERR_NO_SUCH_API: the server does "
+         "not offer the API)\n"},
+        {"request " + Url("/missing"), "", 14,
+         "kovacred: request failed (error 14 CRED_REQ_ERR_HTTP_CLIENT: HTTP status 400 to 499)\n"},
+        {"probe " + Url("/missing"), "", 5,
+         "kovacred: probe failed (error 5 CRED_REQ_ERR_QUERY_FAIL: a probe or API-description "
+         "query failed)\n"},
+        {"request http://127.0.0.1:1/", "", 20,
+         "kovacred: request failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
+         "failed)\n"},
+    };
+    for (const Case &c : cases) {
+        Result r = Run(c.args, c.input);
+        EXPECT_EQ(r.status, c.status) << c.args << ": " << r.err;
+        EXPECT_EQ(r.err, c.err) << c.args;
+        EXPECT_EQ(r.out, "") << c.args;
+    }
+    // The password is never taken from the command line, nor is a port out of range.
+    EXPECT_NE(Run("add --host h --port 1 --account a --password x", "pw\n").status, 0);
+    EXPECT_NE(Run("add --host h --port 70000 --account a", "pw\n").status, 0);
+    EXPECT_EQ(store_test::RawQuery(db_.path(), "SELECT id FROM credentials;").size(), 1u);
+
+    // A store code above 255 is named but exits 1; a file that is no database has no code.
+    std::string out;
+    EXPECT_EQ(RunCommand(std::string(KOVACRED_BIN) + " --db " + db_.path() + "/sub/db.sqlite list" +
+                             " 2>&1",
+                         &out),
+              1);
+    EXPECT_EQ(out,
+              "kovacred: list credentials failed (error 2304 KOVA_ERR_DB_OPEN: the database "
+              "cannot be opened)\n");
+    std::ofstream(db_.path(), std::ios::trunc) << std::string(4096, 'J');
+    EXPECT_EQ(Run("show 1").err,
+              "kovacred: show: reading credential 1 failed: the database could not be used "
+              "(details in the system log)\n");
+}
+
+TEST_F(KovacredTest, WebApiCommandsLogInCallAndLogOut) {
+    Add("admin", "secret");
+    Add("admin", "wrong");
+    Add("otpuser", "secret");
+    Add("admin", "secret", true);
+
+    Result r = Run("login 1");
+    EXPECT_EQ(r.out, "logged in to " + Url("") + " as admin; session stored for credential 1\n")
+        << r.err;
+    r = Run("apis 1");
+    EXPECT_TRUE(
+        std::regex_search(r.out, std::regex("\nKOVA\\.Demo\\.Json +entry\\.cgi +1-1 +JSON\n")))
+        << r.out;
+    EXPECT_EQ(ParseOut(Run("apis 1 --json").out)["KOVA.Demo.Upload"]["path"], "upload.cgi");
+
+    // Text: the answer's data, indented; --json: the whole answer, on one line.
+    r = Run("call 1 KOVA.Demo.Echo 1 echo greeting=hello 'note=two words'");
+    ASSERT_EQ(r.status, 0) << r.err;
+    EXPECT_NE(r.out.find("\n  \"method\" : \"echo\""), std::string::npos) << r.out;
+    EXPECT_EQ(ParseOut(r.out)["params"]["note"], "two words");
+    r = Run("call 1 KOVA.Demo.Json 1 get --params '{\"count\":3}' tag=x --json");
+    ASSERT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(std::count(r.out.begin(), r.out.end(), '\n'), 1) << r.out;
+    Json::Value answer = ParseOut(r.out);
+    EXPECT_EQ(answer["success"], true);
+    EXPECT_EQ(answer["data"]["params"]["count"], 3);
+    // Over HTTPS, logging in first since no session is stored.
+    EXPECT_EQ(ParseOut(Run("call 4 KOVA.Demo.Session 1 whoami").out)["account"], "admin");
+
+    EXPECT_EQ(Run("logout 1").out, "logged out; session of credential 1 removed\n");
+
+    // The server's own codes are not the library's.
+    EXPECT_EQ(Run("login 2").err,
+              "kovacred: login failed (server error 400: wrong account or password)\n");
+    EXPECT_EQ(Run("login 3").err,
+              "kovacred: login failed (server error 403: one-time code required)\n");
+    EXPECT_EQ(Run("login 3 --otp 000000").err,
+              "kovacred: login failed (server error 404: wrong one-time code)\n");
+    EXPECT_EQ(Run("login 3 --otp 123456").status, 0);
+}
+
+// The password, session id and token of a stored credential reach no output but that of
+// "session show", although the echo API sends the session back in every answer.
+TEST_F(KovacredTest, SecretsAppearOnlyInSessionShow) {
+    Add("keeper", kPassword);
+    ASSERT_EQ(Run("login 1").status, 0);
+    const std::string batch = R"([{"cred": 1, "api": "KOVA.Demo.Echo", "version": 1,
+                                  "method": "echo", "params": {"p": ")" +
+                              std::string(kPassword) + "\"}}]";
+    const std::string commands[] = {"list",
+                                    "list --json",
+                                    "show 1",
+                                    "show 1 --json",
+                                    "apis 1",
+                                    "apis 1 --json",
+                                    "batch -",
+                                    "batch - --json",
+                                    "login 1",
+                                    "call 1 KOVA.Demo.Echo 1 echo",
+                                    "call 1 KOVA.Demo.Echo 1 echo --json",
+                                    "logout 1"};
+    std::set<std::string> secrets = {kPassword};
+    bool echoed = false;
+    for (const std::string &command : commands) {
+        Result r = Run(command, command.rfind("batch", 0) == 0 ? batch : "");
+        EXPECT_TRUE(r.status == 0) << command << ": " << r.err;
+        KOVA_CRED_SESS sess;
+        if (KOVACredSessGetByID(1, &sess) == 0 && sess.id == 1) {
+            secrets.insert(sess.access_token);
+            secrets.insert(sess.csrf_token);
+        }
+        for (const std::string &secret : secrets) {
+            EXPECT_EQ((r.out + r.err).find(secret), std::string::npos)
+                << command << " printed " << secret << ":\n"
+                << r.out << r.err;
+        }
+        echoed = echoed || r.out.find("(hidden)") != std::string::npos;
+    }
+    EXPECT_TRUE(echoed) << "the echo answers should have carried the session";
+
+    ASSERT_EQ(Run("login 1").status, 0);
+    KOVA_CRED_SESS sess;
+    ASSERT_EQ(KOVACredSessGetByID(1, &sess), 0);
+    for (const char *command : {"session show 1", "session show 1 --json"}) {
+        Result r = Run(command);
+        EXPECT_NE(r.out.find(sess.access_token), std::string::npos) << r.out;
+        EXPECT_NE(r.out.find(sess.csrf_token), std::string::npos) << r.out;
+    }
+}
+
+TEST_F(KovacredTest, BatchSummarisesEveryCallAndFailsWhenOneDoes) {
+    Add("admin", "secret");
+    const std::string info = Url("/webapi/query.cgi?api=KOVA.API.Info&version=1&method=query");
+    const std::string calls =
+        R"([{"cred": 1, "api": "KOVA.Demo.Delay", "version": 1, "method": "wait",
+             "params": {"ms": "100"}},
+            {"url": ")" +
+        info + R"("}, {"url": ")" + Url("/missing") + R"("},
+            {"cred": 42, "api": "KOVA.Demo.Echo", "version": 1, "method": "echo"}, 7])";
+    Result r = Run("batch -", calls);
+    EXPECT_EQ(r.status, 1);
+    std::vector<std::string> lines;
+    std::istringstream rows(r.out);
+    for (std::string line; std::getline(rows, line);) {
+        lines.push_back(line);
+    }
+    ASSERT_EQ(lines.size(), 6u) << r.out;
+    const std::string time = " +[0-9]+\\.[0-9]{3} s";
+    const std::string expected[] = {
+        "# +TARGET +RESULT +ERROR +TIME",
+        "0 +cred 1 KOVA\\.Demo\\.Delay 1 wait +ok +-" + time,
+        "1 +http://127\\.0\\.0\\.1:[0-9]+/webapi/query\\.cgi\\?api=KOVA\\.API\\.Info&version=1&"
+        "method=query +ok +-" +
+            time,
+        "2 +http://127\\.0\\.0\\.1:[0-9]+/missing +failed +14 CRED_REQ_ERR_HTTP_CLIENT" + time,
+        "3 +cred 42 KOVA\\.Demo\\.Echo 1 echo +not run +[0-9]+ CRED_REQ_ERR_[A-Z_]+ +-",
+        "4 +\\(not an object\\) +not run +1 CRED_REQ_ERR_BAD_PARAM +-",
+    };
+    for (size_t i = 0; i < lines.size(); ++i) {
+        EXPECT_TRUE(std::regex_match(lines[i], std::regex(expected[i]))) << lines[i];
+    }
+    EXPECT_EQ(r.err,
+              "kovacred: batch: call 3: cannot build the WebAPI request\n"
+              "kovacred: batch: call 4: not an object\n"
+              "kovacred: batch: 3 of 5 calls failed\n");
+
+    const std::string file = db_.dir().File("calls.json");
+    std::ofstream(file) << calls;
+    r = Run("batch --json " + file);
+    EXPECT_EQ(r.status, 1);
+    Json::Value out = ParseOut(r.out);
+    ASSERT_EQ(out.size(), 5u) << r.out;
+    EXPECT_EQ(out[0]["result"], "ok");
+    EXPECT_EQ(out[0]["answer"]["data"]["delayed_ms"], 100);
+    EXPECT_GE(out[0]["ms"].asInt(), 100);
+    EXPECT_TRUE(out[1]["answer"]["data"].isMember("KOVA.API.Info")) << r.out;
+    EXPECT_EQ(out[2]["code"], 14);
+    EXPECT_EQ(out[2]["name"], "CRED_REQ_ERR_HTTP_CLIENT");
+    EXPECT_EQ(out[4]["result"], "not run");
+    EXPECT_TRUE(out[4]["answer"].isNull());
+
+    r = Run("batch -", "[{\"url\": \"" + info + "\"}]");
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.err, "");
+    r = Run("batch " + db_.dir().File("absent.json"));
+    EXPECT_EQ(r.err, "kovacred: batch: cannot read " + db_.dir().File("absent.json") + "\n");
+    r = Run("batch -", "{\"url\": \"x\"}");
+    EXPECT_EQ(r.err, "kovacred: batch: standard input must hold a JSON array of calls\n");
+}
+
+// Progress goes to standard error only on a terminal, and ends on the final counts.
+TEST_F(KovacredTest, BatchShowsProgressOnATerminal) {
+    Add("admin", "secret");
+    const std::string calls = R"([{"cred": 1, "api": "KOVA.Demo.Delay", "version": 1,
+        "method": "wait", "params": {"ms": "1500"}}, {"url": ")" +
+                              Url("/missing") + "\"}]";
+    const std::string file = db_.dir().File("calls.json");
+    std::ofstream(file) << calls;
+    const std::string out = db_.dir().File("stdout");
+    int master = -1;
+    pid_t pid = forkpty(&master, nullptr, nullptr, nullptr);
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+        alarm(60);
+        int fd = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+        dup2(fd, STDOUT_FILENO);
+        execl(KOVACRED_BIN, KOVACRED_BIN, "--db", db_.path().c_str(), "batch", file.c_str(),
+              static_cast<char *>(nullptr));
+        _exit(127);
+    }
+    std::string terminal;
+    for (int i = 0; i < 300; ++i) {  // at most 30 s
+        struct pollfd p = {master, POLLIN, 0};
+        if (poll(&p, 1, 100) > 0) {
+            char buf[512];
+            ssize_t n = read(master, buf, sizeof(buf));
+            if (n <= 0) {
+                break;
+            }
+            terminal.append(buf, static_cast<size_t>(n));
+        }
+    }
+    close(master);
+    int status = 0;
+    waitpid(pid, &status, 0);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 1) << status;
+    EXPECT_NE(terminal.find("kovacred: batch: 1/2 done, 1 failed, "), std::string::npos)
+        << terminal;
+    EXPECT_TRUE(std::regex_search(terminal, std::regex("\rkovacred: batch: 2/2 done, 1 failed, "
+                                                       "[0-9]+\\.[0-9] s\r?\n")))
+        << terminal;
+    EXPECT_NE(ReadFile(out).find("0  cred 1 KOVA.Demo.Delay 1 wait"), std::string::npos);
+}
+
+TEST_F(KovacredTest, RequestStreamsTwentyMegabytesBothWaysByteExact) {
+    const std::string in = db_.dir().File("in.bin");
+    {
+        std::mt19937 random(12);
+        std::string data(20 << 20, '\0');
+        for (char &c : data) {
+            c = static_cast<char>(random());
+        }
+        std::ofstream(in, std::ios::binary) << data;
+    }
+    const std::string out = db_.dir().File("out.bin");
+    Result r = Run("request -T " + in + " -o " + out + " " + Url("/raw/echo"));
+    ASSERT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out, "");
+    EXPECT_TRUE(ReadFile(in) == ReadFile(out)) << "the body came back altered";
+
+    r = Run("request --json --upload-file - --output " + out + " " + Url("/raw/echo", true),
+            ReadFile(in));
+    ASSERT_EQ(r.status, 0) << r.err;
+    Json::Value answer = ParseOut(r.out);
+    EXPECT_EQ(answer["status"], 200);
+    EXPECT_EQ(answer["bytes"], 20 << 20);
+    EXPECT_EQ(answer["output"], out);
+    EXPECT_EQ(answer["headers"]["Content-Type"], "application/octet-stream");
+    EXPECT_TRUE(ReadFile(in) == ReadFile(out)) << "the body came back altered";
+}
+
+TEST_F(KovacredTest, RequestSendsItsOptionsAndPrintsTextOrJson) {
+    kovasim::LoopbackServer server;
+    server.Route("*", "/echo", [](const httplib::Request &req, httplib::Response &res) {
+        res.set_header("X-Answer", "42");
+        res.set_content(req.method + " " + req.target + " " + req.body + " H=" +
+                            req.get_header_value("X-Test") + " C=" + req.get_header_value("Cookie"),
+                        "text/plain");
+    });
+    ASSERT_TRUE(server.Start());
+    const std::string url = server.BaseUrl() + "/echo";
+    EXPECT_EQ(Run("request " + url + " -q a=1 -d b=x -H 'X-Test: t' -b id=S").out,
+              "POST /echo?a=1 b=x H=t C=id=S\n");
+    std::ofstream(db_.dir().File("body")) << "{\"k\":1}";
+    Result r = Run("request --headers --body-file " + db_.dir().File("body") + " " + url);
+    EXPECT_TRUE(std::regex_match(r.out, std::regex("\\{.*\"X-Answer\":\"42\".*\\}\n"
+                                                   "POST /echo \\{\"k\":1\\} H= C=\n")))
+        << r.out;
+    Json::Value answer = ParseOut(Run("request --json " + url + " -d b=y").out);
+    EXPECT_EQ(answer["url"], url);
+    EXPECT_EQ(answer["status"], 200);
+    EXPECT_EQ(answer["headers"]["X-Answer"], "42");
+    EXPECT_EQ(answer["body"], "POST /echo b=y H= C=");
+
+    EXPECT_EQ(Run("probe " + url).out, "reachable\n");
+    EXPECT_EQ(ParseOut(Run("probe --json " + url).out),
+              ParseOut("{\"url\": \"" + url + "\", \"reachable\": true}"));
+}
+
+// The completion function run in bash, as bash-completion runs it.
+TEST_F(KovacredTest, CompletionOffersCommandsOptionsIdsAndFiles) {
+    Add("admin", "secret");
+    Add("ops", "secret");
+    std::ofstream(db_.dir().File("calls.json")) << "[]";
+    const std::string db = db_.path();
+    const std::string dir = db_.dir().path();
+    struct Case {
+        std::string line;  // after "kovacred "
+        std::string candidates;
+    };
+    const Case cases[] = {
+        {"se", "session"},
+        {"session ", "show set remove"},
+        {"--db " + db + " show ", "1 2"},
+        {"--db " + db + " session show ", "1 2"},
+        {"--db " + db + " call 2 ", ""},
+        {"--db " + dir + "/absent.sqlite show ", ""},
+        {"request --upl", "--upload --upload-file"},
+        {"list --", "--json --help"},
+        {"add --protocol ", "http https"},
+        {"batch " + dir + "/ca", dir + "/calls.json"},
+        {"request -o " + dir + "/ca", dir + "/calls.json"},
+    };
+    for (const Case &c : cases) {
+        const std::string script =
+            "source /usr/share/bash-completion/bash_completion\n"
+            "source " KOVA_SOURCE_DIR
+            "/tools/kovacred/kovacred.bash\n"
+            "COMP_LINE=" +
+            Quote(std::string(KOVACRED_BIN) + " " + c.line) +
+            "\nCOMP_POINT=${#COMP_LINE}\n"
+            "read -ra COMP_WORDS <<< \"$COMP_LINE\"\n"
+            "[[ $COMP_LINE == *' ' ]] && COMP_WORDS+=('')\n"
+            "COMP_CWORD=$((${#COMP_WORDS[@]} - 1))\n"
+            "_kovacred\n"
+            "echo \"${COMPREPLY[*]}\"\n";
+        std::ofstream(db_.dir().File("complete.sh")) << script;
+        std::string out;
+        EXPECT_EQ(RunCommand("bash " + db_.dir().File("complete.sh") + " 2>&1", &out), 0);
+        EXPECT_EQ(out, c.candidates + "\n") << c.line;
+    }
+    EXPECT_FALSE(std::ifstream(dir + "/absent.sqlite").good()) << "completion made a database";
+}
+
+// Every command and option `kovacred --help` lists is in kovacred(1) and (options) offered
+// by the completion.
+TEST(KovacredManualTest, PageAndCompletionNameEveryCommandAndOption) {
+    std::string page;
+    ASSERT_EQ(
+        RunCommand("MANWIDTH=200 LC_ALL=C man -l " KOVA_BINARY_DIR "/doc/kovacred.1.gz", &page), 0);
+    const std::string completion = ReadFile(KOVA_SOURCE_DIR "/tools/kovacred/kovacred.bash");
+    const std::regex option("^  (?:(-[a-zA-Z]),)?(--[a-z][a-z-]*)");
+    const std::regex subcommand("^  ([a-z]+) ");
+    std::vector<std::string> commands = {""};
+    size_t checked = 0;
+    for (size_t i = 0; i < commands.size(); ++i) {
+        std::string help;
+        ASSERT_EQ(RunCommand(std::string(KOVACRED_BIN) + " " + commands[i] + " --help", &help), 0);
+        std::istringstream lines(help);
+        bool inSubcommands = false;
+        for (std::string line; std::getline(lines, line);) {
+            std::smatch m;
+            if (line.rfind("Subcommands:", 0) == 0 || line.rfind("Options:", 0) == 0 ||
+                line.rfind("Positionals:", 0) == 0) {
+                inSubcommands = line[0] == 'S';
+            } else if (inSubcommands && std::regex_search(line, m, subcommand)) {
+                const std::string name = (commands[i].empty() ? "" : commands[i] + " ") + m.str(1);
+                commands.push_back(name);
+                EXPECT_TRUE(std::regex_search(page, std::regex("\n +" + name + "[ \n]")))
+                    << "kovacred(1) has no entry for " << name;
+                EXPECT_NE(completion.find(m.str(1)), std::string::npos) << name;
+            } else if (std::regex_search(line, m, option)) {
+                for (const std::string &name : {m.str(1), m.str(2)}) {
+                    if (name.empty() || name == "--help") {
+                        continue;
+                    }
+                    ++checked;
+                    EXPECT_TRUE(std::regex_search(
+                        page, std::regex("(^|[^a-zA-Z-])" + name + "([^a-zA-Z-]|$)")))
+                        << "kovacred(1) does not name " << name << " of '" << commands[i] << "'";
+                    if (name.size() > 2) {
+                        EXPECT_NE(completion.find(name), std::string::npos)
+                            << "the completion does not offer " << name;
+                    }
+                }
+            }
+        }
+    }
+    EXPECT_EQ(commands.size(), 17u);  // "" and 13 commands, session's three
+    EXPECT_GT(checked, 40u);
+}
+
+}  // namespace
+}  // namespace kova_test

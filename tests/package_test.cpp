@@ -1,0 +1,189 @@
+// The Debian packages of this build tree, built once for the whole suite with cpack: what
+// each holds, its control fields, lintian's verdict, and that they work unpacked into a
+// throwaway root (never the system's): the consumer program builds against the -dev package
+// and the tools run.
+#include <algorithm>
+#include <fstream>
+#include <map>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "support/temp_dir.h"
+
+namespace kova_test {
+namespace {
+
+const std::string kVersion = KOVA_VERSION;
+const std::string kLibDir = std::string("usr/") + KOVA_INSTALL_LIBDIR;
+const char *const kPackages[] = {"libkovacredential6", "libkovacredential-dev", "kovacred"};
+
+class PackageTest : public ::testing::Test {
+  protected:
+    static void SetUpTestSuite() {
+        dir_ = new TempDir();
+        built_ =
+            RunCommand(std::string("cd ") + dir_->path() + " && " KOVA_CPACK " -G DEB --config " +
+                       KOVA_BINARY_DIR "/CPackConfig.cmake -B " + dir_->path() +
+                       " >cpack.log 2>&1") == 0;
+        for (const char *package : kPackages) {
+            if (built_) {
+                built_ = RunCommand("dpkg-deb -x " + Deb(package) + " " + Root()) == 0;
+            }
+        }
+    }
+    static void TearDownTestSuite() { delete dir_; }
+    void SetUp() override { ASSERT_TRUE(built_) << ReadAll(dir_->File("cpack.log")); }
+
+    static std::string Deb(const std::string &package) {
+        return dir_->File(package + "_" + kVersion + "_amd64.deb");
+    }
+    static std::string Root() { return dir_->File("root"); }
+    static std::string ReadAll(const std::string &path) {
+        std::ifstream in(path);
+        std::stringstream text;
+        text << in.rdbuf();
+        return text.str();
+    }
+    static std::string Output(const std::string &command, int *status = nullptr) {
+        std::string out;
+        int rc = RunCommand(command, &out);
+        if (status != nullptr) {
+            *status = rc;
+        }
+        return out;
+    }
+
+    static TempDir *dir_;
+    static bool built_;
+};
+
+TempDir *PackageTest::dir_ = nullptr;
+bool PackageTest::built_ = false;
+
+TEST_F(PackageTest, EachPackageHoldsItsFilesAndNothingElse) {
+    const std::string lib = "./" + kLibDir + "/";
+    const std::map<std::string, std::vector<std::string>> expected = {
+        {"libkovacredential6",
+         {lib + "libkovacredential.so.6 -> libkovacredential.so." + kVersion,
+          lib + "libkovacredential.so." + kVersion,
+          "./usr/share/doc/libkovacredential6/changelog.gz",
+          "./usr/share/doc/libkovacredential6/copyright"}},
+        {"libkovacredential-dev",
+         {lib + "libkovacredential.so -> libkovacredential.so.6",
+          lib + "pkgconfig/kovacredential.pc",
+          lib + "cmake/KovaCredential/KovaCredentialConfig.cmake",
+          lib + "cmake/KovaCredential/KovaCredentialConfigVersion.cmake",
+          lib + "cmake/KovaCredential/KovaCredentialTargets.cmake",
+          "./usr/include/kovacredential/kovacredential.h",
+          "./usr/include/kovacredential/cred_request.h",
+          "./usr/share/man/man3/libkovacredential.3.gz",
+          "./usr/share/doc/libkovacredential-dev/changelog.gz",
+          "./usr/share/doc/libkovacredential-dev/copyright"}},
+        {"kovacred",
+         {"./usr/bin/kovacred", "./usr/bin/kovasim", "./usr/share/man/man1/kovacred.1.gz",
+          "./usr/share/man/man1/kovasim.1.gz", "./usr/share/bash-completion/completions/kovacred",
+          "./usr/share/doc/kovacred/changelog.gz", "./usr/share/doc/kovacred/copyright"}},
+    };
+    for (const auto &entry : expected) {
+        // "dpkg-deb -c" lists like "tar tv"; the path (and link target) is what follows the time.
+        std::istringstream listing(
+            Output("dpkg-deb -c " + Deb(entry.first) + " | sed -E 's/^([^ ]+ +){5}//'"));
+        std::vector<std::string> files;
+        for (std::string line; std::getline(listing, line);) {
+            if (line.back() != '/') {
+                files.push_back(line);
+            }
+        }
+        for (const std::string &file : entry.second) {
+            EXPECT_NE(std::find(files.begin(), files.end(), file), files.end())
+                << entry.first << " lacks " << file;
+        }
+        for (const std::string &file : files) {
+            // Headers and the exported targets' per-configuration files are many.
+            bool devFile = file.find("/include/kovacredential/") != std::string::npos ||
+                           file.find("/cmake/KovaCredential/") != std::string::npos;
+            bool known =
+                std::find(entry.second.begin(), entry.second.end(), file) != entry.second.end() ||
+                (entry.first == "libkovacredential-dev" && devFile);
+            EXPECT_TRUE(known) << entry.first << " holds the unexpected " << file;
+        }
+    }
+}
+
+TEST_F(PackageTest, ControlFieldsNameTheDependencies) {
+    struct Field {
+        std::string package;
+        std::string field;
+        std::vector<std::string> contains;
+    };
+    const Field fields[] = {
+        {"libkovacredential6",
+         "Depends",
+         {"libc6 (", "libcurl4 (", "libjsoncpp25 (", "libsqlite3-0 (", "libssl3 (",
+          "libstdc++6 ("}},
+        {"libkovacredential6", "Section", {"libs"}},
+        {"libkovacredential-dev",
+         "Depends",
+         {"libkovacredential6 (= " + kVersion + ")", "libcurl4-openssl-dev | libcurl-dev",
+          "libjsoncpp-dev", "libssl-dev", "libsqlite3-dev", "pkg-config"}},
+        {"libkovacredential-dev", "Section", {"libdevel"}},
+        {"kovacred", "Depends", {"libkovacredential6 (= " + kVersion + ")", "libcurl4 ("}},
+        {"kovacred", "Section", {"utils"}},
+    };
+    for (const Field &f : fields) {
+        const std::string value = Output("dpkg-deb -f " + Deb(f.package) + " " + f.field);
+        for (const std::string &part : f.contains) {
+            EXPECT_NE(value.find(part), std::string::npos)
+                << f.package << " " << f.field << ": " << value;
+        }
+    }
+    // The runtime package tells dpkg-shlibdeps of other packages what its soname needs.
+    EXPECT_EQ(Output("dpkg-deb -I " + Deb("libkovacredential6") + " shlibs"),
+              "libkovacredential 6 libkovacredential6 (>= " + kVersion + ")\n");
+}
+
+TEST_F(PackageTest, LintianReportsNoError) {
+    const std::string report = Output("lintian --no-tag-display-limit " + Deb(kPackages[0]) + " " +
+                                      Deb(kPackages[1]) + " " + Deb(kPackages[2]) + " 2>&1");
+    std::istringstream lines(report);
+    for (std::string line; std::getline(lines, line);) {
+        EXPECT_NE(line.rfind("E: ", 0), 0u) << line;
+    }
+    EXPECT_EQ(report.find("lintian: command not found"), std::string::npos);
+}
+
+TEST_F(PackageTest, ConsumerBuildsAgainstTheUnpackedDevPackage) {
+    int status = -1;
+    const std::string log =
+        Output("cmake -DSOURCE_DIR=" KOVA_SOURCE_DIR " -DPREFIX=" + Root() +
+                   "/usr -DLIBDIR=" + KOVA_INSTALL_LIBDIR " -DWORK=" + dir_->path() +
+                   " -P " KOVA_SOURCE_DIR "/tests/consumer/run_consumer.cmake 2>&1",
+               &status);
+    EXPECT_EQ(status, 0) << log;
+}
+
+TEST_F(PackageTest, ToolsAndManualPagesWorkFromTheUnpackedRoot) {
+    const std::string env = "LD_LIBRARY_PATH=" + Root() + "/" + kLibDir + " ";
+    for (const std::string tool : {"kovacred", "kovasim"}) {
+        int status = -1;
+        const std::string out = Output(env + Root() + "/usr/bin/" + tool + " --version", &status);
+        EXPECT_EQ(status, 0);
+        EXPECT_EQ(out.rfind(tool + " " + kVersion + "\n", 0), 0u) << out;
+    }
+    EXPECT_NE(Output(env + Root() + "/usr/bin/kovacred --version")
+                  .find("libkovacredential " + kVersion + "\n"),
+              std::string::npos);
+    for (const std::string page :
+         {"man1/kovacred.1.gz", "man1/kovasim.1.gz", "man3/libkovacredential.3.gz"}) {
+        const std::string text =
+            Output("MANWIDTH=100 LC_ALL=C man -l " + Root() + "/usr/share/man/" + page);
+        const std::string name = page.substr(5, page.find('.') - 5);
+        EXPECT_NE(text.find("NAME\n       " + name + " - "), std::string::npos) << page;
+    }
+}
+
+}  // namespace
+}  // namespace kova_test
