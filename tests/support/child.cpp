@@ -9,6 +9,12 @@
 namespace kova_test {
 
 std::string RunInChild(unsigned seconds, const std::function<int()> &body) {
+#if defined(__SANITIZE_THREAD__)
+    // ThreadSanitizer cannot follow threads started after a threaded process forks, and its run
+    // looks for races rather than crashes: the scenario runs in the test's own process.
+    (void)seconds;
+    return "exit " + std::to_string(body());
+#endif
     fflush(nullptr);
     const pid_t pid = fork();
     if (pid < 0) {
