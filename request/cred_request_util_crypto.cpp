@@ -95,30 +95,49 @@ std::unique_ptr<EVP_PKEY, PkeyDeleter> MakeRsaPublicKey(const std::string &modul
     return std::unique_ptr<EVP_PKEY, PkeyDeleter>(key);
 }
 
-using SharedPkey = std::shared_ptr<EVP_PKEY>;
+// An encryption context set up for PKCS#1 v1.5 under the key; calls duplicate it rather than
+// set one up, which would look the algorithms up in the providers again.
+std::unique_ptr<EVP_PKEY_CTX, PkeyCtxDeleter> MakeRsaEncryptor(const std::string &modulusHex,
+                                                               const char *exponentHex) {
+    auto key = MakeRsaPublicKey(modulusHex, exponentHex);
+    if (!key) {
+        return nullptr;
+    }
+    std::unique_ptr<EVP_PKEY_CTX, PkeyCtxDeleter> ctx(
+        EVP_PKEY_CTX_new_from_pkey(nullptr, key.get(), nullptr));
+    if (!ctx || EVP_PKEY_encrypt_init(ctx.get()) <= 0 ||
+        EVP_PKEY_CTX_set_rsa_padding(ctx.get(), RSA_PKCS1_PADDING) <= 0) {
+        return nullptr;
+    }
+    return ctx;
+}
 
-// Public keys imported for the last few servers, most recently used first. A login encrypts
-// under the same server key again and again, and importing a key costs more than encrypting
-// with it. Keys that cannot be built are not kept, so every call for them fails as before.
-// Shared keys are only read (each call makes its own EVP_PKEY_CTX), which OpenSSL allows from
-// several threads at once.
-class RsaKeyCache {
+using SharedEncryptor = std::shared_ptr<const EVP_PKEY_CTX>;
+
+// Encryption contexts for the public keys of the last few servers, most recently used first.
+// A login encrypts under the same server key again and again, and importing a key and setting
+// up a context for it cost more than encrypting with it. Keys that cannot be set up are not
+// kept, so every call for them fails as before. A kept context is only ever duplicated, which
+// reads it, so calls on several threads share it safely.
+class RsaEncryptorCache {
   public:
-    SharedPkey Get(const std::string &modulusHex, const char *exponentHex) {
+    SharedEncryptor Get(const std::string &modulusHex, const char *exponentHex) {
         {
             std::lock_guard<std::mutex> lock(mutex_);
-            if (SharedPkey key = FindLocked(modulusHex, exponentHex)) {
-                return key;
+            if (SharedEncryptor found = FindLocked(modulusHex, exponentHex)) {
+                return found;
             }
         }
-        // Imported without the lock; a thread that imported the same key meanwhile wins.
-        SharedPkey built(MakeRsaPublicKey(modulusHex, exponentHex).release(), PkeyDeleter());
+        // Set up without the lock; a thread that set up the same key meanwhile wins.
+        SharedEncryptor built(
+            MakeRsaEncryptor(modulusHex, exponentHex).release(),
+            [](const EVP_PKEY_CTX *ctx) { EVP_PKEY_CTX_free(const_cast<EVP_PKEY_CTX *>(ctx)); });
         if (!built) {
             return nullptr;
         }
         std::lock_guard<std::mutex> lock(mutex_);
-        if (SharedPkey key = FindLocked(modulusHex, exponentHex)) {
-            return key;
+        if (SharedEncryptor found = FindLocked(modulusHex, exponentHex)) {
+            return found;
         }
         if (entries_.size() == kCapacity) {
             entries_.pop_back();
@@ -132,11 +151,11 @@ class RsaKeyCache {
     struct Entry {
         std::string modulus;
         std::string exponent;
-        SharedPkey key;
+        SharedEncryptor encryptor;
     };
 
-    // The entry's key, moved to the front; null when absent.
-    SharedPkey FindLocked(const std::string &modulusHex, const char *exponentHex) {
+    // The entry's context, moved to the front; null when absent.
+    SharedEncryptor FindLocked(const std::string &modulusHex, const char *exponentHex) {
         auto it = std::find_if(entries_.begin(), entries_.end(), [&](const Entry &e) {
             return e.modulus == modulusHex && e.exponent == exponentHex;
         });
@@ -144,7 +163,7 @@ class RsaKeyCache {
             return nullptr;
         }
         std::rotate(entries_.begin(), it, it + 1);
-        return entries_.front().key;
+        return entries_.front().encryptor;
     }
 
     std::mutex mutex_;
@@ -152,11 +171,11 @@ class RsaKeyCache {
 };
 
 // Process-wide and never destroyed: OpenSSL cleans itself up at exit, after which freeing a
-// key would reach into freed provider state.
-RsaKeyCache &gRsaKeys = *new RsaKeyCache;
+// context would reach into freed provider state.
+RsaEncryptorCache &gRsaEncryptors = *new RsaEncryptorCache;
 
-// AES-256-CBC and SHA-1, fetched from the providers once per process (and, like the keys,
-// never freed). EVP_aes_256_cbc() and EVP_sha1() look the algorithm up again on every
+// AES-256-CBC and SHA-1, fetched from the providers once per process (and, like the RSA
+// contexts, never freed). EVP_aes_256_cbc() and EVP_sha1() look the algorithm up again on every
 // initialisation, six times per key derivation, which costs more than encrypting a kilobyte.
 // When a fetch fails those lookups are used as before.
 std::once_flag gAesAlgorithmsOnce;
@@ -172,12 +191,10 @@ void FetchAesAlgorithms() {
     });
 }
 
-// PKCS#1 v1.5 encryption of the whole text; empty on failure.
-bool RsaEncrypt(EVP_PKEY *key, const std::string &plain, std::string &out) {
-    std::unique_ptr<EVP_PKEY_CTX, PkeyCtxDeleter> ctx(
-        EVP_PKEY_CTX_new_from_pkey(nullptr, key, nullptr));
-    if (!ctx || EVP_PKEY_encrypt_init(ctx.get()) <= 0 ||
-        EVP_PKEY_CTX_set_rsa_padding(ctx.get(), RSA_PKCS1_PADDING) <= 0) {
+// PKCS#1 v1.5 encryption of the whole text on a duplicate of `encryptor`.
+bool RsaEncrypt(const EVP_PKEY_CTX *encryptor, const std::string &plain, std::string &out) {
+    std::unique_ptr<EVP_PKEY_CTX, PkeyCtxDeleter> ctx(EVP_PKEY_CTX_dup(encryptor));
+    if (!ctx) {
         return false;
     }
     const auto *in = reinterpret_cast<const unsigned char *>(plain.data());
@@ -310,9 +327,9 @@ bool CredRequestUtil::GetEncString(const std::string &publicKey, const std::stri
         return false;
     }
     try {
-        SharedPkey key = gRsaKeys.Get(publicKey, kRsaExponentHex);
+        SharedEncryptor encryptor = gRsaEncryptors.Get(publicKey, kRsaExponentHex);
         std::string encrypted;
-        if (!key || !RsaEncrypt(key.get(), plain, encrypted)) {
+        if (!encryptor || !RsaEncrypt(encryptor.get(), plain, encrypted)) {
             kova::Log("%s:%d RSA encrypt fail", kUnit, kLineRsaEncryptFail);
             return false;
         }
