@@ -9,6 +9,7 @@
 // it adds no waits of its own.
 #include <stdio.h>
 #include <stdlib.h>
+#include <time.h>
 
 #include <algorithm>
 #include <chrono>
@@ -55,6 +56,13 @@ bool Probe(const std::string &host, int port) {
     return request.Process(true, 0);
 }
 
+// CPU time of the calling thread.
+double ThreadCpuMillis() {
+    struct timespec now;
+    clock_gettime(CLOCK_THREAD_CPUTIME_ID, &now);
+    return 1e3 * static_cast<double>(now.tv_sec) + 1e-6 * static_cast<double>(now.tv_nsec);
+}
+
 template <typename Fn>
 double Time(Fn fn) {
     auto start = Clock::now();
@@ -64,7 +72,12 @@ double Time(Fn fn) {
 
 }  // namespace
 
-int main() {
+int main(int argc, char **argv) {
+    const int rounds = argc > 1 ? atoi(argv[1]) : 200;
+    if (rounds <= 0) {
+        fprintf(stderr, "usage: %s [rounds]\n", argv[0]);
+        return 2;
+    }
     kovasim::RelayDirectory directory(2);
     if (!directory.Start()) {
         printf("relay_bench: skipped: the directory needs port 80 on loopback addresses (%s)\n",
@@ -87,13 +100,12 @@ int main() {
     const int port = live.Port();
 
     const int counts[] = {0, 4, 16};
-    const int rounds = 200;
     printf(
         "relay_bench: GetConnInfo with k refused candidates before the live one "
-        "(median of %d rounds)\n",
+        "(medians of %d rounds, order alternating)\n",
         rounds);
-    printf("%4s  %14s  %14s  %16s  %7s\n", "k", "resolution ms", "sum of parts", "(dir + probes)",
-           "ratio");
+    printf("%4s  %14s  %14s  %16s  %7s  %9s\n", "k", "resolution ms", "sum of parts",
+           "(dir + probes)", "ratio", "cpu ratio");
     bool withinTarget = true;
     for (int k : counts) {
         // The dead addresses have nothing listening at the live server's port.
@@ -121,39 +133,64 @@ int main() {
         Json::Value plainInfo = httpsInfo;
         plainInfo["id"] = "zon";
 
-        std::vector<double> resolution, parts, directoryParts, probeParts;
+        std::vector<double> resolution, parts, directoryParts, probeParts, ratios, cpuRatios;
         for (int round = 0; round < rounds; ++round) {
             Json::Value candidate;
             Json::Value errors;
             bool ok = true;
-            resolution.push_back(Time(
-                [&] { ok = KOVA::CredRequestFarlink::GetConnInfo("BENCH", candidate, &errors); }));
+            double resolutionCpu = 0;
+            double partsCpu = 0;
+            auto resolve = [&] {
+                const double cpu = ThreadCpuMillis();
+                const double ms = Time([&] {
+                    ok = KOVA::CredRequestFarlink::GetConnInfo("BENCH", candidate, &errors);
+                });
+                resolutionCpu = ThreadCpuMillis() - cpu;
+                return ms;
+            };
+            double dirMs = 0;
+            double probeMs = 0;
+            auto sendParts = [&] {
+                const double cpu = ThreadCpuMillis();
+                dirMs = Time([&] { DirectoryRequest(global, siteList); }) +
+                        Time([&] { DirectoryRequest(site, httpsInfo); }) +
+                        Time([&] { DirectoryRequest(global, siteList); }) +
+                        Time([&] { DirectoryRequest(site, plainInfo); });
+                probeMs = 0;
+                for (const std::string &host : dead) {
+                    probeMs += Time([&] { Probe(host, port); });
+                }
+                probeMs += Time([&] { Probe(options.host, port); });
+                partsCpu = ThreadCpuMillis() - cpu;
+            };
+            double resolutionMs = 0;
+            if (round % 2 == 0) {
+                resolutionMs = resolve();
+                sendParts();
+            } else {
+                sendParts();
+                resolutionMs = resolve();
+            }
             if (!ok || candidate["host"].asString() != options.host) {
                 fprintf(stderr, "relay_bench: resolution failed: %s\n",
                         kova::JsonToString(errors).c_str());
                 return 1;
             }
-            double dirMs = Time([&] { DirectoryRequest(global, siteList); }) +
-                           Time([&] { DirectoryRequest(site, httpsInfo); }) +
-                           Time([&] { DirectoryRequest(global, siteList); }) +
-                           Time([&] { DirectoryRequest(site, plainInfo); });
-            double probeMs = 0;
-            for (const std::string &host : dead) {
-                probeMs += Time([&] { Probe(host, port); });
-            }
-            probeMs += Time([&] { Probe(options.host, port); });
+            resolution.push_back(resolutionMs);
             directoryParts.push_back(dirMs);
             probeParts.push_back(probeMs);
             parts.push_back(dirMs + probeMs);
+            ratios.push_back(resolutionMs / (dirMs + probeMs));
+            cpuRatios.push_back(resolutionCpu / partsCpu);
         }
-        double r = Median(resolution);
-        double p = Median(parts);
+        const double ratio = Median(ratios);
         char split[64];
         snprintf(split, sizeof(split), "%.3f + %.3f", Median(directoryParts), Median(probeParts));
-        printf("%4d  %14.3f  %14.3f  %16s  %7.3f\n", k, r, p, split, r / p);
-        withinTarget = withinTarget && r <= 1.1 * p;
+        printf("%4d  %14.3f  %14.3f  %16s  %7.3f  %9.3f\n", k, Median(resolution), Median(parts),
+               split, ratio, Median(cpuRatios));
+        withinTarget = withinTarget && ratio <= 1.05;
     }
-    printf("target: a resolution costs at most 1.1 times the sum of its parts: %s\n",
+    printf("target: a resolution costs at most 1.05 times the sum of its parts: %s\n",
            withinTarget ? "met" : "NOT met");
     return 0;
 }

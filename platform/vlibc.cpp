@@ -32,6 +32,20 @@ int MakeParents(const std::string &path) {
 
 const char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
 
+// The two characters of every 12-bit value, so that three input bytes take two look-ups.
+struct CharPairs {
+    char pair[4096][2];
+};
+constexpr CharPairs MakeCharPairs() {
+    CharPairs table{};
+    for (int v = 0; v < 4096; ++v) {
+        table.pair[v][0] = kAlphabet[v >> 6];
+        table.pair[v][1] = kAlphabet[v & 63];
+    }
+    return table;
+}
+constexpr CharPairs kCharPairs = MakeCharPairs();
+
 int DecodeChar(unsigned char c) {
     if (c >= 'A' && c <= 'Z')
         return c - 'A';
@@ -93,12 +107,10 @@ int VLIBCBase64SzEncodeFull(const unsigned char *in, size_t inLen, char *out, si
     }
     char *w = out;
     size_t i = 0;
-    for (; i + 3 <= inLen; i += 3) {
-        unsigned v = (in[i] << 16) | (in[i + 1] << 8) | in[i + 2];
-        *w++ = kAlphabet[(v >> 18) & 63];
-        *w++ = kAlphabet[(v >> 12) & 63];
-        *w++ = kAlphabet[(v >> 6) & 63];
-        *w++ = kAlphabet[v & 63];
+    for (; i + 3 <= inLen; i += 3, w += 4) {
+        const unsigned v = (in[i] << 16) | (in[i + 1] << 8) | in[i + 2];
+        memcpy(w, kCharPairs.pair[v >> 12], 2);
+        memcpy(w + 2, kCharPairs.pair[v & 0xFFF], 2);
     }
     if (i < inLen) {
         unsigned v = in[i] << 16;

@@ -2,7 +2,6 @@
 // the server id and its MD5, the error state, and one directory request to "/Serv.php".
 #include "request/cred_request_farlink_p.h"
 
-#include <stdio.h>
 #include <stdlib.h>
 
 #include <memory>
@@ -46,11 +45,12 @@ std::string Md5Hex(const std::string &text) {
         EVP_DigestFinal_ex(ctx.get(), digest, &length) != 1) {
         return "";
     }
+    // Two lower-case digits per byte, as "%02x" writes them.
+    constexpr char kDigits[] = "0123456789abcdef";
     std::string hex;
     for (unsigned int i = 0; i < length && i < 32; ++i) {
-        char pair[3];
-        snprintf(pair, sizeof(pair), "%02x", digest[i]);
-        hex += pair;
+        hex += kDigits[digest[i] >> 4];
+        hex += kDigits[digest[i] & 0x0F];
     }
     return hex;
 }

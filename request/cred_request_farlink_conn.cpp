@@ -2,6 +2,7 @@
 // and the relay endpoints of a server, probed in order until one proves to be the server.
 #include <memory>
 #include <new>
+#include <vector>
 
 #include "platform/json_text.h"
 #include "request/cred_request_farlink_p.h"
@@ -48,19 +49,29 @@ Json::Value Candidate(const std::string &protocol, const Json::Value &host, int 
     return candidate;
 }
 
+const std::string kRelayHttpsProtocol = "https";
+
 }  // namespace
 
-bool CredRequestFarlinkPrivate::ProbeCandidates(const Json::Value &list, bool direct,
-                                                Json::Value &candidate) {
+// One address to probe. The host points into the directory's answer, which outlives the
+// probing; only the address that answers becomes a JSON candidate.
+struct CredRequestFarlinkPrivate::ProbeTarget {
+    const std::string *protocol;
+    const Json::Value *host;
+    int port;
+};
+
+bool CredRequestFarlinkPrivate::ProbeCandidates(const std::vector<ProbeTarget> &targets,
+                                                bool direct, Json::Value &candidate) {
     candidate = Json::Value();
     const Json::Value expected(serverIdMd5);
-    for (const Json::Value &element : list) {
+    for (const ProbeTarget &target : targets) {
         std::unique_ptr<CredRequest> probe(new (std::nothrow) CredRequest());
         if (!probe) {
             continue;
         }
-        probe->SetURL(StringMember(element, "protocol"), StringMember(element, "host"),
-                      IntMember(element, "port"), kProbePath);
+        probe->SetURL(*target.protocol, target.host->isString() ? target.host->asString() : "",
+                      target.port, kProbePath);
         if (direct) {
             probe->SetResponseTimeout(kDirectResponseTimeout);
             probe->SetDefaultTimeout(kDirectDefaultTimeout);
@@ -71,7 +82,7 @@ bool CredRequestFarlinkPrivate::ProbeCandidates(const Json::Value &list, bool di
         Json::Value answer;
         if (kova::JsonFromString(probe->GetResponse(), answer) && answer.isObject() &&
             answer.isMember("ezid") && answer["ezid"] == expected) {
-            candidate = element;
+            candidate = Candidate(*target.protocol, *target.host, target.port);
             break;
         }
     }
@@ -94,25 +105,26 @@ bool CredRequestFarlinkPrivate::GetAvailableDirectConnInfo(const Json::Value &se
     }
 
     // LAN interfaces in the directory's order, then the external address, then DDNS.
-    Json::Value list(Json::arrayValue);
+    std::vector<ProbeTarget> targets;
     if (Has(server, "interface") && port > 0 && server["interface"].isArray()) {
         for (const Json::Value &nic : server["interface"]) {
-            list.append(
-                Candidate(serviceProtocol, Has(nic, "ip") ? nic["ip"] : Json::Value(), port));
+            targets.push_back({&serviceProtocol,
+                               Has(nic, "ip") ? &nic["ip"] : &Json::Value::nullSingleton(), port});
         }
     }
     if (Has(server, "external") && extPort > 0) {
         const Json::Value &external = server["external"];
-        list.append(Candidate(serviceProtocol, Has(external, "ip") ? external["ip"] : Json::Value(),
-                              extPort));
+        targets.push_back({&serviceProtocol,
+                           Has(external, "ip") ? &external["ip"] : &Json::Value::nullSingleton(),
+                           extPort});
     }
     if (Has(server, "ddns") && extPort > 0) {
-        list.append(Candidate(serviceProtocol, server["ddns"], extPort));
+        targets.push_back({&serviceProtocol, &server["ddns"], extPort});
     }
-    if (list.empty()) {
+    if (targets.empty()) {
         return false;
     }
-    return ProbeCandidates(list, true, candidate);
+    return ProbeCandidates(targets, true, candidate);
 }
 
 bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tunnelAnswer,
@@ -126,21 +138,22 @@ bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tun
 
     // Relay address, relay host name on the same port, then the relay's HTTPS endpoint, which
     // is always "https" whatever the service protocol.
-    Json::Value list(Json::arrayValue);
+    std::vector<ProbeTarget> targets;
     if (Has(service, "relay_ip") && Has(service, "relay_port")) {
         const int relayPort = IntMember(service, "relay_port");
-        list.append(Candidate(serviceProtocol, service["relay_ip"], relayPort));
+        targets.push_back({&serviceProtocol, &service["relay_ip"], relayPort});
         if (Has(service, "relay_dn")) {
-            list.append(Candidate(serviceProtocol, service["relay_dn"], relayPort));
+            targets.push_back({&serviceProtocol, &service["relay_dn"], relayPort});
         }
     }
     if (Has(service, "https_ip") && Has(service, "https_port")) {
-        list.append(Candidate("https", service["https_ip"], IntMember(service, "https_port")));
+        targets.push_back(
+            {&kRelayHttpsProtocol, &service["https_ip"], IntMember(service, "https_port")});
     }
-    if (list.empty()) {
+    if (targets.empty()) {
         return false;
     }
-    return ProbeCandidates(list, false, candidate);
+    return ProbeCandidates(targets, false, candidate);
 }
 
 bool CredRequestFarlink::GetAvailableConnInfo(const Json::Value &serverInfo,

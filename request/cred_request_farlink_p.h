@@ -5,6 +5,7 @@
 #define KOVA_REQUEST_CRED_REQUEST_FARLINK_P_H
 
 #include <string>
+#include <vector>
 
 #include <json/value.h>
 
@@ -72,10 +73,12 @@ class CredRequestFarlinkPrivate {
     // ---- Connection candidates.
     bool GetAvailableDirectConnInfo(const Json::Value &serverInfo, Json::Value &candidate);
     bool GetAvailableRelayConnInfo(const Json::Value &tunnelAnswer, Json::Value &candidate);
-    // Probes each {"protocol", "host", "port"} of `list` in order with "/webman/pingpong.cgi"
-    // and copies the first whose "ezid" is the server id MD5 into `candidate`. Direct probes
+    // Probes each target in order with "/webman/pingpong.cgi" and makes the first whose
+    // "ezid" is the server id MD5 the {"protocol", "host", "port"} `candidate`. Direct probes
     // run with short time-outs; relay probes with the request defaults. Sets no error.
-    bool ProbeCandidates(const Json::Value &list, bool direct, Json::Value &candidate);
+    struct ProbeTarget;
+    bool ProbeCandidates(const std::vector<ProbeTarget> &targets, bool direct,
+                         Json::Value &candidate);
 
     // Fields, in this order.
     CredRequestFarlink *owner;

@@ -2,8 +2,11 @@
 // encryption under its public key, and pass-phrase AES-256-CBC in both directions.
 #include <stdlib.h>
 
+#include <algorithm>
 #include <memory>
+#include <mutex>
 #include <sstream>
+#include <vector>
 
 #include <openssl/bn.h>
 #include <openssl/core_names.h>
@@ -61,8 +64,9 @@ size_t Base64BufferSize(size_t n) {
     return (4 * n) / 3 + 5;
 }
 
-// An RSA public key from a hexadecimal modulus and the fixed exponent 65537.
-std::unique_ptr<EVP_PKEY, PkeyDeleter> MakeRsaPublicKey(const std::string &modulusHex) {
+// An RSA public key from a hexadecimal modulus and exponent.
+std::unique_ptr<EVP_PKEY, PkeyDeleter> MakeRsaPublicKey(const std::string &modulusHex,
+                                                        const char *exponentHex) {
     std::unique_ptr<BIGNUM, BignumDeleter> n(BN_new());
     std::unique_ptr<BIGNUM, BignumDeleter> e(BN_new());
     if (!n || !e) {
@@ -71,7 +75,7 @@ std::unique_ptr<EVP_PKEY, PkeyDeleter> MakeRsaPublicKey(const std::string &modul
     BIGNUM *raw = n.get();
     BN_hex2bn(&raw, modulusHex.c_str());
     raw = e.get();
-    BN_hex2bn(&raw, kRsaExponentHex);
+    BN_hex2bn(&raw, exponentHex);
 
     std::unique_ptr<OSSL_PARAM_BLD, ParamBldDeleter> bld(OSSL_PARAM_BLD_new());
     if (!bld || !OSSL_PARAM_BLD_push_BN(bld.get(), OSSL_PKEY_PARAM_RSA_N, n.get()) ||
@@ -91,12 +95,106 @@ std::unique_ptr<EVP_PKEY, PkeyDeleter> MakeRsaPublicKey(const std::string &modul
     return std::unique_ptr<EVP_PKEY, PkeyDeleter>(key);
 }
 
-// PKCS#1 v1.5 encryption of the whole text; empty on failure.
-bool RsaEncrypt(EVP_PKEY *key, const std::string &plain, std::string &out) {
+// An encryption context set up for PKCS#1 v1.5 under the key; calls duplicate it rather than
+// set one up, which would look the algorithms up in the providers again.
+std::unique_ptr<EVP_PKEY_CTX, PkeyCtxDeleter> MakeRsaEncryptor(const std::string &modulusHex,
+                                                               const char *exponentHex) {
+    auto key = MakeRsaPublicKey(modulusHex, exponentHex);
+    if (!key) {
+        return nullptr;
+    }
     std::unique_ptr<EVP_PKEY_CTX, PkeyCtxDeleter> ctx(
-        EVP_PKEY_CTX_new_from_pkey(nullptr, key, nullptr));
+        EVP_PKEY_CTX_new_from_pkey(nullptr, key.get(), nullptr));
     if (!ctx || EVP_PKEY_encrypt_init(ctx.get()) <= 0 ||
         EVP_PKEY_CTX_set_rsa_padding(ctx.get(), RSA_PKCS1_PADDING) <= 0) {
+        return nullptr;
+    }
+    return ctx;
+}
+
+using SharedEncryptor = std::shared_ptr<const EVP_PKEY_CTX>;
+
+// Encryption contexts for the public keys of the last few servers, most recently used first.
+// A login encrypts under the same server key again and again, and importing a key and setting
+// up a context for it cost more than encrypting with it. Keys that cannot be set up are not
+// kept, so every call for them fails as before. A kept context is only ever duplicated, which
+// reads it, so calls on several threads share it safely.
+class RsaEncryptorCache {
+  public:
+    SharedEncryptor Get(const std::string &modulusHex, const char *exponentHex) {
+        {
+            std::lock_guard<std::mutex> lock(mutex_);
+            if (SharedEncryptor found = FindLocked(modulusHex, exponentHex)) {
+                return found;
+            }
+        }
+        // Set up without the lock; a thread that set up the same key meanwhile wins.
+        SharedEncryptor built(
+            MakeRsaEncryptor(modulusHex, exponentHex).release(),
+            [](const EVP_PKEY_CTX *ctx) { EVP_PKEY_CTX_free(const_cast<EVP_PKEY_CTX *>(ctx)); });
+        if (!built) {
+            return nullptr;
+        }
+        std::lock_guard<std::mutex> lock(mutex_);
+        if (SharedEncryptor found = FindLocked(modulusHex, exponentHex)) {
+            return found;
+        }
+        if (entries_.size() == kCapacity) {
+            entries_.pop_back();
+        }
+        entries_.insert(entries_.begin(), Entry{modulusHex, exponentHex, built});
+        return built;
+    }
+
+  private:
+    static constexpr size_t kCapacity = 8;
+    struct Entry {
+        std::string modulus;
+        std::string exponent;
+        SharedEncryptor encryptor;
+    };
+
+    // The entry's context, moved to the front; null when absent.
+    SharedEncryptor FindLocked(const std::string &modulusHex, const char *exponentHex) {
+        auto it = std::find_if(entries_.begin(), entries_.end(), [&](const Entry &e) {
+            return e.modulus == modulusHex && e.exponent == exponentHex;
+        });
+        if (it == entries_.end()) {
+            return nullptr;
+        }
+        std::rotate(entries_.begin(), it, it + 1);
+        return entries_.front().encryptor;
+    }
+
+    std::mutex mutex_;
+    std::vector<Entry> entries_;
+};
+
+// Process-wide and never destroyed: OpenSSL cleans itself up at exit, after which freeing a
+// context would reach into freed provider state.
+RsaEncryptorCache &gRsaEncryptors = *new RsaEncryptorCache;
+
+// AES-256-CBC and SHA-1, fetched from the providers once per process (and, like the RSA
+// contexts, never freed). EVP_aes_256_cbc() and EVP_sha1() look the algorithm up again on every
+// initialisation, six times per key derivation, which costs more than encrypting a kilobyte.
+// When a fetch fails those lookups are used as before.
+std::once_flag gAesAlgorithmsOnce;
+const EVP_CIPHER *gAes256Cbc = nullptr;
+const EVP_MD *gSha1 = nullptr;
+
+void FetchAesAlgorithms() {
+    std::call_once(gAesAlgorithmsOnce, [] {
+        const EVP_CIPHER *cipher = EVP_CIPHER_fetch(nullptr, "AES-256-CBC", nullptr);
+        const EVP_MD *digest = EVP_MD_fetch(nullptr, "SHA1", nullptr);
+        gAes256Cbc = cipher != nullptr ? cipher : EVP_aes_256_cbc();
+        gSha1 = digest != nullptr ? digest : EVP_sha1();
+    });
+}
+
+// PKCS#1 v1.5 encryption of the whole text on a duplicate of `encryptor`.
+bool RsaEncrypt(const EVP_PKEY_CTX *encryptor, const std::string &plain, std::string &out) {
+    std::unique_ptr<EVP_PKEY_CTX, PkeyCtxDeleter> ctx(EVP_PKEY_CTX_dup(encryptor));
+    if (!ctx) {
         return false;
     }
     const auto *in = reinterpret_cast<const unsigned char *>(plain.data());
@@ -119,10 +217,11 @@ constexpr int kLineInitAesKeySize = 118;
 
 int InitAES(const unsigned char *keyData, int keyDataLen, const unsigned char *salt,
             EVP_CIPHER_CTX *encryptCtx, EVP_CIPHER_CTX *decryptCtx) {
+    FetchAesAlgorithms();
     unsigned char key[kAesKeyBytes];
     unsigned char iv[EVP_MAX_IV_LENGTH];
-    const int size = EVP_BytesToKey(EVP_aes_256_cbc(), EVP_sha1(), salt, keyData, keyDataLen,
-                                    kAesKdfRounds, key, iv);
+    const int size =
+        EVP_BytesToKey(gAes256Cbc, gSha1, salt, keyData, keyDataLen, kAesKdfRounds, key, iv);
     if (size != kAesKeyBytes) {
         kova::Log("%s:%d Key size is %d bits - should be 256 bits", kUnit, kLineInitAesKeySize,
                   size);
@@ -130,11 +229,11 @@ int InitAES(const unsigned char *keyData, int keyDataLen, const unsigned char *s
     }
     if (encryptCtx != nullptr) {
         EVP_CIPHER_CTX_reset(encryptCtx);
-        EVP_EncryptInit_ex(encryptCtx, EVP_aes_256_cbc(), nullptr, key, iv);
+        EVP_EncryptInit_ex(encryptCtx, gAes256Cbc, nullptr, key, iv);
     }
     if (decryptCtx != nullptr) {
         EVP_CIPHER_CTX_reset(decryptCtx);
-        EVP_DecryptInit_ex(decryptCtx, EVP_aes_256_cbc(), nullptr, key, iv);
+        EVP_DecryptInit_ex(decryptCtx, gAes256Cbc, nullptr, key, iv);
     }
     OPENSSL_cleanse(key, sizeof(key));
     return 1;
@@ -228,9 +327,9 @@ bool CredRequestUtil::GetEncString(const std::string &publicKey, const std::stri
         return false;
     }
     try {
-        auto key = MakeRsaPublicKey(publicKey);
+        SharedEncryptor encryptor = gRsaEncryptors.Get(publicKey, kRsaExponentHex);
         std::string encrypted;
-        if (!key || !RsaEncrypt(key.get(), plain, encrypted)) {
+        if (!encryptor || !RsaEncrypt(encryptor.get(), plain, encrypted)) {
             kova::Log("%s:%d RSA encrypt fail", kUnit, kLineRsaEncryptFail);
             return false;
         }
@@ -265,8 +364,9 @@ bool CredRequestUtil::GetEncryptAESString(const std::string &passphrase, const s
         kova::Log("%s:%d InitAES fail", kUnit, kLineAesEncInitFail);
         return false;
     }
+    // Only the bytes the cipher writes are read back, so the buffer is not cleared first.
     CBuffer<unsigned char> out(
-        static_cast<unsigned char *>(calloc(2 * kAesBlockSize + plain.size(), 1)));
+        static_cast<unsigned char *>(malloc(2 * kAesBlockSize + plain.size())));
     if (!out) {
         kova::Log("%s:%d calloc ciphertext fail", kUnit, kLineAesEncCallocFail);
         return false;

@@ -60,7 +60,9 @@ class KOVA_EXPORT CredRequestUtil {
     static bool GetEncInfo(const KOVA_CRED *cred, Json::Value &info);
     static bool GetEncInfo(long id, Json::Value &info);
     // RSA (PKCS#1 v1.5, exponent 65537) of at most 512 bytes under the hexadecimal modulus
-    // publicKey, Base64-encoded.
+    // publicKey, Base64-encoded. The keys of the last few servers stay imported in a
+    // process-wide cache with a lock of its own; this and the AES helpers below may run on
+    // several threads at once.
     static bool GetEncString(const std::string &publicKey, const std::string &plain,
                              std::string &cipher);
     // AES-256-CBC under a key and IV derived from the pass phrase alone (EVP_BytesToKey, SHA-1,
