@@ -1,5 +1,6 @@
 // The port layer: error slot, file touch, Base64, pair and URL encoding, token service and
 // address-family query.
+#include <errno.h>
 #include <string.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -51,6 +52,13 @@ TEST(FileTouch, CreatesMissingFoldersPrivately) {
     ASSERT_EQ(VLIBCFileTouch(path.c_str()), 0);
     ASSERT_EQ(stat(path.c_str(), &st), 0);
     EXPECT_EQ(st.st_size, 4);
+
+    // A link is never followed, not even a dangling one.
+    const std::string link = dir.File("link");
+    ASSERT_EQ(symlink(dir.File("target").c_str(), link.c_str()), 0);
+    EXPECT_EQ(VLIBCFileTouch(link.c_str()), -1);
+    EXPECT_EQ(errno, ELOOP);
+    EXPECT_NE(access(dir.File("target").c_str(), F_OK), 0);
 
     // A parent that is a regular file cannot become a folder.
     EXPECT_EQ(VLIBCFileTouch((path + "/below").c_str()), -1);
