@@ -2,6 +2,7 @@
 // runs under, and the record-level operations on an open connection.
 #include <errno.h>
 #include <fcntl.h>
+#include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -300,22 +301,20 @@ sqlite3 *KOVACredDBInit(void) {
         VLIBCErrSetEx(KOVA_ERR_OUT_OF_MEMORY, kUnit, kLineOpenError);
         return nullptr;
     }
-    // Only a regular file is opened, and its mode is set through a descriptor that cannot
-    // have followed a link, so that whoever names the path cannot have another file changed.
+    // Only a regular file is opened, and its mode is set on the file a descriptor holds, so that
+    // whoever names the path cannot have another file changed. O_PATH with O_NOFOLLOW holds a
+    // link itself rather than its target, opens a FIFO or device without touching it, and needs
+    // no read permission, so a file whose mode lost its read bits is still set back to 0600.
     struct stat st;
-    if (lstat(resolved.c_str(), &st) == 0 && !S_ISREG(st.st_mode)) {
-        return Refuse(path, S_ISLNK(st.st_mode) ? "is a symbolic link" : "is not a regular file");
-    }
-    FileDescriptor file(
-        open(resolved.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-    if (file.get() < 0 && errno == ELOOP) {
-        return Refuse(path, "is a symbolic link");
-    }
+    FileDescriptor file(open(resolved.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
     const bool opened = file.get() >= 0 && fstat(file.get(), &st) == 0;
     if (opened && !S_ISREG(st.st_mode)) {
-        return Refuse(path, "is not a regular file");
+        return Refuse(path, S_ISLNK(st.st_mode) ? "is a symbolic link" : "is not a regular file");
     }
-    if (!opened || fchmod(file.get(), 0600) != 0) {
+    // fchmod does not take an O_PATH descriptor; its /proc name leads to that file and no other.
+    char held[64];
+    snprintf(held, sizeof(held), "/proc/self/fd/%d", file.get());
+    if (!opened || chmod(held, 0600) != 0) {
         kova::Log("%s:%d %s chmod failed. errno=[0x%04X]", kUnit, kLineChmodFailed, path.c_str(),
                   errno);
     }

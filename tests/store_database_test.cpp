@@ -1,6 +1,7 @@
 // The credential database: file, mode and schema; the record-level operations on an open
 // connection; their argument and statement errors (logged without secrets); hostile text; a
 // hostile or broken environment.
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -14,15 +15,15 @@
 
 #include "store_fixture.h"
 
-// While set, fchmod renames the first file over the second right after setting the mode, as
+// While set, chmod renames the first file over the second right after setting the mode, as
 // another process could between the library's checks and SQLite's open.
-std::pair<std::string, std::string> gSwapAfterFchmod;
+std::pair<std::string, std::string> gSwapAfterChmod;
 
-extern "C" int fchmod(int fd, mode_t mode) {
-    const int rc = static_cast<int>(syscall(SYS_fchmod, fd, mode));
-    if (!gSwapAfterFchmod.first.empty()) {
-        rename(gSwapAfterFchmod.first.c_str(), gSwapAfterFchmod.second.c_str());
-        gSwapAfterFchmod = {};
+extern "C" int chmod(const char *path, mode_t mode) {
+    const int rc = static_cast<int>(syscall(SYS_fchmodat, AT_FDCWD, path, mode));
+    if (!gSwapAfterChmod.first.empty()) {
+        rename(gSwapAfterChmod.first.c_str(), gSwapAfterChmod.second.c_str());
+        gSwapAfterChmod = {};
     }
     return rc;
 }
@@ -91,8 +92,8 @@ TEST_F(DatabaseTest, CreatesFoldersFileAndTablesAndRestoresTheMode) {
     EXPECT_NE(sql[0][0].find("ASC, \t\t\t\t\t\t ctime"), std::string::npos) << sql[0][0];
     EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
 
-    // Opening again keeps the rows and sets the mode back.
-    ASSERT_EQ(chmod(path.c_str(), 0644), 0);
+    // Opening again keeps the rows and sets the mode back, even one that allows no reading.
+    ASSERT_EQ(chmod(path.c_str(), 0), 0);
     DbPtr db = Open();
     EXPECT_EQ(ModeOf(path), 0600u);
     EXPECT_EQ(RawQuery(path, "SELECT host FROM credentials;"), (std::vector<Row>{{"a.example"}}));
@@ -547,9 +548,9 @@ TEST_F(DatabaseTest, FileSwappedInBeforeSQLiteOpensIsRefused) {
     { DbPtr db = Open(); }
     const std::string impostor = db_.dir().File("impostor");
     ASSERT_TRUE(WriteFile(impostor, "", 0644));
-    gSwapAfterFchmod = {impostor, DbPath()};
+    gSwapAfterChmod = {impostor, DbPath()};
     EXPECT_EQ(KOVACredDBInit(), nullptr);
-    EXPECT_TRUE(gSwapAfterFchmod.first.empty()) << "the library set no mode";
+    EXPECT_TRUE(gSwapAfterChmod.first.empty()) << "the library set no mode";
     EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_OPEN, "cred_db", 169));
     EXPECT_EQ(kova_test::LogRecords(),
               (std::vector<std::string>{"cred_db:167 " + DbPath() +
