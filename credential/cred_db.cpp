@@ -311,12 +311,16 @@ sqlite3 *KOVACredDBInit(void) {
     if (opened && !S_ISREG(st.st_mode)) {
         return Refuse(path, S_ISLNK(st.st_mode) ? "is a symbolic link" : "is not a regular file");
     }
-    // fchmod does not take an O_PATH descriptor; its /proc name leads to that file and no other.
-    char held[64];
-    snprintf(held, sizeof(held), "/proc/self/fd/%d", file.get());
-    if (!opened || chmod(held, 0600) != 0) {
+    int modeError = opened ? 0 : errno;
+    if (opened) {
+        // fchmod does not take an O_PATH descriptor; its /proc name leads to that file only.
+        char held[64];
+        snprintf(held, sizeof(held), "/proc/self/fd/%d", file.get());
+        modeError = chmod(held, 0600) == 0 ? 0 : errno;
+    }
+    if (modeError != 0) {
         kova::Log("%s:%d %s chmod failed. errno=[0x%04X]", kUnit, kLineChmodFailed, path.c_str(),
-                  errno);
+                  modeError);
     }
     sqlite3 *raw = nullptr;
     // The file exists by now, so SQLite is not asked to create one (it would not set the mode).
