@@ -1,12 +1,16 @@
 // The credential database: opening it (file, mode, schema), the lock retry every statement
 // runs under, and the record-level operations on an open connection.
 #include <errno.h>
+#include <fcntl.h>
+#include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
 #include <time.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <memory>
 #include <string>
 
 #include "credential/cred_internal.h"
@@ -22,6 +26,7 @@ constexpr const char kUnit[] = "cred_db";
 
 // Lines that the messages of this unit carry.
 constexpr int kLineChmodFailed = 165;
+constexpr int kLineRefused = 167;
 constexpr int kLineOpenError = 169;
 constexpr int kLineOpenLog = 170;
 constexpr int kLinePragma = 174;
@@ -94,10 +99,122 @@ constexpr const char kSessDelete[] = "DELETE FROM credential_sessions WHERE id=%
 
 constexpr const char kLockedMessage[] = "database is locked";
 
-bool gRandSeeded = false;
+// What the log shows in place of a password, session id or token.
+constexpr const char kRedacted[] = "***";
+
+// The process that seeded rand(): a forked child sees another pid and seeds again.
+std::atomic<pid_t> gSeededPid{0};
 
 long Now() {
     return static_cast<long>(time(nullptr));
+}
+
+// The statements that carry secrets are formatted by one function each, once with the
+// secret values for SQLite and once more with kRedacted in their place for the log.
+SqlText FormatCredInsert(const KOVA_CRED &cred, long now, const char *passwd) {
+    return SqlText(sqlite3_mprintf(
+        kCredInsert, now, now, cred.host.c_str(), static_cast<long>(cred.owner),
+        cred.remote_account.c_str(), passwd, static_cast<long>(cred.port), cred.protocol.c_str(),
+        cred.application.c_str(), cred.extra_info.c_str(), static_cast<long>(getpid())));
+}
+
+SqlText FormatCredUpdate(long id, const KOVA_CRED &cred, long now, const char *passwd) {
+    return SqlText(sqlite3_mprintf(kCredUpdate, now, cred.host.c_str(),
+                                   static_cast<long>(cred.owner), cred.remote_account.c_str(),
+                                   passwd, static_cast<long>(cred.port), cred.protocol.c_str(),
+                                   cred.application.c_str(), cred.extra_info.c_str(), id));
+}
+
+SqlText FormatCredUpdateCheck(long id, const KOVA_CRED &cred, long now, const char *passwd) {
+    return SqlText(sqlite3_mprintf(kCredUpdateCheck, id, now, cred.host.c_str(),
+                                   static_cast<long>(cred.owner), cred.remote_account.c_str(),
+                                   passwd, static_cast<long>(cred.port), cred.protocol.c_str(),
+                                   cred.application.c_str(), cred.extra_info.c_str()));
+}
+
+SqlText FormatSessInsert(const KOVA_CRED_SESS &sess, long now, const char *sid, const char *token) {
+    return SqlText(sqlite3_mprintf(kSessInsert, now, sid, token, sess.extra_info.c_str()));
+}
+
+SqlText FormatSessReplace(long id, const KOVA_CRED_SESS &sess, long now, const char *sid,
+                          const char *token) {
+    return SqlText(sqlite3_mprintf(kSessReplace, id, now, sid, token, sess.extra_info.c_str()));
+}
+
+SqlText FormatSessUpdateCheck(long id, const KOVA_CRED_SESS &sess, const char *sid,
+                              const char *token) {
+    return SqlText(sqlite3_mprintf(kSessUpdateCheck, id, sid, token, sess.extra_info.c_str()));
+}
+
+const char *Text(const char *sql) {
+    return sql;
+}
+const char *Text(const SqlText &sql) {
+    return sql ? sql.get() : "";
+}
+
+// ExecWithRetry that logs a lasting failure as "<unit>:<line> Exec sql:[<text>] error: <msg>",
+// where the text is what logText() returns (made only when there is something to log).
+template <typename LogText>
+bool ExecLoggedAs(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg, int line,
+                  LogText logText) {
+    SqlText message;
+    const ExecResult result = ExecWithRetry(db, sql, callback, arg, &message);
+    if (result == ExecResult::kFailed) {
+        const auto shown = logText();
+        Log("%s:%d Exec sql:[%s] error: %s\n", kUnit, line, Text(shown), message.get());
+    }
+    return result == ExecResult::kOk;
+}
+
+// For statements without a secret: the log shows the statement itself.
+bool ExecLogged(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg, int line) {
+    return ExecLoggedAs(db, sql, callback, arg, line, [sql] { return sql; });
+}
+
+// An open file descriptor, closed when the owner goes.
+class FileDescriptor {
+  public:
+    explicit FileDescriptor(int fd) : fd_(fd) {}
+    ~FileDescriptor() {
+        if (fd_ >= 0) {
+            close(fd_);
+        }
+    }
+    FileDescriptor(const FileDescriptor &) = delete;
+    FileDescriptor &operator=(const FileDescriptor &) = delete;
+    int get() const { return fd_; }
+
+  private:
+    int fd_;
+};
+
+struct FreeDeleter {
+    void operator()(char *p) const { free(p); }
+};
+
+// The path with its folder resolved to a path free of symbolic links (SQLite's NOFOLLOW open
+// refuses a link anywhere in the path, while a linked folder is a normal set-up); the path
+// as it is when the folder cannot be resolved.
+std::string ResolveFolder(const std::string &path) {
+    const size_t slash = path.rfind('/');
+    if (slash == std::string::npos || slash + 1 == path.size()) {
+        return path;
+    }
+    std::unique_ptr<char, FreeDeleter> folder(
+        realpath(slash == 0 ? "/" : path.substr(0, slash).c_str(), nullptr));
+    if (!folder) {
+        return path;
+    }
+    return std::string(folder.get()) + (folder.get()[1] == '\0' ? "" : "/") +
+           path.substr(slash + 1);
+}
+
+// Refuses to open the database file: logs why and fails as a failed open does.
+sqlite3 *Refuse(const std::string &path, const char *why) {
+    Log("%s:%d %s %s, not opened.\n", kUnit, kLineRefused, path.c_str(), why);
+    VLIBCErrSetEx(KOVA_ERR_DB_OPEN, kUnit, kLineOpenError);
+    return nullptr;
 }
 
 // The list statement: the base text, the condition and ordering parts (each left as an
@@ -153,21 +270,6 @@ ExecResult ExecWithRetry(sqlite3 *db, const char *sql, sqlite3_callback callback
     }
 }
 
-bool ExecLogged(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg,
-                const char *unit, int line) {
-    SqlText message;
-    switch (ExecWithRetry(db, sql, callback, arg, &message)) {
-        case ExecResult::kOk:
-            return true;
-        case ExecResult::kFailed:
-            Log("%s:%d Exec sql:[%s] error: %s\n", unit, line, sql, message.get());
-            return false;
-        case ExecResult::kFailedSilently:
-            break;
-    }
-    return false;
-}
-
 }  // namespace cred
 }  // namespace kova
 
@@ -175,42 +277,72 @@ using kova::ArgInvalid;
 using namespace kova::cred;
 
 void KOVACredRandInit(void) {
-    if (!gRandSeeded) {
-        srand(static_cast<unsigned>(time(nullptr) + getpid()));
-        gRandSeeded = true;
+    // Threads that meet a stale flag at once all seed with the same value, which is harmless;
+    // the flag itself is atomic, and a lock here could be inherited held by a forked child.
+    const pid_t pid = getpid();
+    if (gSeededPid.load(std::memory_order_acquire) != pid) {
+        srand(static_cast<unsigned>(time(nullptr) + pid));
+        gSeededPid.store(pid, std::memory_order_release);
     }
 }
 
 sqlite3 *KOVACredDBInit(void) {
     KOVACredRandInit();
     std::string path;
+    std::string resolved;
     try {
         path = DatabasePath();
+        // A failed touch shows up below: setting the mode and the open fail on a missing file.
+        if (access(path.c_str(), F_OK) != 0) {
+            VLIBCFileTouch(path.c_str());
+        }
+        resolved = ResolveFolder(path);
     } catch (const std::bad_alloc &) {
         VLIBCErrSetEx(KOVA_ERR_OUT_OF_MEMORY, kUnit, kLineOpenError);
         return nullptr;
     }
-    // A failed touch shows up below: chmod and the open fail on a missing file.
-    if (access(path.c_str(), F_OK) != 0) {
-        VLIBCFileTouch(path.c_str());
+    // Only a regular file is opened, and its mode is set on the file a descriptor holds, so that
+    // whoever names the path cannot have another file changed. O_PATH with O_NOFOLLOW holds a
+    // link itself rather than its target, opens a FIFO or device without touching it, and needs
+    // no read permission, so a file whose mode lost its read bits is still set back to 0600.
+    struct stat st;
+    FileDescriptor file(open(resolved.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    const bool opened = file.get() >= 0 && fstat(file.get(), &st) == 0;
+    if (opened && !S_ISREG(st.st_mode)) {
+        return Refuse(path, S_ISLNK(st.st_mode) ? "is a symbolic link" : "is not a regular file");
     }
-    if (chmod(path.c_str(), 0600) != 0) {
+    int modeError = opened ? 0 : errno;
+    if (opened) {
+        // fchmod does not take an O_PATH descriptor; its /proc name leads to that file only.
+        char held[64];
+        snprintf(held, sizeof(held), "/proc/self/fd/%d", file.get());
+        modeError = chmod(held, 0600) == 0 ? 0 : errno;
+    }
+    if (modeError != 0) {
         kova::Log("%s:%d %s chmod failed. errno=[0x%04X]", kUnit, kLineChmodFailed, path.c_str(),
-                  errno);
+                  modeError);
     }
     sqlite3 *raw = nullptr;
-    if (sqlite3_open(path.c_str(), &raw) != SQLITE_OK) {
+    // The file exists by now, so SQLite is not asked to create one (it would not set the mode).
+    if (sqlite3_open_v2(resolved.c_str(), &raw, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOFOLLOW,
+                        nullptr) != SQLITE_OK) {
         VLIBCErrSetEx(KOVA_ERR_DB_OPEN, kUnit, kLineOpenError);
         kova::Log("%s:%d Can't open database: %s\n", kUnit, kLineOpenLog, sqlite3_errmsg(raw));
         sqlite3_close(raw);
         return nullptr;
     }
     Database db(raw);
+    // The file SQLite opened must be the one whose mode was set, not one swapped in since.
+    struct stat now;
+    if (opened && (lstat(resolved.c_str(), &now) != 0 || now.st_dev != st.st_dev ||
+                   now.st_ino != st.st_ino)) {
+        return Refuse(path, "was replaced while being opened");
+    }
     // SQLite reads the file only at the first statement, so a file that is not a database
     // fails here rather than at the open.
-    if (!ExecLogged(db.get(), kPragmaForeignKeys, nullptr, nullptr, kUnit, kLinePragma) ||
-        !ExecLogged(db.get(), kCredSchema, nullptr, nullptr, kUnit, kLineCredSchema) ||
-        !ExecLogged(db.get(), kSessSchema, nullptr, nullptr, kUnit, kLineSessSchema)) {
+    if (!ExecLogged(db.get(), kPragmaForeignKeys, nullptr, nullptr, kLinePragma) ||
+        !ExecLogged(db.get(), kCredSchema, nullptr, nullptr, kLineCredSchema) ||
+        !ExecLogged(db.get(), kSessSchema, nullptr, nullptr, kLineSessSchema)) {
         return nullptr;
     }
     return db.release();
@@ -224,12 +356,9 @@ int KOVACredDBRecordAdd(sqlite3 *db, const KOVA_CRED *pCred, int *pId) {
         return ArgInvalid(kUnit, kLineAddArg, "NULL != pCred");
     }
     const long now = Now();
-    SqlText sql(sqlite3_mprintf(kCredInsert, now, now, pCred->host.c_str(),
-                                static_cast<long>(pCred->owner), pCred->remote_account.c_str(),
-                                pCred->remote_passwd.c_str(), static_cast<long>(pCred->port),
-                                pCred->protocol.c_str(), pCred->application.c_str(),
-                                pCred->extra_info.c_str(), static_cast<long>(getpid())));
-    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineAddExec)) {
+    SqlText sql = FormatCredInsert(*pCred, now, pCred->remote_passwd.c_str());
+    if (!sql || !ExecLoggedAs(db, sql.get(), nullptr, nullptr, kLineAddExec,
+                              [&] { return FormatCredInsert(*pCred, now, kRedacted); })) {
         return -1;
     }
     if (pId != nullptr) {
@@ -246,7 +375,7 @@ int KOVACredDBRecordGet(sqlite3 *db, long id, KOVA_CRED *pCred) {
         return ArgInvalid(kUnit, kLineGetArg, "NULL != pCred");
     }
     SqlText sql(sqlite3_mprintf(kCredSelectById, id));
-    if (!sql || !ExecLogged(db, sql.get(), CredRowFirst, pCred, kUnit, kLineGetExec)) {
+    if (!sql || !ExecLogged(db, sql.get(), CredRowFirst, pCred, kLineGetExec)) {
         return -1;
     }
     return pCred->filled != 0 ? 1 : 0;
@@ -262,7 +391,7 @@ KOVA_CRED *KOVACredDBRecordGetList(sqlite3 *db, const char *szCondition, const c
         FormatListStatement(kCredSelectAll, " WHERE %q", szCondition, szOrderBy, blAscending);
     KOVA_CRED *head = nullptr;
     if (sql) {
-        ExecLogged(db, sql.get(), CredRowAppend, &head, kUnit, kLineGetListExec);
+        ExecLogged(db, sql.get(), CredRowAppend, &head, kLineGetListExec);
     }
     return head;
 }
@@ -275,24 +404,20 @@ int KOVACredDBRecordUpdate(sqlite3 *db, long id, const KOVA_CRED *pCred) {
         return ArgInvalid(kUnit, kLineUpdateArg, "NULL != pCred");
     }
     const long now = Now();
-    SqlText sql(sqlite3_mprintf(
-        kCredUpdate, now, pCred->host.c_str(), static_cast<long>(pCred->owner),
-        pCred->remote_account.c_str(), pCred->remote_passwd.c_str(), static_cast<long>(pCred->port),
-        pCred->protocol.c_str(), pCred->application.c_str(), pCred->extra_info.c_str(), id));
-    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineUpdateExec)) {
+    SqlText sql = FormatCredUpdate(id, *pCred, now, pCred->remote_passwd.c_str());
+    if (!sql || !ExecLoggedAs(db, sql.get(), nullptr, nullptr, kLineUpdateExec,
+                              [&] { return FormatCredUpdate(id, *pCred, now, kRedacted); })) {
         return -1;
     }
     // The write is verified by finding exactly what was written, mtime included.
-    SqlText check(sqlite3_mprintf(
-        kCredUpdateCheck, id, now, pCred->host.c_str(), static_cast<long>(pCred->owner),
-        pCred->remote_account.c_str(), pCred->remote_passwd.c_str(), static_cast<long>(pCred->port),
-        pCred->protocol.c_str(), pCred->application.c_str(), pCred->extra_info.c_str()));
+    SqlText check = FormatCredUpdateCheck(id, *pCred, now, pCred->remote_passwd.c_str());
     if (!check) {
         return -1;
     }
     KOVA_CRED scratch;
     // A check that could not run is logged; only a check that ran and found nothing fails.
-    if (ExecLogged(db, check.get(), CredRowFirst, &scratch, kUnit, kLineUpdateCheckExec) &&
+    if (ExecLoggedAs(db, check.get(), CredRowFirst, &scratch, kLineUpdateCheckExec,
+                     [&] { return FormatCredUpdateCheck(id, *pCred, now, kRedacted); }) &&
         scratch.filled == 0) {
         VLIBCErrSetEx(KOVA_ERR_DB_READBACK, kUnit, kLineUpdateReadBack);
         return -1;
@@ -307,7 +432,7 @@ int KOVACredDBRecordRemove(sqlite3 *db, long id) {
     // With foreign keys on, a credential that still has a session cannot be deleted.
     KOVACredSessDBRecordRemove(db, id);
     SqlText sql(sqlite3_mprintf(kCredDelete, id));
-    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineRemoveExec)) {
+    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kLineRemoveExec)) {
         return -1;
     }
     return 0;
@@ -320,9 +445,12 @@ int KOVACredSessDBRecordAdd(sqlite3 *db, const KOVA_CRED_SESS *pSess, int *pId) 
     if (pSess == nullptr) {
         return ArgInvalid(kUnit, kLineSessAddArg, "NULL != pSess");
     }
-    SqlText sql(sqlite3_mprintf(kSessInsert, Now(), pSess->access_token.c_str(),
-                                pSess->csrf_token.c_str(), pSess->extra_info.c_str()));
-    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineSessAddExec)) {
+    const long now = Now();
+    SqlText sql =
+        FormatSessInsert(*pSess, now, pSess->access_token.c_str(), pSess->csrf_token.c_str());
+    if (!sql || !ExecLoggedAs(db, sql.get(), nullptr, nullptr, kLineSessAddExec, [&] {
+            return FormatSessInsert(*pSess, now, kRedacted, kRedacted);
+        })) {
         return -1;
     }
     if (pId != nullptr) {
@@ -339,7 +467,7 @@ int KOVACredSessDBRecordGet(sqlite3 *db, long id, KOVA_CRED_SESS *pSess) {
         return ArgInvalid(kUnit, kLineSessGetArg, "NULL != pSess");
     }
     SqlText sql(sqlite3_mprintf(kSessSelectById, id));
-    if (!sql || !ExecLogged(db, sql.get(), CredSessRowFirst, pSess, kUnit, kLineSessGetExec)) {
+    if (!sql || !ExecLogged(db, sql.get(), CredSessRowFirst, pSess, kLineSessGetExec)) {
         return -1;
     }
     return pSess->filled != 0 ? 1 : 0;
@@ -355,7 +483,7 @@ KOVA_CRED_SESS *KOVACredSessDBRecordGetList(sqlite3 *db, const char *szCondition
         FormatListStatement(kSessSelectAll, " WHERE %q ", szCondition, szOrderBy, blAscending);
     KOVA_CRED_SESS *head = nullptr;
     if (sql) {
-        ExecLogged(db, sql.get(), CredSessRowAppend, &head, kUnit, kLineSessGetListExec);
+        ExecLogged(db, sql.get(), CredSessRowAppend, &head, kLineSessGetListExec);
     }
     return head;
 }
@@ -367,18 +495,22 @@ int KOVACredSessDBRecordUpdate(sqlite3 *db, long id, const KOVA_CRED_SESS *pSess
     if (pSess == nullptr) {
         return ArgInvalid(kUnit, kLineSessUpdateArg, "NULL != pSess");
     }
-    SqlText sql(sqlite3_mprintf(kSessReplace, id, Now(), pSess->access_token.c_str(),
-                                pSess->csrf_token.c_str(), pSess->extra_info.c_str()));
-    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineSessUpdateExec)) {
+    const long now = Now();
+    SqlText sql =
+        FormatSessReplace(id, *pSess, now, pSess->access_token.c_str(), pSess->csrf_token.c_str());
+    if (!sql || !ExecLoggedAs(db, sql.get(), nullptr, nullptr, kLineSessUpdateExec, [&] {
+            return FormatSessReplace(id, *pSess, now, kRedacted, kRedacted);
+        })) {
         return -1;
     }
-    SqlText check(sqlite3_mprintf(kSessUpdateCheck, id, pSess->access_token.c_str(),
-                                  pSess->csrf_token.c_str(), pSess->extra_info.c_str()));
+    SqlText check =
+        FormatSessUpdateCheck(id, *pSess, pSess->access_token.c_str(), pSess->csrf_token.c_str());
     if (!check) {
         return -1;
     }
     KOVA_CRED_SESS scratch;
-    if (ExecLogged(db, check.get(), CredSessRowFirst, &scratch, kUnit, kLineSessUpdateCheckExec) &&
+    if (ExecLoggedAs(db, check.get(), CredSessRowFirst, &scratch, kLineSessUpdateCheckExec,
+                     [&] { return FormatSessUpdateCheck(id, *pSess, kRedacted, kRedacted); }) &&
         scratch.filled == 0) {
         VLIBCErrSetEx(KOVA_ERR_DB_READBACK, kUnit, kLineSessUpdateReadBack);
         return -1;
@@ -391,7 +523,7 @@ int KOVACredSessDBRecordRemove(sqlite3 *db, long id) {
         return ArgInvalid(kUnit, kLineSessRemoveArg, "__null != db");
     }
     SqlText sql(sqlite3_mprintf(kSessDelete, id));
-    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kUnit, kLineSessRemoveExec)) {
+    if (!sql || !ExecLogged(db, sql.get(), nullptr, nullptr, kLineSessRemoveExec)) {
         return -1;
     }
     return 0;

@@ -59,11 +59,6 @@ enum class ExecResult {
 ExecResult ExecWithRetry(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg,
                          SqlText *errorMessage);
 
-// ExecWithRetry that logs a lasting failure as "<unit>:<line> Exec sql:[<sql>] error: <msg>".
-// Returns true on success.
-bool ExecLogged(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg,
-                const char *unit, int line);
-
 // Opens the database as KOVACredDBInit does, owning the connection.
 inline Database OpenDatabase() {
     return Database(KOVACredDBInit());

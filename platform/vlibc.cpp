@@ -88,7 +88,9 @@ int VLIBCFileTouch(const char *path) {
     if (MakeParents(path) != 0) {
         return -1;
     }
-    int fd = open(path, O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+    // Never through a link (a dangling one would create its target), and never waiting on a
+    // FIFO that has no reader.
+    int fd = open(path, O_WRONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC, 0600);
     if (fd < 0) {
         return -1;
     }

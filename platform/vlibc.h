@@ -10,7 +10,8 @@
 
 // Creates `path` as an empty regular file (mode 0600 before the caller's chmod) when it does
 // not exist, creating missing parent folders with mode 0700 first. An existing file is left
-// as it is. Returns 0 on success, -1 with errno set on failure.
+// as it is. A symbolic link as the last component is never followed: the call fails with
+// ELOOP, also when the link dangles. Returns 0 on success, -1 with errno set on failure.
 int VLIBCFileTouch(const char *path);
 
 // Standard Base64 (RFC 4648 alphabet, '=' padding, no line breaks) of inLen bytes into `out`,

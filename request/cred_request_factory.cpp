@@ -222,7 +222,8 @@ bool CredRequestPrivate::buildCredByURL(const std::string &url) {
         std::string host;
         std::string port;
         if (!CredRequestUtil::ParseURL(url, protocol, host, port)) {
-            kova::Log("%s:%d parseURL Failed: %s", kUnit, kLineBuildParse, url.c_str());
+            kova::Log("%s:%d parseURL Failed: %s", kUnit, kLineBuildParse,
+                      kova::UrlForLog(url).c_str());
             error = CRED_REQ_ERR_LOGIN_PARAM;
             return false;
         }

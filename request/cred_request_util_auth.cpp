@@ -141,7 +141,7 @@ bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
         std::string port;
         if (!ParseURL(target, scheme, host, port)) {
             kova::Log("%s:%d Can not identify 302 Location: %s.", kUnit, kLineRedirBadLocation,
-                      target.c_str());
+                      kova::UrlForLog(target).c_str());
             return false;
         }
         cred->protocol = scheme;

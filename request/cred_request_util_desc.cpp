@@ -116,7 +116,8 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
         request.SetEncoding(true);
         if (!request.Process(true, 0)) {
             kova::Log("%s:%d Cred Error:[%s][%d]", kUnit, kLineDescCredError,
-                      request.GetURL().c_str(), static_cast<int>(request.GetError()));
+                      kova::UrlForLog(request.GetURL()).c_str(),
+                      static_cast<int>(request.GetError()));
             m_errCode = CRED_REQ_ERR_QUERY_FAIL;
             return false;
         }

@@ -99,15 +99,16 @@ bool CredRequestUtil::TestURL(const std::string &url) {
     try {
         CredRequest request;
         if (!request.SetURL(url)) {
-            kova::Log("%s:%d SetURL failed. %s", kUnit, kLineTestSetUrl, url.c_str());
+            kova::Log("%s:%d SetURL failed. %s", kUnit, kLineTestSetUrl,
+                      kova::UrlForLog(url).c_str());
             return false;
         }
         request.SetDefaultTimeout(kProbeTimeout);
         if (request.Process(true, 0)) {
             return true;
         }
-        kova::Log("%s:%d Cred Error:[%s][%d]", kUnit, kLineTestFailed, request.GetURL().c_str(),
-                  static_cast<int>(request.GetError()));
+        kova::Log("%s:%d Cred Error:[%s][%d]", kUnit, kLineTestFailed,
+                  kova::UrlForLog(request.GetURL()).c_str(), static_cast<int>(request.GetError()));
         m_errCode = CRED_REQ_ERR_QUERY_FAIL;
         return false;
     } catch (...) {

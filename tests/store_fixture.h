@@ -7,6 +7,8 @@
 #include <sqlite3.h>
 
 #include <stdio.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <functional>
 #include <memory>
@@ -178,6 +180,28 @@ inline void ExpectFailuresLogged(const std::vector<FailureCase> &cases,
         EXPECT_EQ(c.call(), -1);
         EXPECT_EQ(LogCountPrefix(c.record + suffix), 1u) << kova_test::LogDump();
     }
+}
+
+// Runs `body` in a forked child that an alarm ends after `seconds`, so that a crash or a hang
+// fails one test. The child's expectations print as usual; returns 0 when none failed, else
+// its exit status or 128 + the signal that ended it.
+template <typename Body>
+int RunInChild(Body body, unsigned seconds = 60) {
+    fflush(nullptr);
+    const pid_t pid = fork();
+    if (pid == 0) {
+        alarm(seconds);
+        kova_test::ClearLog();
+        VLIBCErrSetEx(0, "", 0);
+        body();
+        fflush(nullptr);
+        _exit(::testing::Test::HasFailure() ? 1 : 0);
+    }
+    int status = 0;
+    if (pid < 0 || waitpid(pid, &status, 0) != pid) {
+        return -1;
+    }
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
 // A clean log and error slot for every test.

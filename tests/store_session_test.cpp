@@ -99,10 +99,6 @@ TEST_F(SessionTest, LoadClearsOrReads) {
 
     EXPECT_EQ(KOVACredSessLoad(id, sess.get()), 0);
     EXPECT_EQ(sess->access_token, "sid");
-    // A filled record is not overwritten by another load.
-    ASSERT_EQ(KOVACredSessSetByID(id, MakeSess(id, "sid-2", "tok-2").get()), 0);
-    EXPECT_EQ(KOVACredSessLoad(id, sess.get()), 0);
-    EXPECT_EQ(sess->access_token, "sid");
     sess->next = KOVACredSessAlloc();
     EXPECT_EQ(KOVACredSessLoad(-1, sess.get()), 0);
     EXPECT_EQ(sess->next, nullptr);
@@ -141,16 +137,6 @@ TEST_F(SessionTest, ListRemoveAndNext) {
 
     EXPECT_EQ(KOVACredSessListGet(nullptr, nullptr, nullptr), -1);
     EXPECT_TRUE(ArgErrorReported("cred_sess_list", 14, "__null != pSessList"));
-}
-
-TEST_F(SessionTest, RemovingTheCredentialRemovesItsSession) {
-    int id = AddCred("h");
-    ASSERT_EQ(KOVACredSessSetByID(id, MakeSess(id, "sid", "tok").get()), 0);
-    EXPECT_EQ(KOVACredRemoveByID(id), 0);
-    SessPtr sess = NewSess();
-    EXPECT_EQ(KOVACredSessGetByID(id, sess.get()), 0);
-    EXPECT_EQ(sess->id, -1);
-    EXPECT_TRUE(Query("SELECT * FROM credential_sessions;").empty());
 }
 
 TEST_F(SessionTest, ArgumentAndOpenErrors) {

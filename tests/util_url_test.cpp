@@ -106,6 +106,14 @@ TEST(TestURL, AnsweringServerAndFailures) {
     EXPECT_TRUE(kova_test::LogHas("cred_request_util:"));
     EXPECT_TRUE(kova_test::LogHas("Cred Error:[" + server.BaseUrl() + "/missing][14]"))
         << kova_test::LogDump();
+    // A password in the URL stays out of the log.
+    std::string withPassword = server.BaseUrl() + "/missing";
+    withPassword.insert(withPassword.find("://") + 3, "probe:S3cret@");
+    EXPECT_FALSE(CredRequestUtil::TestURL(withPassword));
+    EXPECT_TRUE(kova_test::LogHas("Cred Error:[http://probe:***@" + server.BaseUrl().substr(7) +
+                                  "/missing][14]"))
+        << kova_test::LogDump();
+    EXPECT_FALSE(kova_test::LogHas("S3cret"));
 
     CredRequestUtil::m_errCode = 0;
     EXPECT_FALSE(CredRequestUtil::TestURL(""));

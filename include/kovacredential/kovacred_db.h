@@ -14,12 +14,15 @@
 
 struct sqlite3;
 
-// Seeds rand() once per process with time(NULL) + getpid().
+// Seeds rand() once per process with time(NULL) + getpid(); a forked child seeds again on its
+// first call. Safe to call from several threads at once.
 KOVA_EXPORT void KOVACredRandInit(void);
 
 // Opens the database (creating the file, its missing folders and both tables), sets mode 0600
-// and turns foreign keys on. Null on failure (error 2304 when SQLite cannot open it).
-// The caller closes the connection with sqlite3_close.
+// and turns foreign keys on. Null on failure: error 2304 when SQLite cannot open it, and also
+// when the path names a symbolic link or anything but a regular file (logged with the reason;
+// the mode of a link's target is never changed). The caller closes the connection with
+// sqlite3_close.
 KOVA_EXPORT sqlite3 *KOVACredDBInit(void);
 
 // Inserts the record; stores the new row id in *pId when pId is not null.

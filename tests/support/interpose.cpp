@@ -18,6 +18,7 @@ std::vector<std::string> gRecords;
 std::vector<unsigned> gUsleeps;
 std::vector<unsigned> gSleeps;
 std::atomic<bool> gFakeSleep{false};
+std::atomic<unsigned> gSleepDivisor{1};
 
 void Capture(const char *fmt, va_list ap) {
     int saved = errno;
@@ -33,6 +34,7 @@ void Capture(const char *fmt, va_list ap) {
 }
 
 void RealSleep(unsigned long micros) {
+    micros /= gSleepDivisor;
     struct timespec ts;
     ts.tv_sec = static_cast<time_t>(micros / 1000000);
     ts.tv_nsec = static_cast<long>((micros % 1000000) * 1000);
@@ -125,6 +127,10 @@ std::string LogDump() {
 
 void SetFakeSleep(bool on) {
     gFakeSleep = on;
+}
+
+void SetSleepDivisor(unsigned divisor) {
+    gSleepDivisor = divisor == 0 ? 1 : divisor;
 }
 
 std::vector<unsigned> UsleepCalls() {

@@ -22,6 +22,9 @@ std::string LogDump();
 
 // While on, usleep and sleep return at once (they are still recorded).
 void SetFakeSleep(bool on);
+// Real sleeps last 1/divisor of what was asked (1, the default, is the full time); a long run
+// keeps its pauses and their order in less time.
+void SetSleepDivisor(unsigned divisor);
 std::vector<unsigned> UsleepCalls();  // microseconds of each usleep call
 std::vector<unsigned> SleepCalls();   // seconds of each sleep call
 void ClearSleeps();

@@ -9,9 +9,10 @@
 
 namespace kova_test {
 
-TempDir::TempDir() {
-    const char *base = getenv("TMPDIR");
-    std::string tmpl = std::string(base && *base ? base : "/tmp") + "/kovatest.XXXXXX";
+TempDir::TempDir(const std::string &base) {
+    const char *tmp = getenv("TMPDIR");
+    std::string tmpl =
+        (base.empty() ? std::string(tmp && *tmp ? tmp : "/tmp") : base) + "/kovatest.XXXXXX";
     if (mkdtemp(tmpl.data()) == nullptr) {
         throw std::runtime_error("mkdtemp failed");
     }

@@ -11,7 +11,8 @@ namespace kova_test {
 
 class TempDir {
   public:
-    TempDir();
+    // Below `base`, or below $TMPDIR (else /tmp) when base is empty.
+    explicit TempDir(const std::string &base = "");
     ~TempDir();
     TempDir(const TempDir &) = delete;
     TempDir &operator=(const TempDir &) = delete;
