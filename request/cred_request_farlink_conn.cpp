@@ -53,7 +53,6 @@ Json::Value Candidate(const std::string &protocol, const Json::Value &host, int 
 bool CredRequestFarlinkPrivate::ProbeCandidates(const Json::Value &list, bool direct,
                                                 Json::Value &candidate) {
     candidate = Json::Value();
-    const Json::Value expected(serverIdMd5);
     for (const Json::Value &element : list) {
         std::unique_ptr<CredRequest> probe(new (std::nothrow) CredRequest());
         if (!probe) {
@@ -68,9 +67,7 @@ bool CredRequestFarlinkPrivate::ProbeCandidates(const Json::Value &list, bool di
         if (!probe->Process(true, 0)) {
             continue;
         }
-        Json::Value answer;
-        if (kova::JsonFromString(probe->GetResponse(), answer) && answer.isObject() &&
-            answer.isMember("ezid") && answer["ezid"] == expected) {
+        if (IsProbeAnswer(probe->GetResponse())) {
             candidate = element;
             break;
         }
@@ -78,8 +75,19 @@ bool CredRequestFarlinkPrivate::ProbeCandidates(const Json::Value &list, bool di
     return !candidate.empty();
 }
 
+bool CredRequestFarlinkPrivate::IsProbeAnswer(const std::string &text) const {
+    Json::Value answer;
+    return kova::JsonFromString(text, answer) && answer.isObject() && answer.isMember("ezid") &&
+           answer["ezid"] == Json::Value(serverIdMd5);
+}
+
 bool CredRequestFarlinkPrivate::GetAvailableDirectConnInfo(const Json::Value &serverInfo,
                                                            Json::Value &candidate) {
+    Json::Value list;
+    return DirectCandidates(serverInfo, list) && ProbeCandidates(list, true, candidate);
+}
+
+bool CredRequestFarlinkPrivate::DirectCandidates(const Json::Value &serverInfo, Json::Value &list) {
     if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
         return false;
     }
@@ -94,7 +102,7 @@ bool CredRequestFarlinkPrivate::GetAvailableDirectConnInfo(const Json::Value &se
     }
 
     // LAN interfaces in the directory's order, then the external address, then DDNS.
-    Json::Value list(Json::arrayValue);
+    list = Json::Value(Json::arrayValue);
     if (Has(server, "interface") && port > 0 && server["interface"].isArray()) {
         for (const Json::Value &nic : server["interface"]) {
             list.append(
@@ -109,14 +117,17 @@ bool CredRequestFarlinkPrivate::GetAvailableDirectConnInfo(const Json::Value &se
     if (Has(server, "ddns") && extPort > 0) {
         list.append(Candidate(serviceProtocol, server["ddns"], extPort));
     }
-    if (list.empty()) {
-        return false;
-    }
-    return ProbeCandidates(list, true, candidate);
+    return !list.empty();
 }
 
 bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tunnelAnswer,
                                                           Json::Value &candidate) {
+    Json::Value list;
+    return RelayCandidates(tunnelAnswer, list) && ProbeCandidates(list, false, candidate);
+}
+
+bool CredRequestFarlinkPrivate::RelayCandidates(const Json::Value &tunnelAnswer,
+                                                Json::Value &list) {
     if (!Has(tunnelAnswer, "service") || !Has(tunnelAnswer, "server")) {
         return false;
     }
@@ -126,7 +137,7 @@ bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tun
 
     // Relay address, relay host name on the same port, then the relay's HTTPS endpoint, which
     // is always "https" whatever the service protocol.
-    Json::Value list(Json::arrayValue);
+    list = Json::Value(Json::arrayValue);
     if (Has(service, "relay_ip") && Has(service, "relay_port")) {
         const int relayPort = IntMember(service, "relay_port");
         list.append(Candidate(serviceProtocol, service["relay_ip"], relayPort));
@@ -137,10 +148,7 @@ bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tun
     if (Has(service, "https_ip") && Has(service, "https_port")) {
         list.append(Candidate("https", service["https_ip"], IntMember(service, "https_port")));
     }
-    if (list.empty()) {
-        return false;
-    }
-    return ProbeCandidates(list, false, candidate);
+    return !list.empty();
 }
 
 bool CredRequestFarlink::GetAvailableConnInfo(const Json::Value &serverInfo,

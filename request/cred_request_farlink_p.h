@@ -5,6 +5,7 @@
 #define KOVA_REQUEST_CRED_REQUEST_FARLINK_P_H
 
 #include <string>
+#include <vector>
 
 #include <json/value.h>
 
@@ -56,6 +57,12 @@ class CredRequestFarlinkPrivate {
     // {"code": error, "error": detail}; "error" only when the detail is not empty.
     Json::Value GetErrors() const;
 
+    // The most of a response's text an error detail carries: a hostile or broken directory
+    // can send any amount, and the detail is copied again by every GetErrors.
+    static constexpr size_t kResponseDetailLimit = 4096;
+    // `text` as a JSON string, cut to at most kResponseDetailLimit bytes.
+    static Json::Value ResponseDetail(const std::string &text);
+
     // ---- Directory protocol.
     // Whether a directory answer is an object whose "errno" is 0 (a missing one counts as 0).
     static bool IsSuccessAnswer(const Json::Value &answer);
@@ -72,6 +79,17 @@ class CredRequestFarlinkPrivate {
     // ---- Connection candidates.
     bool GetAvailableDirectConnInfo(const Json::Value &serverInfo, Json::Value &candidate);
     bool GetAvailableRelayConnInfo(const Json::Value &tunnelAnswer, Json::Value &candidate);
+    // The direct candidates of server information, in the order they are probed; takes the
+    // answer's server id. False (405 set when it names no port) when there is none.
+    bool DirectCandidates(const Json::Value &serverInfo, Json::Value &list);
+    // The relay candidates of a tunnel answer, in the order they are probed; takes the
+    // answer's server id. False when there is none.
+    bool RelayCandidates(const Json::Value &tunnelAnswer, Json::Value &list);
+    // Whether a probe answer is a JSON object whose "ezid" is the server id MD5.
+    bool IsProbeAnswer(const std::string &text) const;
+    // The directory hosts of a site list answer, in the order they are tried: each entry of
+    // "sites" as text ("" for an array or object). False when "sites" is no array.
+    static bool SiteHosts(const Json::Value &siteList, std::vector<std::string> &hosts);
     // Probes each {"protocol", "host", "port"} of `list` in order with "/webman/pingpong.cgi"
     // and copies the first whose "ezid" is the server id MD5 into `candidate`. Direct probes
     // run with short time-outs; relay probes with the request defaults. Sets no error.
