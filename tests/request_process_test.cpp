@@ -10,6 +10,9 @@
 #include <string>
 
 #include <gtest/gtest.h>
+#include <openssl/pem.h>
+#include <openssl/ssl.h>
+#include <openssl/x509.h>
 
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
@@ -435,13 +438,34 @@ TEST_F(HttpsTest, SelfSignedCertificate) {
     }
 }
 
-TEST_F(HttpsTest, PlainHttpToTlsPortFails) {
-    std::string url = Url();
-    url.replace(0, 5, "http");
-    KOVA::CredRequest req;
-    ASSERT_TRUE(req.SetURL(url));
-    EXPECT_FALSE(req.Process(true, 0));
-    EXPECT_NE(req.GetError(), KOVA::CRED_REQ_ERR_NONE);
+// Adds the certificate (PEM text at `data`) to the trusted ones of the TLS context.
+void TrustCertificate(void *, void *sslCtx, void *data) {
+    const std::string &pem = *static_cast<const std::string *>(data);
+    BIO *bio = BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size()));
+    X509 *cert = PEM_read_bio_X509(bio, nullptr, nullptr, nullptr);
+    X509_STORE_add_cert(SSL_CTX_get_cert_store(static_cast<SSL_CTX *>(sslCtx)), cert);
+    X509_free(cert);
+    BIO_free(bio);
+}
+
+// With its certificate trusted the server still has to match the host name: the certificate
+// names "localhost", so the same server passes under that name and fails under its address.
+TEST_F(HttpsTest, VerificationChecksTheHostName) {
+    const std::string pem = server_->CertificatePem();
+    for (const std::string host : {"localhost", "127.0.0.1"}) {
+        SCOPED_TRACE(host);
+        kova_test::ClearLog();
+        KOVA::CredRequest req;
+        ASSERT_TRUE(req.SetURL("https://" + host + ":" + std::to_string(server_->Port()) + "/ok"));
+        req.SetSSLVerify(TrustCertificate, const_cast<std::string *>(&pem));
+        const bool byName = host == "localhost";
+        EXPECT_EQ(req.Process(true, 0), byName) << kova_test::LogDump();
+        EXPECT_EQ(req.GetResponse(), byName ? "secure" : "");
+        if (!byName) {
+            EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_CURL_OTHER);
+            EXPECT_TRUE(kova_test::LogHas("CURL Error(60)")) << kova_test::LogDump();
+        }
+    }
 }
 
 }  // namespace
