@@ -1,8 +1,8 @@
 // Hostile and broken peers: every fault of the fault server ends Process with its mapped error
 // in bounded time, without a crash and (in the sanitizer build) without a leak; a response held
-// in memory stops at the cap, plain or gzip-encoded, while a response stream takes a 200 MB
-// body in flat memory. Each case runs in a forked child under an alarm, so that a crash or a
-// hang fails that case alone.
+// in memory stops at the cap, plain or gzip-encoded, while a response stream or the caller's
+// writer takes a 200 MB body in flat memory. Each case runs in a forked child under an alarm, so
+// that a crash or a hang fails that case alone.
 #include <errno.h>
 #include <fcntl.h>
 #include <signal.h>
@@ -102,25 +102,35 @@ template <typename Body>
     return ::testing::AssertionSuccess();
 }
 
+// Where a response body goes.
+enum class Sink { kMemory, kStream, kWriter };
+
 // A response stream that only counts what is written to it.
 ssize_t CountWrite(void *cookie, const char *, size_t size) {
     *static_cast<uint64_t *>(cookie) += size;
     return static_cast<ssize_t>(size);
 }
 
-// One request to `url` with its headers collected as JSON, the body to memory or, with
-// `toStream`, to a counting stream.
-Outcome Fetch(const std::string &url, bool toStream) {
+// The caller's own body writer, counting what it receives.
+size_t CountingWriter(char *, size_t size, size_t nmemb, void *user) {
+    *reinterpret_cast<uint64_t *>(user) += size * nmemb;
+    return size * nmemb;
+}
+
+// One request to `url` with its headers collected as JSON and its body sent to `sink`.
+Outcome Fetch(const std::string &url, Sink sink) {
     Outcome outcome;
     uint64_t counted = 0;
     cookie_io_functions_t io = {nullptr, CountWrite, nullptr, nullptr};
-    FILE *stream = toStream ? fopencookie(&counted, "w", io) : nullptr;
+    FILE *stream = sink == Sink::kStream ? fopencookie(&counted, "w", io) : nullptr;
     KOVA::CredRequest request;
     request.SetURL(url + "/webapi/entry.cgi");
     request.SetRespHeaderToJsonValue(true);
     request.SetResponseTimeout(1);  // a silent peer is given up after one second
     if (stream != nullptr) {
         request.SetRespStream(stream);
+    } else if (sink == Sink::kWriter) {
+        request.SetRespStream(reinterpret_cast<FILE *>(&counted), CountingWriter);
     }
     ResetPeakRss();
     const long before = PeakRssKiB();
@@ -131,7 +141,7 @@ Outcome Fetch(const std::string &url, bool toStream) {
     if (stream != nullptr) {
         fclose(stream);
     }
-    outcome.bytes = toStream ? counted : request.GetResponse().size();
+    outcome.bytes = sink == Sink::kMemory ? request.GetResponse().size() : counted;
     outcome.writeErrorLogged = kova_test::LogHas("CURL Error(23)");
     return outcome;
 }
@@ -165,7 +175,7 @@ TEST(HostilePeerTest, EveryFaultEndsWithItsMappedError) {
             30,
             [&] {
                 kovasim::FaultServer server(c.fault);
-                return server.Start() ? Fetch(server.BaseUrl(), false) : Outcome();
+                return server.Start() ? Fetch(server.BaseUrl(), Sink::kMemory) : Outcome();
             },
             &outcome));
         EXPECT_EQ(outcome.ok, c.ok);
@@ -176,20 +186,20 @@ TEST(HostilePeerTest, EveryFaultEndsWithItsMappedError) {
     }
 }
 
-// A 200 MB body reaches a response stream whole in flat memory; held in memory it stops at
-// the cap with libcurl's write error.
+// A 200 MB body reaches a response stream or the caller's writer whole, in flat memory; held
+// in memory it stops at the cap with libcurl's write error.
 TEST(HostilePeerTest, HugeBodyStreamsWholeButStopsAtTheCapInMemory) {
-    for (bool toStream : {true, false}) {
-        SCOPED_TRACE(toStream ? "stream" : "memory");
+    for (Sink sink : {Sink::kStream, Sink::kWriter, Sink::kMemory}) {
+        SCOPED_TRACE(static_cast<int>(sink));
         Outcome outcome;
         ASSERT_TRUE(InChild(
             120,
             [&] {
                 kovasim::FaultServer server(Fault::kHugeBody);
-                return server.Start() ? Fetch(server.BaseUrl(), toStream) : Outcome();
+                return server.Start() ? Fetch(server.BaseUrl(), sink) : Outcome();
             },
             &outcome));
-        if (toStream) {
+        if (sink != Sink::kMemory) {
             EXPECT_TRUE(outcome.ok);
             EXPECT_EQ(outcome.bytes, kovasim::kFaultBodyBytes);
             EXPECT_LT(outcome.rssGrowthKiB, 32 * kMiB);
