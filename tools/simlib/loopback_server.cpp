@@ -409,13 +409,13 @@ void RawServer::Connection::Reset() {
     fd_ = -1;
 }
 
-bool RawServer::Connection::Send(const std::string &bytes) {
+bool RawServer::Connection::Send(const char *data, size_t size) {
     if (fd_ < 0) {
         return false;
     }
     size_t sent = 0;
-    while (sent < bytes.size()) {
-        ssize_t n = send(fd_, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
+    while (sent < size) {
+        ssize_t n = send(fd_, data + sent, size - sent, MSG_NOSIGNAL);
         if (n <= 0) {
             return false;
         }

@@ -116,7 +116,8 @@ class RawServer {
     class Connection {
       public:
         // Writes all bytes; false once the peer has gone.
-        bool Send(const std::string &bytes);
+        bool Send(const std::string &bytes) { return Send(bytes.data(), bytes.size()); }
+        bool Send(const char *data, size_t size);
         // Waits up to `ms` milliseconds; returns early when the server stops.
         void Pause(int ms);
         // Waits up to `ms` milliseconds for the peer to close the connection; true if it did.
