@@ -90,6 +90,7 @@ int main(int argc, char **argv) {
         const std::string input = Mutate(seeds);
         LLVMFuzzerTestOneInput(reinterpret_cast<const uint8_t *>(input.data()), input.size());
     }
-    printf("%zu seeds and %d mutations ran\n", seeds.size(), runs);
+    // On standard error: a target may have pointed standard output elsewhere.
+    fprintf(stderr, "%zu seeds and %d mutations ran\n", seeds.size(), runs);
     return 0;
 }

@@ -56,6 +56,17 @@ bool JsonFromString(const std::string &text, Json::Value &value) {
     return true;
 }
 
+bool JsonFromLenientText(const std::string &text, Json::Value &value, bool collectComments) {
+    try {
+        // A reader keeps per-parse state, so each parse has its own.
+        Json::Reader reader;
+        return reader.parse(text, value, collectComments);
+    } catch (const Json::Exception &) {
+        value = Json::Value();
+        return false;
+    }
+}
+
 std::string JsonToString(const Json::Value &value) {
     std::ostringstream out;
     CompactWriter().write(value, &out);

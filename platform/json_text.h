@@ -13,6 +13,13 @@ namespace kova {
 // trailing garbage or an empty text.
 bool JsonFromString(const std::string &text, Json::Value &value);
 
+// Parses `text` with jsoncpp's lenient reader (Json::Reader: comments allowed, text behind the
+// first value ignored), as the login and encryption answers are read; comments are kept on the
+// value when `collectComments` is set. On a syntax error `value` holds what the reader left in
+// it; a text nested deeper than the reader allows is a failed parse with `value` null, never
+// an exception.
+bool JsonFromLenientText(const std::string &text, Json::Value &value, bool collectComments);
+
 // The compact JSON text of `value` (no white space, UTF-8 kept as it is).
 std::string JsonToString(const Json::Value &value);
 

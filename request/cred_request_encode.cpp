@@ -125,7 +125,6 @@ constexpr int kLineRsaEncStringFail = 157;
 
 bool CredRequestPrivate::GetRSAEncParam(const Json::Value &params, std::string &name,
                                         std::string &value) {
-    Json::Value copy = params;
     const Json::Value &encUrl = GetData("EncURL", "", kNull);
     if (!encUrl.isString()) {
         kova::Log("%s:%d Get encryption url fail", kUnit, kLineRsaNoEncUrl);
@@ -136,6 +135,11 @@ bool CredRequestPrivate::GetRSAEncParam(const Json::Value &params, std::string &
         kova::Log("%s:%d Get encryption information fail", kUnit, kLineRsaNoEncInfo);
         return false;
     }
+    return GetRSAEncParam(params, info, name, value);
+}
+
+bool CredRequestPrivate::GetRSAEncParam(Json::Value copy, const Json::Value &info,
+                                        std::string &name, std::string &value) {
     // The server time travels inside the envelope, under the name the server chose.
     const Json::Value &tokenName = info["ciphertoken"];
     if (copy.isNull()) {

@@ -207,12 +207,24 @@ bool CredRequestFarlinkPrivate::SendFarlinkRequest(const Json::Value &body, Json
         SetError(CRED_REQ_ERR_UNKNOWN, static_cast<int>(request->GetError()));
         return false;
     }
-    std::string text = request->GetResponse();
+    const std::string text = request->GetResponse();
     if (!kova::JsonFromString(text, answer)) {
-        SetError(CRED_REQ_ERR_SERVER_ERRNO, text);
+        SetError(CRED_REQ_ERR_SERVER_ERRNO, ResponseDetail(text));
         return false;
     }
     return true;
+}
+
+Json::Value CredRequestFarlinkPrivate::ResponseDetail(const std::string &text) {
+    size_t length = text.size();
+    if (length > kResponseDetailLimit) {
+        // Cut at a character boundary so that the detail stays valid UTF-8 text.
+        length = kResponseDetailLimit;
+        while (length > 0 && (static_cast<unsigned char>(text[length]) & 0xC0) == 0x80) {
+            --length;
+        }
+    }
+    return Json::Value(text.data(), text.data() + length);
 }
 
 // ---- CredRequestFarlink: the public object owns one implementation object.

@@ -53,18 +53,9 @@ const std::string kRelayHttpsProtocol = "https";
 
 }  // namespace
 
-// One address to probe. The host points into the directory's answer, which outlives the
-// probing; only the address that answers becomes a JSON candidate.
-struct CredRequestFarlinkPrivate::ProbeTarget {
-    const std::string *protocol;
-    const Json::Value *host;
-    int port;
-};
-
 bool CredRequestFarlinkPrivate::ProbeCandidates(const std::vector<ProbeTarget> &targets,
                                                 bool direct, Json::Value &candidate) {
     candidate = Json::Value();
-    const Json::Value expected(serverIdMd5);
     for (const ProbeTarget &target : targets) {
         std::unique_ptr<CredRequest> probe(new (std::nothrow) CredRequest());
         if (!probe) {
@@ -76,12 +67,7 @@ bool CredRequestFarlinkPrivate::ProbeCandidates(const std::vector<ProbeTarget> &
             probe->SetResponseTimeout(kDirectResponseTimeout);
             probe->SetDefaultTimeout(kDirectDefaultTimeout);
         }
-        if (!probe->Process(true, 0)) {
-            continue;
-        }
-        Json::Value answer;
-        if (kova::JsonFromString(probe->GetResponse(), answer) && answer.isObject() &&
-            answer.isMember("ezid") && answer["ezid"] == expected) {
+        if (probe->Process(true, 0) && IsProbeAnswer(probe->GetResponse())) {
             candidate = Candidate(*target.protocol, *target.host, target.port);
             break;
         }
@@ -89,8 +75,21 @@ bool CredRequestFarlinkPrivate::ProbeCandidates(const std::vector<ProbeTarget> &
     return !candidate.empty();
 }
 
+bool CredRequestFarlinkPrivate::IsProbeAnswer(const std::string &text) const {
+    Json::Value answer;
+    return kova::JsonFromString(text, answer) && answer.isObject() && answer.isMember("ezid") &&
+           answer["ezid"] == Json::Value(serverIdMd5);
+}
+
 bool CredRequestFarlinkPrivate::GetAvailableDirectConnInfo(const Json::Value &serverInfo,
                                                            Json::Value &candidate) {
+    std::vector<ProbeTarget> targets;
+    return DirectCandidates(serverInfo, targets) && ProbeCandidates(targets, true, candidate);
+}
+
+bool CredRequestFarlinkPrivate::DirectCandidates(const Json::Value &serverInfo,
+                                                 std::vector<ProbeTarget> &targets) {
+    targets.clear();
     if (!Has(serverInfo, "server") || !Has(serverInfo, "service")) {
         return false;
     }
@@ -105,7 +104,6 @@ bool CredRequestFarlinkPrivate::GetAvailableDirectConnInfo(const Json::Value &se
     }
 
     // LAN interfaces in the directory's order, then the external address, then DDNS.
-    std::vector<ProbeTarget> targets;
     if (Has(server, "interface") && port > 0 && server["interface"].isArray()) {
         for (const Json::Value &nic : server["interface"]) {
             targets.push_back({&serviceProtocol,
@@ -121,14 +119,18 @@ bool CredRequestFarlinkPrivate::GetAvailableDirectConnInfo(const Json::Value &se
     if (Has(server, "ddns") && extPort > 0) {
         targets.push_back({&serviceProtocol, &server["ddns"], extPort});
     }
-    if (targets.empty()) {
-        return false;
-    }
-    return ProbeCandidates(targets, true, candidate);
+    return !targets.empty();
 }
 
 bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tunnelAnswer,
                                                           Json::Value &candidate) {
+    std::vector<ProbeTarget> targets;
+    return RelayCandidates(tunnelAnswer, targets) && ProbeCandidates(targets, false, candidate);
+}
+
+bool CredRequestFarlinkPrivate::RelayCandidates(const Json::Value &tunnelAnswer,
+                                                std::vector<ProbeTarget> &targets) {
+    targets.clear();
     if (!Has(tunnelAnswer, "service") || !Has(tunnelAnswer, "server")) {
         return false;
     }
@@ -138,7 +140,6 @@ bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tun
 
     // Relay address, relay host name on the same port, then the relay's HTTPS endpoint, which
     // is always "https" whatever the service protocol.
-    std::vector<ProbeTarget> targets;
     if (Has(service, "relay_ip") && Has(service, "relay_port")) {
         const int relayPort = IntMember(service, "relay_port");
         targets.push_back({&serviceProtocol, &service["relay_ip"], relayPort});
@@ -150,10 +151,7 @@ bool CredRequestFarlinkPrivate::GetAvailableRelayConnInfo(const Json::Value &tun
         targets.push_back(
             {&kRelayHttpsProtocol, &service["https_ip"], IntMember(service, "https_port")});
     }
-    if (targets.empty()) {
-        return false;
-    }
-    return ProbeCandidates(targets, false, candidate);
+    return !targets.empty();
 }
 
 bool CredRequestFarlink::GetAvailableConnInfo(const Json::Value &serverInfo,

@@ -1,6 +1,8 @@
 // The directory commands of KOVA::CredRequestFarlink: server information, site list (from the
 // global directory host), the first site that knows the server, and the relay tunnel.
 #include <memory>
+#include <string>
+#include <vector>
 
 #include "request/cred_request_farlink_p.h"
 
@@ -92,9 +94,10 @@ bool CredRequestFarlink::GetServerInfo(Json::Value &info) {
                 d->SetError(CRED_REQ_ERR_UNKNOWN, static_cast<int>(request->GetError()));
                 return false;
             }
-            std::string text = request->GetResponse();
+            const std::string text = request->GetResponse();
             if (!d->CheckResponse(text, &info)) {
-                d->SetError(CRED_REQ_ERR_SERVER_ERRNO, text);
+                d->SetError(CRED_REQ_ERR_SERVER_ERRNO,
+                            CredRequestFarlinkPrivate::ResponseDetail(text));
                 return false;
             }
             return true;
@@ -112,32 +115,45 @@ bool CredRequestFarlink::GetSiteList(Json::Value &answer) {
 }
 
 bool CredRequestFarlink::GetAvailableServerInfo(Json::Value &info) {
-    return kova::GuardedOn(
-        kFarlinkGuardUnit, kLineInfoException, d, false, [&](CredRequestFarlinkPrivate &) -> bool {
-            Json::Value list;
-            if (!GetSiteList(list)) {
-                return false;
-            }
-            const Json::Value *sites = list.find("sites", "sites" + 5);
-            if (sites == nullptr || !sites->isArray()) {
-                return false;
-            }
-            info = Json::Value();
-            for (const Json::Value &site : *sites) {
-                // A failing site leaves its error recorded until a later one overwrites it; the
-                // server name stays at the site that answered so that a tunnel goes there too.
-                // Each entry is taken as text (a number or flag as its text); one that has
-                // none (an array or object) leaves no server name, which fails with 22.
-                d->SetServerName(site.isConvertibleTo(Json::stringValue) ? site.asString()
-                                                                         : std::string());
-                Json::Value candidate;
-                if (GetServerInfo(candidate)) {
-                    info.swap(candidate);
-                    break;
-                }
-            }
-            return !info.empty();
-        });
+    return kova::GuardedOn(kFarlinkGuardUnit, kLineInfoException, d, false,
+                           [&](CredRequestFarlinkPrivate &) -> bool {
+                               Json::Value list;
+                               if (!GetSiteList(list)) {
+                                   return false;
+                               }
+                               std::vector<std::string> hosts;
+                               if (!CredRequestFarlinkPrivate::SiteHosts(list, hosts)) {
+                                   return false;
+                               }
+                               info = Json::Value();
+                               for (const std::string &host : hosts) {
+                                   // A failing site leaves its error recorded until a later one
+                                   // overwrites it; the server name stays at the site that answered
+                                   // so that a tunnel goes there too. An entry without text leaves
+                                   // no server name, which fails with 22.
+                                   d->SetServerName(host);
+                                   Json::Value candidate;
+                                   if (GetServerInfo(candidate)) {
+                                       info.swap(candidate);
+                                       break;
+                                   }
+                               }
+                               return !info.empty();
+                           });
+}
+
+bool CredRequestFarlinkPrivate::SiteHosts(const Json::Value &siteList,
+                                          std::vector<std::string> &hosts) {
+    const Json::Value *sites = siteList.isObject() ? siteList.find("sites", "sites" + 5) : nullptr;
+    if (sites == nullptr || !sites->isArray()) {
+        return false;
+    }
+    hosts.clear();
+    for (const Json::Value &site : *sites) {
+        // A number or flag counts as its text.
+        hosts.push_back(site.isConvertibleTo(Json::stringValue) ? site.asString() : std::string());
+    }
+    return true;
 }
 
 bool CredRequestFarlink::RequestTunnel(Json::Value &answer) {

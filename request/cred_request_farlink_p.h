@@ -56,6 +56,11 @@ class CredRequestFarlinkPrivate {
     void SetError(KOVA::_tag_CRED_REQ_ERR code, const Json::Value &detail);
     // {"code": error, "error": detail}; "error" only when the detail is not empty.
     Json::Value GetErrors() const;
+    // The most of a response's text an error detail carries: a hostile or broken directory
+    // can send any amount, and the detail is copied again by every GetErrors.
+    static constexpr size_t kResponseDetailLimit = 4096;
+    // `text` as a JSON string, cut to at most kResponseDetailLimit bytes.
+    static Json::Value ResponseDetail(const std::string &text);
 
     // ---- Directory protocol.
     // Whether a directory answer is an object whose "errno" is 0 (a missing one counts as 0).
@@ -73,10 +78,28 @@ class CredRequestFarlinkPrivate {
     // ---- Connection candidates.
     bool GetAvailableDirectConnInfo(const Json::Value &serverInfo, Json::Value &candidate);
     bool GetAvailableRelayConnInfo(const Json::Value &tunnelAnswer, Json::Value &candidate);
+    // One address to probe. Protocol and host point into the client and the directory's
+    // answer, which outlive the probing; only the address that answers becomes a JSON
+    // candidate {"protocol", "host", "port"}.
+    struct ProbeTarget {
+        const std::string *protocol;
+        const Json::Value *host;
+        int port;
+    };
+    // The direct addresses of server information, in the order they are probed; takes the
+    // answer's server id. False (405 set when it names no port) when there is none.
+    bool DirectCandidates(const Json::Value &serverInfo, std::vector<ProbeTarget> &targets);
+    // The relay addresses of a tunnel answer, in the order they are probed; takes the
+    // answer's server id. False when there is none.
+    bool RelayCandidates(const Json::Value &tunnelAnswer, std::vector<ProbeTarget> &targets);
+    // Whether a probe answer is a JSON object whose "ezid" is the server id MD5.
+    bool IsProbeAnswer(const std::string &text) const;
+    // The directory hosts of a site list answer, in the order they are tried: each entry of
+    // "sites" as text ("" for an array or object). False when "sites" is no array.
+    static bool SiteHosts(const Json::Value &siteList, std::vector<std::string> &hosts);
     // Probes each target in order with "/webman/pingpong.cgi" and makes the first whose
-    // "ezid" is the server id MD5 the {"protocol", "host", "port"} `candidate`. Direct probes
-    // run with short time-outs; relay probes with the request defaults. Sets no error.
-    struct ProbeTarget;
+    // "ezid" is the server id MD5 the `candidate`. Direct probes run with short time-outs;
+    // relay probes with the request defaults. Sets no error.
     bool ProbeCandidates(const std::vector<ProbeTarget> &targets, bool direct,
                          Json::Value &candidate);
 

@@ -49,11 +49,20 @@ class CredRequestPrivate {
     std::string GetParamString(const Json::Value &params);
     Json::Value GetParamJsonObj(const Json::Value &params);
     bool GetRSAEncParam(const Json::Value &params, std::string &name, std::string &value);
+    // The envelope of `params` under the server's encryption information (an object), once
+    // fetched.
+    bool GetRSAEncParam(Json::Value params, const Json::Value &info, std::string &name,
+                        std::string &value);
     bool GetAESEncParam(const Json::Value &params, std::string &textName, std::string &text,
                         std::string &tokenName, std::string &token);
     std::string GetCookies();
 
     // ---- Transfer set-up and callbacks.
+    // The most a response held in memory (the response string) may grow to. No WebAPI or
+    // directory answer comes near it; a server that sends more gets its transfer ended with a
+    // write error, so that it cannot grow the caller without bound. Response streams and the
+    // caller's own writer are not limited.
+    static constexpr size_t kMaxResponseBytes = size_t{64} << 20;
     bool InitCurlHandler();
     static size_t WriteToStrBuf(char *data, size_t size, size_t nmemb, std::string *out);
     static size_t WriteToStream(char *data, size_t size, size_t nmemb, FILE *stream);

@@ -271,6 +271,9 @@ bool CredRequestPrivate::InitCurlHandler() {
 
 size_t CredRequestPrivate::WriteToStrBuf(char *data, size_t size, size_t nmemb, std::string *out) {
     const size_t total = size * nmemb;
+    if (total > kMaxResponseBytes || out->size() > kMaxResponseBytes - total) {
+        return 0;  // past the cap: libcurl ends the transfer with CURLE_WRITE_ERROR
+    }
     try {
         out->append(data, total);
     } catch (...) {

@@ -7,13 +7,12 @@
 #include <exception>
 #include <string>
 
-#include <json/reader.h>
-
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
 #include "kovacredential/kovacred.h"
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
+#include "request/cred_request_util_p.h"
 
 namespace KOVA {
 
@@ -95,6 +94,32 @@ constexpr int kLineRedirNoHeaders = 161;
 constexpr int kLineRedirNoLocation = 166;
 constexpr int kLineRedirBadLocation = 173;
 
+bool ApplyRedirectLocation(KOVA_CRED *cred, const Json::Value &headers) {
+    if (headers.empty()) {
+        kova::Log("%s:%d GetResponseHeader failed", kUnit, kLineRedirNoHeaders);
+        return false;
+    }
+    const Json::Value location = HeaderValue(headers, "Location");
+    if (!location.isString() || location.asString().empty()) {
+        kova::Log("%s:%d Return 302, but no Location in header.", kUnit, kLineRedirNoLocation);
+        return false;
+    }
+    // Parsed as the server sent it.
+    const std::string target = location.asString();
+    std::string scheme;
+    std::string host;
+    std::string port;
+    if (!CredRequestUtil::ParseURL(target, scheme, host, port)) {
+        kova::Log("%s:%d Can not identify 302 Location: %s.", kUnit, kLineRedirBadLocation,
+                  kova::UrlForLog(target).c_str());
+        return false;
+    }
+    cred->protocol = scheme;
+    cred->host = host;
+    cred->port = static_cast<int32_t>(strtol(port.c_str(), nullptr, 10));
+    return true;
+}
+
 bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
     return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         if (cred == nullptr) {
@@ -124,30 +149,7 @@ bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
         if (request.Process(true, 0) || request.GetError() != CRED_REQ_ERR_REDIRECT) {
             return true;
         }
-        const Json::Value &headers = request.GetResponseHeader();
-        if (headers.empty()) {
-            kova::Log("%s:%d GetResponseHeader failed", kUnit, kLineRedirNoHeaders);
-            return false;
-        }
-        const Json::Value location = HeaderValue(headers, "Location");
-        if (!location.isString() || location.asString().empty()) {
-            kova::Log("%s:%d Return 302, but no Location in header.", kUnit, kLineRedirNoLocation);
-            return false;
-        }
-        // Parsed as the server sent it.
-        const std::string target = location.asString();
-        std::string scheme;
-        std::string host;
-        std::string port;
-        if (!ParseURL(target, scheme, host, port)) {
-            kova::Log("%s:%d Can not identify 302 Location: %s.", kUnit, kLineRedirBadLocation,
-                      kova::UrlForLog(target).c_str());
-            return false;
-        }
-        cred->protocol = scheme;
-        cred->host = host;
-        cred->port = static_cast<int32_t>(strtol(port.c_str(), nullptr, 10));
-        return true;
+        return ApplyRedirectLocation(cred, request.GetResponseHeader());
     });
 }
 
@@ -157,6 +159,22 @@ constexpr int kLineLoginSetUrl = 205;
 constexpr int kLineLoginSend = 225;
 constexpr int kLineLoginInvalid = 238;
 constexpr int kLineLoginStore = 248;
+
+bool ReadLoginAnswer(const std::string &body, Json::Value *response, KOVA_CRED_SESS &session) {
+    // jsoncpp's lenient reader: comments and text behind the answer are tolerated.
+    Json::Value answer;
+    const bool parsed = kova::JsonFromLenientText(body, answer, true);
+    if (response != nullptr) {
+        *response = answer;
+    }
+    if (!parsed || !kova::JsonIsSuccess(answer) || !answer["data"].isObject()) {
+        return false;
+    }
+    session.filled = 1;
+    session.access_token = kova::JsonText(answer["data"]["sid"]);
+    session.csrf_token = kova::JsonText(answer["data"]["kovatoken"]);
+    return true;
+}
 
 bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
                                    KOVA_CRED_SESS *sess, Json::Value *response) {
@@ -191,22 +209,12 @@ bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
                       static_cast<int>(request.GetError()));
             return false;
         }
-        // jsoncpp's lenient reader: comments and text behind the answer are tolerated.
-        Json::Reader reader;
-        Json::Value answer;
-        const bool parsed = reader.parse(request.GetResponse(), answer);
-        if (response != nullptr) {
-            *response = answer;
-        }
-        if (!parsed || !kova::JsonIsSuccess(answer) || !answer["data"].isObject()) {
+        KOVA_CRED_SESS local;
+        if (!ReadLoginAnswer(request.GetResponse(), response, local)) {
             request.SetError(CRED_REQ_ERR_INVALID_RESPONSE);
             kova::Log("%s:%d Login response is invalid", kUnit, kLineLoginInvalid);
             return false;
         }
-        KOVA_CRED_SESS local;
-        local.filled = 1;
-        local.access_token = kova::JsonText(answer["data"]["sid"]);
-        local.csrf_token = kova::JsonText(answer["data"]["kovatoken"]);
         if (cred->id >= 0 && KOVACredSessSetByID(cred->id, &local) < 0) {
             kova::Log("%s:%d Set cred_sess fail. id=%ld", kUnit, kLineLoginStore,
                       static_cast<long>(cred->id));
@@ -298,6 +306,11 @@ constexpr int kLineLogoutSetUrl = 359;
 constexpr int kLineLogoutSend = 368;
 constexpr int kLineLogoutInvalid = 377;
 
+bool IsLogoutAnswerOk(const std::string &body) {
+    Json::Value answer;
+    return kova::JsonFromString(body, answer) && kova::JsonIsSuccess(answer);
+}
+
 bool CredRequestUtil::Logout(KOVA_CRED *cred, const std::string &sid) {
     return kova::Guarded(kUnit, kLineAuthException, false, [&] {
         if (cred == nullptr || sid.empty()) {
@@ -322,8 +335,7 @@ bool CredRequestUtil::Logout(KOVA_CRED *cred, const std::string &sid) {
                       static_cast<int>(request.GetError()));
             return false;
         }
-        Json::Value answer;
-        if (kova::JsonFromString(request.GetResponse(), answer) && kova::JsonIsSuccess(answer)) {
+        if (IsLogoutAnswerOk(request.GetResponse())) {
             return true;
         }
         request.SetError(CRED_REQ_ERR_INVALID_RESPONSE);

@@ -13,12 +13,11 @@
 #include <openssl/param_build.h>
 #include <openssl/rsa.h>
 
-#include <json/reader.h>
-
 #include "kovacredential/cred_request_util.h"
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
 #include "platform/vlibc.h"
+#include "request/cred_request_util_p.h"
 
 namespace {
 
@@ -245,6 +244,18 @@ constexpr int kLineEncInfoBadParam = 144;
 constexpr int kLineEncInfoSendFail = 157;
 constexpr int kLineEncInfoInvalid = 163;
 
+bool ReadEncInfoAnswer(const std::string &body, Json::Value &info) {
+    // jsoncpp's lenient reader: comments and text behind the answer are tolerated.
+    Json::Value root;
+    if (!kova::JsonFromLenientText(body, root, false) || !root.isObject() ||
+        !root.isMember("data")) {
+        kova::Log("%s:%d encryption response is invalid", kUnit, kLineEncInfoInvalid);
+        return false;
+    }
+    info = root["data"];
+    return true;
+}
+
 bool CredRequestUtil::GetEncInfo(const std::string &url, Json::Value &info) {
     if (url.empty()) {
         kova::Log("%s:%d Bad parameters", kUnit, kLineEncInfoBadParam);
@@ -264,16 +275,7 @@ bool CredRequestUtil::GetEncInfo(const std::string &url, Json::Value &info) {
                       static_cast<int>(request.GetError()));
             return false;
         }
-        // jsoncpp's lenient reader: comments and text behind the answer are tolerated.
-        Json::Reader reader;
-        Json::Value root;
-        if (!reader.parse(request.GetResponse(), root, false) || !root.isObject() ||
-            !root.isMember("data")) {
-            kova::Log("%s:%d encryption response is invalid", kUnit, kLineEncInfoInvalid);
-            return false;
-        }
-        info = root["data"];
-        return true;
+        return ReadEncInfoAnswer(request.GetResponse(), info);
     } catch (...) {
         return false;
     }

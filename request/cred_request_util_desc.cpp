@@ -17,6 +17,7 @@
 #include "request/cred_request_util_p.h"
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
+#include "request/cred_request_util_p.h"
 
 namespace KOVA {
 
@@ -92,6 +93,21 @@ constexpr int kLineDescInvalid = 86;
 constexpr int kLineDescFail = 90;
 constexpr int kLineDescException = 96;
 
+bool StoreWebAPIDescAnswer(const std::string &key, const std::string &body) {
+    Json::Value answer;
+    if (!kova::JsonFromString(body, answer)) {
+        kova::Log("%s:%d Query response is invalid", kUnit, kLineDescInvalid);
+        return false;
+    }
+    if (!kova::JsonIsSuccess(answer)) {
+        kova::Log("%s:%d Query request fail!", kUnit, kLineDescFail);
+        return false;
+    }
+    const DescGuard lock(gDescLock);
+    DescRoot()[key] = answer["data"];
+    return true;
+}
+
 bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
     return kova::Guarded(kUnit, kLineDescException, false, [&] {
         if (cred == nullptr) {
@@ -121,18 +137,7 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
             m_errCode = CRED_REQ_ERR_QUERY_FAIL;
             return false;
         }
-        Json::Value answer;
-        if (!kova::JsonFromString(request.GetResponse(), answer)) {
-            kova::Log("%s:%d Query response is invalid", kUnit, kLineDescInvalid);
-            return false;
-        }
-        if (!kova::JsonIsSuccess(answer)) {
-            kova::Log("%s:%d Query request fail!", kUnit, kLineDescFail);
-            return false;
-        }
-        const DescGuard lock(gDescLock);
-        DescRoot()[key] = answer["data"];
-        return true;
+        return StoreWebAPIDescAnswer(key, request.GetResponse());
     });
 }
 

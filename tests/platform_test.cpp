@@ -184,6 +184,19 @@ TEST(JsonText, ParsesStrictlyAndWritesCompactly) {
     EXPECT_TRUE(kova::JsonFromString("\"busy\"", v));
     EXPECT_EQ(v, Json::Value("busy"));
     EXPECT_FALSE(kova::JsonFromString("0 1", v));
+
+    // The lenient reader takes comments and ignores what follows the value.
+    EXPECT_TRUE(kova::JsonFromLenientText("/* c */ {\"a\": 1} <!-- -->", v, false));
+    EXPECT_EQ(v["a"], 1);
+    EXPECT_FALSE(kova::JsonFromLenientText("{\"a\": ", v, false));
+    // Nested deeper than the reader allows: a failed parse on both readers, never a throw.
+    const std::string deep = std::string(1001, '[') + std::string(1001, ']');
+    EXPECT_TRUE(kova::JsonFromString(deep.substr(1, 2000), v));
+    EXPECT_FALSE(kova::JsonFromString(deep, v));
+    EXPECT_TRUE(v.isNull());
+    v = 1;
+    EXPECT_FALSE(kova::JsonFromLenientText(deep, v, true));
+    EXPECT_TRUE(v.isNull());
 }
 
 int FixedProvider(char *token, size_t tokenSize, char *key, size_t keySize) {

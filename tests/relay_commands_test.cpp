@@ -250,6 +250,32 @@ TEST_F(RelayCommandsTest, UnusableAnswersGiveTheirErrorDocuments) {
                                           : client.RequestTunnel(answer));
         EXPECT_EQ(client.GetErrors(), ParseJson(c.errors));
     }
+
+    // An otherwise usable answer nested deeper than the parser allows is unparsable like any
+    // other; a long one is detailed by its first 4096 bytes, cut before a split character.
+    const std::string deep =
+        "{\"errno\":0,\"server\":" + std::string(1000, '[') + std::string(1000, ']') + "}";
+    const std::string longText = std::string(4095, 'x') + "\xc3\xa9" + std::string(9000, 'y');
+    const std::pair<std::string, std::string> answers[] = {{deep, deep},
+                                                           {longText, std::string(4095, 'x')}};
+    KOVA::CredRequestFarlinkPrivate core(nullptr);
+    for (const auto &a : answers) {
+        SCOPED_TRACE(a.first.substr(0, 20));
+        Json::Value config(Json::objectValue);
+        config["answers"][0]["raw"] = a.first;
+        std::string error;
+        ASSERT_TRUE(Sim().Configure(config, &error)) << error;
+        CredRequestFarlink client;
+        client.SetServerId("S1");
+        Json::Value answer;
+        EXPECT_FALSE(client.GetServerInfo(answer));
+        Json::Value expected(Json::objectValue);
+        expected["code"] = KOVA::CRED_REQ_ERR_SERVER_ERRNO;
+        expected["error"] = a.second;
+        EXPECT_EQ(client.GetErrors(), expected);
+        EXPECT_FALSE(core.SendFarlinkRequest(ParseJson(R"({"version":1,"command":"x"})"), answer));
+        EXPECT_EQ(core.GetErrors(), expected);
+    }
 }
 
 TEST_F(RelayCommandsTest, JsonThatIsNoObjectIsReceivedButNotAccepted) {

@@ -315,6 +315,9 @@ TEST_F(EncInfoTest, AnswersAndFailures) {
         {"<html>", nullptr},
         {"[1,2]", nullptr},
         {"", nullptr},
+        {"{\"data\":{\"cipherkey\":\"k\",\"x\":" + std::string(1000, '[') + std::string(1000, ']') +
+             "}}",
+         nullptr},
     };
     Json::Value info;
     for (const auto &c : cases) {

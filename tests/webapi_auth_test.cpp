@@ -280,9 +280,15 @@ TEST_P(WebApiBadAnswerTest, IsAnInvalidResponse) {
     EXPECT_EQ(!logoutUsable, LogHas("Logout response is invalid")) << LogDump();
 }
 
+// A usable answer but for a member nested deeper than the parser allows.
+const std::string kDeepAnswer =
+    "{\"success\":true,\"data\":{\"sid\":\"S\",\"x\":" + std::string(1000, '[') +
+    std::string(1000, ']') + "}}";
+
 INSTANTIATE_TEST_SUITE_P(Answers, WebApiBadAnswerTest,
-                         ::testing::Values("<html>login</html>", "{\"success\":false}",
-                                           "{\"success\":true}", "{\"success\":\"yes\"}",
+                         ::testing::Values(kDeepAnswer.c_str(), "<html>login</html>",
+                                           "{\"success\":false}", "{\"success\":true}",
+                                           "{\"success\":\"yes\"}",
                                            "{\"success\":true,\"data\":\"sid\"}", "[1,2]", ""));
 
 TEST_F(WebApiAuthTest, LoginAnswerIsReadLenientlyButLogoutAnswerMustBeWhole) {

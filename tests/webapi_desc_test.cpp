@@ -83,11 +83,14 @@ TEST_F(WebApiDescTest, UnknownApiSetsErrorSixAndIsQueriedAgain) {
 
 TEST_F(WebApiDescTest, UnusableAnswersAreNotCached) {
     const struct {
-        const char *body;
+        std::string body;
         const char *log;
     } cases[] = {{"<html><body>It works</body></html>", "Query response is invalid"},
                  {"{\"success\":false,\"error\":{\"code\":105}}", "Query request fail!"},
-                 {"[\"success\"]", "Query request fail!"}};
+                 {"[\"success\"]", "Query request fail!"},
+                 {"{\"success\":true,\"data\":{\"x\":" + std::string(1000, '[') +
+                      std::string(1000, ']') + "}}",
+                  "Query response is invalid"}};
     int id = 7;
     for (const auto &c : cases) {
         SCOPED_TRACE(c.body);

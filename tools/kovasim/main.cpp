@@ -16,6 +16,12 @@
 // In "directory", the texts "$http_port" and "$https_port" stand for the ports the WebAPI
 // listeners got, so a configuration can point the directory at them before they are known.
 // Each directory host prints "relay HOST:PORT".
+//
+// --fault MODE serves one hostile peer instead of the roles (tools/simlib/fault_server.h):
+// silent, reset-headers, reset-body, garbage-status, many-headers, huge-header, bad-chunk,
+// plain-on-tls, tls-on-plain, huge-body. It prints "https 127.0.0.1:PORT" for plain-on-tls
+// (clients are to use TLS there; --https-port picks the port) and "http 127.0.0.1:PORT" for
+// the others (--http-port).
 #include <signal.h>
 #include <stdio.h>
 #include <time.h>
@@ -32,6 +38,7 @@
 #include <json/value.h>
 
 #include "common/tool_version.h"
+#include "simlib/fault_server.h"
 #include "simlib/loopback_server.h"
 #include "simlib/relay_sim.h"
 #include "simlib/webapi_sim.h"
@@ -47,6 +54,7 @@ struct Settings {
     bool redirectHttp = false;
     bool noHttp = false;
     bool noHttps = false;
+    std::string fault;
 };
 
 bool LoadConfig(const std::string &path, Json::Value &config, std::string &error) {
@@ -183,6 +191,12 @@ int main(int argc, char **argv) {
                  "answer every plain-HTTP request with a 302 to the HTTPS listener");
     app.add_flag("--no-http", settings.noHttp, "do not serve plain HTTP");
     app.add_flag("--no-https", settings.noHttps, "do not serve HTTPS");
+    std::vector<std::string> faultNames;
+    for (kovasim::Fault fault : kovasim::AllFaults()) {
+        faultNames.push_back(kovasim::FaultName(fault));
+    }
+    app.add_option("--fault", settings.fault, "serve one hostile peer instead of the roles")
+        ->check(CLI::IsMember(faultNames));
     CLI11_PARSE(app, argc, argv);
     if (settings.redirectHttp && (settings.noHttp || settings.noHttps)) {
         fprintf(stderr, "kovasim: --redirect-http needs both listeners\n");
@@ -213,6 +227,23 @@ int main(int argc, char **argv) {
     sigaddset(&stopSignals, SIGTERM);
     pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
     signal(SIGPIPE, SIG_IGN);
+
+    kovasim::Fault fault;
+    if (kovasim::FaultFromName(settings.fault, &fault)) {
+        kovasim::FaultServer server(
+            fault, "127.0.0.1",
+            fault == kovasim::Fault::kPlainOnTls ? settings.httpsPort : settings.httpPort);
+        if (!server.Start()) {
+            fprintf(stderr, "kovasim: fault %s: %s\n", settings.fault.c_str(),
+                    server.Error().c_str());
+            return 1;
+        }
+        printf("%s 127.0.0.1:%d\n", server.ClientUsesTls() ? "https" : "http", server.Port());
+        fflush(stdout);
+        WaitForStop(stopSignals, settings.duration);
+        fflush(stdout);
+        _exit(0);
+    }
 
     std::unique_ptr<kovasim::LoopbackServer> https;
     std::unique_ptr<kovasim::LoopbackServer> http;

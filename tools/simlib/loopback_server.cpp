@@ -308,8 +308,8 @@ void LoopbackServer::ClearRecords() {
     records_.clear();
 }
 
-RawServer::RawServer(Handler handler, const std::string &host)
-    : handler_(std::move(handler)), host_(host) {}
+RawServer::RawServer(Handler handler, const std::string &host, bool readHead, int port)
+    : handler_(std::move(handler)), host_(host), readHead_(readHead), port_(port) {}
 
 RawServer::~RawServer() {
     Stop();
@@ -327,7 +327,7 @@ bool RawServer::Start() {
     setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof(one));
     struct sockaddr_in addr = {};
     addr.sin_family = AF_INET;
-    addr.sin_port = 0;
+    addr.sin_port = htons(static_cast<uint16_t>(port_));
     if (inet_pton(AF_INET, host_.c_str(), &addr.sin_addr) != 1 ||
         bind(fd, reinterpret_cast<struct sockaddr *>(&addr), sizeof(addr)) != 0 ||
         listen(fd, 16) != 0) {
@@ -373,7 +373,7 @@ void RawServer::Serve() {
         // Reads the head for at most two seconds; the body, if any, is left unread.
         const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(2);
         char buf[4096];
-        while (conn.head_.find("\r\n\r\n") == std::string::npos && !stopping_ &&
+        while (readHead_ && conn.head_.find("\r\n\r\n") == std::string::npos && !stopping_ &&
                std::chrono::steady_clock::now() < deadline) {
             struct pollfd cfd = {fd, POLLIN, 0};
             if (poll(&cfd, 1, 50) <= 0) {
@@ -393,15 +393,31 @@ void RawServer::Serve() {
         if (handler_) {
             handler_(conn);
         }
-        shutdown(fd, SHUT_RDWR);
-        close(fd);
+        if (conn.fd_ >= 0) {
+            shutdown(fd, SHUT_RDWR);
+            close(fd);
+        }
     }
 }
 
-bool RawServer::Connection::Send(const std::string &bytes) {
+void RawServer::Connection::Reset() {
+    if (fd_ < 0) {
+        return;
+    }
+    // A zero linger time makes close send RST and drop what is unsent.
+    struct linger abort = {1, 0};
+    setsockopt(fd_, SOL_SOCKET, SO_LINGER, &abort, sizeof(abort));
+    close(fd_);
+    fd_ = -1;
+}
+
+bool RawServer::Connection::Send(const char *data, size_t size) {
+    if (fd_ < 0) {
+        return false;
+    }
     size_t sent = 0;
-    while (sent < bytes.size()) {
-        ssize_t n = send(fd_, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
+    while (sent < size) {
+        ssize_t n = send(fd_, data + sent, size - sent, MSG_NOSIGNAL);
         if (n <= 0) {
             return false;
         }
@@ -411,6 +427,9 @@ bool RawServer::Connection::Send(const std::string &bytes) {
 }
 
 bool RawServer::Connection::WaitForClose(int ms) {
+    if (fd_ < 0) {
+        return true;
+    }
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
     char buf[4096];
     while (!*stopping_ && std::chrono::steady_clock::now() < deadline) {

@@ -116,11 +116,14 @@ class RawServer {
     class Connection {
       public:
         // Writes all bytes; false once the peer has gone.
-        bool Send(const std::string &bytes);
+        bool Send(const std::string &bytes) { return Send(bytes.data(), bytes.size()); }
+        bool Send(const char *data, size_t size);
         // Waits up to `ms` milliseconds; returns early when the server stops.
         void Pause(int ms);
         // Waits up to `ms` milliseconds for the peer to close the connection; true if it did.
         bool WaitForClose(int ms);
+        // Ends the connection with a TCP reset instead of an orderly close; later sends fail.
+        void Reset();
         // The request head as received (request line and headers).
         const std::string &Head() const { return head_; }
         // Reads the body that follows the head until `bytes` bytes have come, the received
@@ -142,7 +145,11 @@ class RawServer {
     };
     using Handler = std::function<void(Connection &)>;
 
-    explicit RawServer(Handler handler, const std::string &host = "127.0.0.1");
+    // With `readHead` false the handler runs as soon as a connection is accepted, before the
+    // client has sent anything (Head() stays empty).
+    // `port` 0 picks a free one.
+    explicit RawServer(Handler handler, const std::string &host = "127.0.0.1", bool readHead = true,
+                       int port = 0);
     ~RawServer();
     RawServer(const RawServer &) = delete;
     RawServer &operator=(const RawServer &) = delete;
@@ -159,8 +166,9 @@ class RawServer {
 
     Handler handler_;
     std::string host_;
+    bool readHead_;
     int listenFd_ = -1;
-    int port_ = 0;
+    int port_;
     std::thread thread_;
     std::atomic<bool> stopping_{false};
     std::atomic<int> accepted_{0};
