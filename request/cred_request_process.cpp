@@ -64,33 +64,13 @@ bool CredRequest::Process(bool perform, int retries) {
                 sleep(1);
             }
         }
-        const int code = static_cast<int>(rc);
-        if (code != CURLE_OK) {
-            switch (code) {
-                case CURLE_COULDNT_RESOLVE_PROXY:
-                case CURLE_COULDNT_RESOLVE_HOST:
-                    d->error = CRED_REQ_ERR_RESOLVE;
-                    return false;
-                case CURLE_OPERATION_TIMEDOUT:
-                    d->error = CRED_REQ_ERR_TIMEOUT;
-                    return false;
-                case CURLE_COULDNT_CONNECT:
-                case CURLE_RECV_ERROR:
-                    d->error = CRED_REQ_ERR_CONNECT;
-                    break;
-                case CURLE_SSL_CONNECT_ERROR:
-                    d->error = CRED_REQ_ERR_SSL_CONNECT;
-                    break;
-                case CURLE_SEND_ERROR:
-                case CURLE_AGAIN:
-                    d->error = CRED_REQ_ERR_SEND;
-                    break;
-                default:  // every other result, and results newer than this library knows
-                    d->error = CRED_REQ_ERR_CURL_OTHER;
-                    break;
+        if (rc != CURLE_OK) {
+            d->error = ErrorOf(rc, 0);
+            // Resolve failures and time-outs are not logged.
+            if (d->error != CRED_REQ_ERR_RESOLVE && d->error != CRED_REQ_ERR_TIMEOUT) {
+                kova::Log("%s:%d (pid=%d)CURL Error(%d): %s", kUnit, kLineCurlError,
+                          static_cast<int>(getpid()), static_cast<int>(rc), curl_easy_strerror(rc));
             }
-            kova::Log("%s:%d (pid=%d)CURL Error(%d): %s", kUnit, kLineCurlError,
-                      static_cast<int>(getpid()), code, curl_easy_strerror(rc));
             return false;
         }
 
@@ -105,26 +85,56 @@ bool CredRequest::Process(bool perform, int retries) {
         if (status >= 400 && status <= 599) {
             kova::Log("%s:%d (pid=%d)HTTP Error(%ld)", kUnit, kLineHttpError,
                       static_cast<int>(getpid()), status);
-            d->error = status <= 499 ? CRED_REQ_ERR_HTTP_CLIENT : CRED_REQ_ERR_HTTP_SERVER;
-            return false;
         }
-        switch (status) {
-            case 200:
-                return true;
-            case 304:
-                d->error = CRED_REQ_ERR_NOT_MODIFIED;
-                return false;
-            case 302:
-                d->error = CRED_REQ_ERR_REDIRECT;
-                return false;
-            default:
-                d->error = CRED_REQ_ERR_HTTP_UNEXPECTED;
-                return false;
+        // Success leaves an earlier error in place.
+        const KOVA::_tag_CRED_REQ_ERR error = ErrorOf(CURLE_OK, status);
+        if (error == CRED_REQ_ERR_NONE) {
+            return true;
         }
+        d->error = error;
+        return false;
     } catch (...) {
         kova::LogCaughtException(kUnit, kLineProcessException);
         d->error = CRED_REQ_ERR_UNKNOWN;
         return false;
+    }
+}
+
+KOVA::_tag_CRED_REQ_ERR CredRequest::ErrorOf(CURLcode result, long status) {
+    switch (result) {
+        case CURLE_OK:
+            break;
+        case CURLE_COULDNT_RESOLVE_PROXY:
+        case CURLE_COULDNT_RESOLVE_HOST:
+            return CRED_REQ_ERR_RESOLVE;
+        case CURLE_OPERATION_TIMEDOUT:
+            return CRED_REQ_ERR_TIMEOUT;
+        case CURLE_COULDNT_CONNECT:
+        case CURLE_RECV_ERROR:
+            return CRED_REQ_ERR_CONNECT;
+        case CURLE_SSL_CONNECT_ERROR:
+            return CRED_REQ_ERR_SSL_CONNECT;
+        case CURLE_SEND_ERROR:
+        case CURLE_AGAIN:
+            return CRED_REQ_ERR_SEND;
+        default:  // every other result, and results newer than this library knows
+            return CRED_REQ_ERR_CURL_OTHER;
+    }
+    if (status >= 400 && status <= 499) {
+        return CRED_REQ_ERR_HTTP_CLIENT;
+    }
+    if (status >= 500 && status <= 599) {
+        return CRED_REQ_ERR_HTTP_SERVER;
+    }
+    switch (status) {
+        case 200:
+            return CRED_REQ_ERR_NONE;
+        case 304:
+            return CRED_REQ_ERR_NOT_MODIFIED;
+        case 302:
+            return CRED_REQ_ERR_REDIRECT;
+        default:
+            return CRED_REQ_ERR_HTTP_UNEXPECTED;
     }
 }
 

@@ -144,6 +144,10 @@ class KOVA_EXPORT CredRequest {
     // Sets the transfer up and, when `perform`, runs it with up to `retries` further attempts.
     // True only for HTTP status 200 (or a successful set-up when not performing).
     bool Process(bool perform = true, int retries = 0);
+    // The error Process leaves for a transfer that ended with libcurl's `result` and, when that
+    // is CURLE_OK, the HTTP `status`: CRED_REQ_ERR_NONE only for status 200. For callers that
+    // drive the handle themselves (GetCurlHandler after Process(false)).
+    static KOVA::_tag_CRED_REQ_ERR ErrorOf(CURLcode result, long status);
     // Logs in with stored credential credId, attaches the session, then Process.
     bool ProcessWithLogin(long credId, bool perform = true, int retries = 0);
     // Logs in to the server of `url` (or of this request's URL when empty) with the given

@@ -14,4 +14,16 @@
 #include "cred_request_mgr.h"
 #include "cred_request_farlink.h"
 
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+// The version of the library the program runs with, "MAJOR.MINOR.PATCH" (for example "6.0.0").
+// A static text; may be called from any thread.
+KOVA_EXPORT const char *KOVACredentialVersion(void);
+
+#ifdef __cplusplus
+}
+#endif
+
 #endif  // KOVACREDENTIAL_KOVACREDENTIAL_H

@@ -11,6 +11,8 @@
 #include <openssl/crypto.h>
 #include <sqlite3.h>
 
+#include "kovacredential/kovacredential.h"
+
 namespace kova_tools {
 namespace {
 
@@ -64,7 +66,7 @@ std::string LoadedVersion(const std::string &library) {
 std::string VersionText(const std::string &tool) {
     const curl_version_info_data *curl = curl_version_info(CURLVERSION_NOW);
     std::string text = tool + " " + KOVA_TOOLS_VERSION + "\n";
-    text += "libkovacredential " + LoadedVersion("libkovacredential") + "\n";
+    text += std::string("libkovacredential ") + KOVACredentialVersion() + "\n";
     text += std::string("libcurl ") + (curl != nullptr ? curl->version : "unknown") + "\n";
     text += std::string("OpenSSL ") + OpenSSL_version(OPENSSL_VERSION_STRING) + "\n";
     text += std::string("SQLite ") + sqlite3_libversion() + "\n";

@@ -8,8 +8,7 @@ namespace kova_tools {
 
 // One "NAME VERSION" line each for `tool` itself, then for the libkovacredential, libcurl,
 // OpenSSL, SQLite and jsoncpp the process has loaded (not the ones it was built against);
-// "unknown" where a loaded library does not tell, "not loaded" for a library the process does
-// not use (kovasim serves without libkovacredential).
+// "unknown" where a loaded library does not tell.
 std::string VersionText(const std::string &tool);
 
 }  // namespace kova_tools

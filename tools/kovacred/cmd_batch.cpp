@@ -125,46 +125,6 @@ void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &spec, Call &call) {
                                                             : KOVA::CRED_REQ_ERR_UNKNOWN;
 }
 
-// The error code of a finished transfer: the mapping CredRequest::Process applies to a single
-// transfer (cred_request.h), so that a call reports what it would report on its own.
-KOVA::CRED_REQ_ERR Outcome(CURLcode rc, long status) {
-    switch (rc) {
-        case CURLE_OK:
-            break;
-        case CURLE_COULDNT_RESOLVE_PROXY:
-        case CURLE_COULDNT_RESOLVE_HOST:
-            return KOVA::CRED_REQ_ERR_RESOLVE;
-        case CURLE_OPERATION_TIMEDOUT:
-            return KOVA::CRED_REQ_ERR_TIMEOUT;
-        case CURLE_COULDNT_CONNECT:
-        case CURLE_RECV_ERROR:
-            return KOVA::CRED_REQ_ERR_CONNECT;
-        case CURLE_SSL_CONNECT_ERROR:
-            return KOVA::CRED_REQ_ERR_SSL_CONNECT;
-        case CURLE_SEND_ERROR:
-        case CURLE_AGAIN:
-            return KOVA::CRED_REQ_ERR_SEND;
-        default:
-            return KOVA::CRED_REQ_ERR_CURL_OTHER;
-    }
-    if (status >= 400 && status <= 499) {
-        return KOVA::CRED_REQ_ERR_HTTP_CLIENT;
-    }
-    if (status >= 500 && status <= 599) {
-        return KOVA::CRED_REQ_ERR_HTTP_SERVER;
-    }
-    switch (status) {
-        case 200:
-            return KOVA::CRED_REQ_ERR_NONE;
-        case 304:
-            return KOVA::CRED_REQ_ERR_NOT_MODIFIED;
-        case 302:
-            return KOVA::CRED_REQ_ERR_REDIRECT;
-        default:
-            return KOVA::CRED_REQ_ERR_HTTP_UNEXPECTED;
-    }
-}
-
 // "done/total, failed, elapsed" on one line of standard error, redrawn in place; only when
 // standard error is a terminal.
 class Progress {
@@ -250,7 +210,8 @@ void RunTransfers(KOVA::CredRequestMgr &mgr, std::vector<Call> &calls) {
             curl_easy_getinfo(msg->easy_handle, CURLINFO_TOTAL_TIME, &seconds);
             Call &call = *it->second;
             call.seconds = seconds;
-            finish(call, Outcome(msg->data.result, status));
+            // The code Process would leave for the same transfer.
+            finish(call, KOVA::CredRequest::ErrorOf(msg->data.result, status));
             mgr.GetRequest(call.index)->SetError(static_cast<KOVA::CRED_REQ_ERR>(call.code));
             curl_multi_remove_handle(multi.get(), msg->easy_handle);
             running.erase(it);
