@@ -102,11 +102,12 @@ constexpr int kConsumableRows = 50000;
 constexpr double kSecondsPerRun = 0.12;
 constexpr long kMaxCallsPerRun = 1500;
 constexpr int kRounds = 15;
+constexpr double kTarget = 0.95;
+
 // Calls counted under callgrind: fewer for the calls that read many rows.
 int InstructionCalls(int rows) {
     return std::max(3, 10000 / (100 + rows));
 }
-constexpr double kTarget = 0.95;
 
 void Fail(const char *what) {
     fprintf(stderr, "store_bench: %s\n", what);
@@ -367,7 +368,7 @@ struct Call {
     std::function<void()> raw;
 };
 
-// Pseudo-random ids 1 to kReadRows, the same sequence on both sides.
+// Pseudo-random ids 1 to kReadRows; both sides draw from one sequence.
 struct IdSequence {
     unsigned next = 1;
     long operator()() {
