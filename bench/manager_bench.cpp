@@ -4,17 +4,29 @@
 //      for the speed-up);
 //   2. 1,000 concurrent WebAPI calls against the simulator;
 //   3. the 100-request run of (1) with 1,100 extra descriptors open in the process, against the
-//      same run without them.
+//      same run without them;
+// and the memory of (2): the peak resident set of the 1,000 calls made through the manager,
+// against the same transfers (URL, POST body, each answer kept in a string) made through plain
+// libcurl easy handles in one multi handle. Each side runs in a fresh process of this program
+// (started with --rss), so that neither the simulator's threads nor the other side's heap count;
+// both sides load the same program and libraries, so their peaks differ only by what their
+// transfers take. --memory runs the memory comparison alone.
 #include <fcntl.h>
+#include <spawn.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <string.h>
 #include <sys/resource.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
+#include <filesystem>
+#include <fstream>
 #include <functional>
 #include <memory>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -27,6 +39,8 @@
 #include "simlib/loopback_server.h"
 #include "simlib/webapi_sim.h"
 
+extern char **environ;
+
 namespace {
 
 using Clock = std::chrono::steady_clock;
@@ -37,6 +51,7 @@ constexpr int kDelayMs = 200;
 constexpr int kConcurrentCalls = 1000;
 constexpr int kExtraDescriptors = 1100;
 constexpr int kRounds = 9;
+constexpr int kRssRounds = 5;
 
 double Since(Clock::time_point start) {
     return std::chrono::duration<double>(Clock::now() - start).count();
@@ -67,27 +82,33 @@ Batch DelayedBatch(const std::string &base) {
             kDelayedRequests};
 }
 
+// The POST parameters of call `i` of the WebAPI batch.
+Json::Value WebApiParams(int i) {
+    Json::Value params(Json::objectValue);
+    params["api"] = "KOVA.Demo.Echo";
+    params["version"] = "1";
+    params["method"] = "echo";
+    params["n"] = std::to_string(i);
+    return params;
+}
+
+bool GoodEcho(int i, const std::string &body) {
+    Json::Value answer;
+    return kova::JsonFromString(body, answer) &&
+           answer["data"]["params"]["n"].asString() == std::to_string(i);
+}
+
 Batch WebApiBatch(const std::string &base) {
     return {[base] {
                 Requests requests;
                 for (int i = 0; i < kConcurrentCalls; ++i) {
-                    Json::Value params(Json::objectValue);
-                    params["api"] = "KOVA.Demo.Echo";
-                    params["version"] = "1";
-                    params["method"] = "echo";
-                    params["n"] = std::to_string(i);
                     requests.push_back(std::make_unique<KOVA::CredRequest>());
                     requests.back()->SetURL(base + "/webapi/entry.cgi");
-                    requests.back()->AddPostParam(params);
+                    requests.back()->AddPostParam(WebApiParams(i));
                 }
                 return requests;
             },
-            [](int i, const std::string &body) {
-                Json::Value answer;
-                return kova::JsonFromString(body, answer) &&
-                       answer["data"]["params"]["n"].asString() == std::to_string(i);
-            },
-            kConcurrentCalls};
+            GoodEcho, kConcurrentCalls};
 }
 
 // Seconds of one manager run over the batch; `good` counts the right answers.
@@ -203,9 +224,168 @@ void Report(const char *title, const char *nameA, const char *nameB, const Figur
            f.badRounds > 0 ? "  SOME ANSWERS WRONG" : "");
 }
 
+// ---- Memory
+
+// A "kB" line of /proc/self/status (VmRSS: resident now, VmHWM: its peak); 0 when missing.
+long StatusKb(const char *field) {
+    std::ifstream status("/proc/self/status");
+    const std::string prefix = std::string(field) + ":";
+    for (std::string line; std::getline(status, line);) {
+        if (line.rfind(prefix, 0) == 0) {
+            return strtol(line.c_str() + prefix.size(), nullptr, 10);
+        }
+    }
+    return 0;
+}
+
+size_t AppendToString(char *data, size_t size, size_t nmemb, void *out) {
+    static_cast<std::string *>(out)->append(data, size * nmemb);
+    return size * nmemb;
+}
+
+// The batch of WebApiBatch through plain easy handles: the same URL and POST body (the pair
+// text the manager's requests send), each answer appended to a string of its own, all driven
+// by one multi handle. Returns the right answers.
+int RawTransfers(const std::string &base) {
+    struct Transfer {
+        CURL *easy = nullptr;
+        std::string answer;
+    };
+    std::vector<Transfer> transfers(kConcurrentCalls);
+    std::unique_ptr<CURLM, CURLMcode (*)(CURLM *)> multi(curl_multi_init(), curl_multi_cleanup);
+    const std::string url = base + "/webapi/entry.cgi";
+    for (int i = 0; i < kConcurrentCalls; ++i) {
+        Transfer &t = transfers[i];
+        t.easy = curl_easy_init();
+        const std::string body =
+            "api=KOVA.Demo.Echo&method=echo&n=" + std::to_string(i) + "&version=1";
+        curl_easy_setopt(t.easy, CURLOPT_URL, url.c_str());
+        curl_easy_setopt(t.easy, CURLOPT_COPYPOSTFIELDS, body.c_str());
+        curl_easy_setopt(t.easy, CURLOPT_NOSIGNAL, 1L);
+        curl_easy_setopt(t.easy, CURLOPT_WRITEFUNCTION, AppendToString);
+        curl_easy_setopt(t.easy, CURLOPT_WRITEDATA, &t.answer);
+        curl_multi_add_handle(multi.get(), t.easy);
+    }
+    int running = 0;
+    do {
+        if (curl_multi_perform(multi.get(), &running) != CURLM_OK) {
+            break;
+        }
+        if (running > 0 && curl_multi_poll(multi.get(), nullptr, 0, 1000, nullptr) != CURLM_OK) {
+            break;
+        }
+    } while (running > 0);
+    int good = 0;
+    for (int i = 0; i < kConcurrentCalls; ++i) {
+        good += GoodEcho(i, transfers[i].answer) ? 1 : 0;
+        curl_multi_remove_handle(multi.get(), transfers[i].easy);
+        curl_easy_cleanup(transfers[i].easy);
+    }
+    return good;
+}
+
+int ManagerTransfers(const std::string &base) {
+    int good = 0;
+    bool ok = false;
+    RunManager(WebApiBatch(base), &good, &ok);
+    return ok ? good : 0;
+}
+
+// The child of MeasureRss: prints the resident set before the batch, its peak, and the right
+// answers, all in kB.
+int RunRssChild(const std::string &side, const std::string &base) {
+    struct rlimit limit;
+    if (getrlimit(RLIMIT_NOFILE, &limit) == 0) {
+        limit.rlim_cur = limit.rlim_max;
+        setrlimit(RLIMIT_NOFILE, &limit);
+    }
+    curl_global_init(CURL_GLOBAL_ALL);
+    const long before = StatusKb("VmRSS");
+    const int good = side == "manager" ? ManagerTransfers(base) : RawTransfers(base);
+    printf("%ld %ld %d\n", before, StatusKb("VmHWM"), good);
+    return good == kConcurrentCalls ? 0 : 1;
+}
+
+struct Rss {
+    long before = 0;  // kB
+    long peak = 0;
+    bool good = false;
+};
+
+// One side's memory, measured in a fresh process of this program.
+Rss MeasureRss(const char *side, const std::string &base) {
+    Rss rss;
+    const std::string self = std::filesystem::read_symlink("/proc/self/exe").string();
+    const char *argv[] = {self.c_str(), "--rss", side, base.c_str(), nullptr};
+    int out[2];
+    if (pipe(out) != 0) {
+        return rss;
+    }
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_adddup2(&actions, out[1], STDOUT_FILENO);
+    posix_spawn_file_actions_addclose(&actions, out[0]);
+    pid_t pid = 0;
+    const bool started =
+        posix_spawn(&pid, self.c_str(), &actions, nullptr, const_cast<char **>(argv), environ) == 0;
+    posix_spawn_file_actions_destroy(&actions);
+    close(out[1]);
+    std::string text;
+    char buffer[256];
+    for (ssize_t n; started && (n = read(out[0], buffer, sizeof(buffer))) > 0;) {
+        text.append(buffer, static_cast<size_t>(n));
+    }
+    close(out[0]);
+    int status = 0;
+    if (!started || waitpid(pid, &status, 0) != pid) {
+        return rss;
+    }
+    int good = 0;
+    std::istringstream(text) >> rss.before >> rss.peak >> good;
+    rss.good = WIFEXITED(status) && WEXITSTATUS(status) == 0 && good == kConcurrentCalls;
+    return rss;
+}
+
+void ReportRss(const std::string &base, bool *allGood) {
+    std::vector<double> managerPeak, rawPeak, peakRatios, growthRatios;
+    std::vector<double> managerGrowth, rawGrowth;
+    int badRounds = 0;
+    for (int round = 0; round < kRssRounds; ++round) {
+        const Rss manager = MeasureRss("manager", base);
+        const Rss raw = MeasureRss("raw", base);
+        badRounds += manager.good && raw.good ? 0 : 1;
+        managerPeak.push_back(manager.peak / 1024.0);
+        rawPeak.push_back(raw.peak / 1024.0);
+        managerGrowth.push_back((manager.peak - manager.before) / 1024.0);
+        rawGrowth.push_back((raw.peak - raw.before) / 1024.0);
+        peakRatios.push_back(managerPeak.back() / rawPeak.back());
+        growthRatios.push_back(managerGrowth.back() / rawGrowth.back());
+    }
+    printf(
+        "4. peak resident set of the 1,000 calls of (2), each side in a fresh process "
+        "(median of %d alternating rounds)\n",
+        kRssRounds);
+    printf("  %-36s %8.1f MB   grew by %6.1f MB\n", "CredRequestMgr::Run", Median(managerPeak),
+           Median(managerGrowth));
+    printf("  %-36s %8.1f MB   grew by %6.1f MB\n", "plain easy handles, one multi handle",
+           Median(rawPeak), Median(rawGrowth));
+    printf("  ratio of the peaks                   %8.2f   (target <= 1.20)%s\n",
+           Median(peakRatios), badRounds > 0 ? "  SOME ANSWERS WRONG" : "");
+    printf("  ratio of the growths                 %8.2f\n", Median(growthRatios));
+    *allGood = *allGood && badRounds == 0;
+}
+
 }  // namespace
 
-int main() {
+int main(int argc, char **argv) {
+    if (argc == 4 && strcmp(argv[1], "--rss") == 0) {
+        return RunRssChild(argv[2], argv[3]);
+    }
+    const bool memoryOnly = argc == 2 && strcmp(argv[1], "--memory") == 0;
+    if (argc > 1 && !memoryOnly) {
+        fprintf(stderr, "usage: manager_bench [--memory]\n");
+        return 2;
+    }
     // 1,000 client sockets and as many on the server side need more than the usual 1,024.
     struct rlimit limit;
     if (getrlimit(RLIMIT_NOFILE, &limit) == 0) {
@@ -230,6 +410,11 @@ int main() {
     const Batch delayed = DelayedBatch(server.BaseUrl());
     const Batch calls = WebApiBatch(server.BaseUrl());
     bool allGood = true;
+    if (memoryOnly) {
+        ReportRss(server.BaseUrl(), &allGood);
+        server.Stop();
+        return allGood ? 0 : 1;
+    }
 
     const auto manager = [](const Batch &batch) {
         return [&batch](bool *good) {
@@ -276,6 +461,8 @@ int main() {
     snprintf(title, sizeof(title), "3. the 100-request run with %d extra descriptors open", opened);
     Report(title, "with the extra descriptors", "without them", third, 1.10);
     allGood = allGood && third.badRounds == 0;
+
+    ReportRss(server.BaseUrl(), &allGood);
 
     server.Stop();
     return allGood ? 0 : 1;

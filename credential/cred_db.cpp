@@ -2,6 +2,7 @@
 // runs under, and the record-level operations on an open connection.
 #include <errno.h>
 #include <fcntl.h>
+#include <pthread.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -102,8 +103,19 @@ constexpr const char kLockedMessage[] = "database is locked";
 // What the log shows in place of a password, session id or token.
 constexpr const char kRedacted[] = "***";
 
-// The process that seeded rand(): a forked child sees another pid and seeds again.
-std::atomic<pid_t> gSeededPid{0};
+// Whether this process has seeded rand(). A forked child starts unseeded, so that forked
+// workers do not share back-off sequences; the flag is cleared by a fork handler rather than
+// by comparing process ids, which would cost a system call on every store call.
+std::atomic<bool> gSeeded{false};
+
+void ForgetSeedInChild() {
+    gSeeded.store(false, std::memory_order_relaxed);
+}
+
+// Registers the handler when the library is loaded.
+struct SeedForkHandler {
+    SeedForkHandler() { pthread_atfork(nullptr, nullptr, ForgetSeedInChild); }
+} gSeedForkHandler;
 
 long Now() {
     return static_cast<long>(time(nullptr));
@@ -184,6 +196,12 @@ class FileDescriptor {
     FileDescriptor(const FileDescriptor &) = delete;
     FileDescriptor &operator=(const FileDescriptor &) = delete;
     int get() const { return fd_; }
+    void reset(int fd) {
+        if (fd_ >= 0) {
+            close(fd_);
+        }
+        fd_ = fd;
+    }
 
   private:
     int fd_;
@@ -193,9 +211,8 @@ struct FreeDeleter {
     void operator()(char *p) const { free(p); }
 };
 
-// The path with its folder resolved to a path free of symbolic links (SQLite's NOFOLLOW open
-// refuses a link anywhere in the path, while a linked folder is a normal set-up); the path
-// as it is when the folder cannot be resolved.
+// The path with its folder resolved to a path free of symbolic links; the path as it is when
+// the folder cannot be resolved.
 std::string ResolveFolder(const std::string &path) {
     const size_t slash = path.rfind('/');
     if (slash == std::string::npos || slash + 1 == path.size()) {
@@ -210,6 +227,12 @@ std::string ResolveFolder(const std::string &path) {
            path.substr(slash + 1);
 }
 
+// sqlite3_open_v2 of an existing file for reading and writing, never through a link.
+int OpenNoFollow(const char *path, sqlite3 **db) {
+    *db = nullptr;
+    return sqlite3_open_v2(path, db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOFOLLOW, nullptr);
+}
+
 // Refuses to open the database file: logs why and fails as a failed open does.
 sqlite3 *Refuse(const std::string &path, const char *why) {
     Log("%s:%d %s %s, not opened.\n", kUnit, kLineRefused, path.c_str(), why);
@@ -217,12 +240,16 @@ sqlite3 *Refuse(const std::string &path, const char *why) {
     return nullptr;
 }
 
+bool Given(const char *text) {
+    return text != nullptr && *text != '\0';
+}
+
 // The list statement: the base text, the condition and ordering parts (each left as an
 // empty "%q" when not given), and the end.
 SqlText FormatListStatement(const char *base, const char *whereFormat, const char *szCondition,
                             const char *szOrderBy, int blAscending) {
-    const bool hasCondition = szCondition != nullptr && *szCondition != '\0';
-    const bool hasOrder = szOrderBy != nullptr && *szOrderBy != '\0';
+    const bool hasCondition = Given(szCondition);
+    const bool hasOrder = Given(szOrderBy);
     std::string format;
     try {
         format = base;
@@ -236,7 +263,42 @@ SqlText FormatListStatement(const char *base, const char *whereFormat, const cha
                                    hasOrder ? szOrderBy : ""));
 }
 
+// A list read. The statement of the interface's reads, without condition and ordering, is a
+// single SELECT, whose rows a ListReader copies; a caller's condition could hold more than one
+// statement, whose rows `append` copies by name.
+template <typename Record>
+Record *ReadList(sqlite3 *db, const char *base, const char *whereFormat, const char *szCondition,
+                 const char *szOrderBy, int blAscending, sqlite3_callback append, int line) {
+    SqlText sql = FormatListStatement(base, whereFormat, szCondition, szOrderBy, blAscending);
+    if (!sql) {
+        return nullptr;
+    }
+    if (Given(szCondition) || Given(szOrderBy)) {
+        Record *head = nullptr;
+        ExecLogged(db, sql.get(), append, &head, line);
+        return head;
+    }
+    ListReader<Record> reader;
+    ExecLogged(db, sql.get(), ListReader<Record>::Row, &reader, line);
+    return reader.head;
+}
+
+// The callback of the update checks, which only need to know whether a row came.
+int RowFound(void *found, int, char **, char **) {
+    *static_cast<bool *>(found) = true;
+    return 0;
+}
+
 }  // namespace
+
+int NewestCredIdByApplication(sqlite3 *db, const char *application) {
+    SqlText sql = FormatListStatement(kCredSelectAll, " WHERE %q", nullptr, nullptr, 0);
+    ApplicationMatch match(application);
+    if (sql) {
+        ExecLogged(db, sql.get(), ApplicationMatch::Row, &match, kLineGetListExec);
+    }
+    return match.id;
+}
 
 std::string DatabasePath() {
     const char *path = secure_getenv("kovacredential_db");
@@ -277,26 +339,20 @@ using kova::ArgInvalid;
 using namespace kova::cred;
 
 void KOVACredRandInit(void) {
-    // Threads that meet a stale flag at once all seed with the same value, which is harmless;
-    // the flag itself is atomic, and a lock here could be inherited held by a forked child.
-    const pid_t pid = getpid();
-    if (gSeededPid.load(std::memory_order_acquire) != pid) {
-        srand(static_cast<unsigned>(time(nullptr) + pid));
-        gSeededPid.store(pid, std::memory_order_release);
+    // Threads that meet an unseeded process at once all seed with the same value, which is
+    // harmless; the flag itself is atomic, and a lock here could be inherited held by a forked
+    // child.
+    if (!gSeeded.load(std::memory_order_acquire)) {
+        srand(static_cast<unsigned>(time(nullptr) + getpid()));
+        gSeeded.store(true, std::memory_order_release);
     }
 }
 
 sqlite3 *KOVACredDBInit(void) {
     KOVACredRandInit();
     std::string path;
-    std::string resolved;
     try {
         path = DatabasePath();
-        // A failed touch shows up below: setting the mode and the open fail on a missing file.
-        if (access(path.c_str(), F_OK) != 0) {
-            VLIBCFileTouch(path.c_str());
-        }
-        resolved = ResolveFolder(path);
     } catch (const std::bad_alloc &) {
         VLIBCErrSetEx(KOVA_ERR_OUT_OF_MEMORY, kUnit, kLineOpenError);
         return nullptr;
@@ -305,8 +361,14 @@ sqlite3 *KOVACredDBInit(void) {
     // whoever names the path cannot have another file changed. O_PATH with O_NOFOLLOW holds a
     // link itself rather than its target, opens a FIFO or device without touching it, and needs
     // no read permission, so a file whose mode lost its read bits is still set back to 0600.
+    // Where nothing can be held the file is missing: it is made, and a failure to make it shows
+    // up below, where setting the mode and the open fail.
+    FileDescriptor file(open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    if (file.get() < 0) {
+        VLIBCFileTouch(path.c_str());
+        file.reset(open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    }
     struct stat st;
-    FileDescriptor file(open(resolved.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
     const bool opened = file.get() >= 0 && fstat(file.get(), &st) == 0;
     if (opened && !S_ISREG(st.st_mode)) {
         return Refuse(path, S_ISLNK(st.st_mode) ? "is a symbolic link" : "is not a regular file");
@@ -322,10 +384,21 @@ sqlite3 *KOVACredDBInit(void) {
         kova::Log("%s:%d %s chmod failed. errno=[0x%04X]", kUnit, kLineChmodFailed, path.c_str(),
                   modeError);
     }
-    sqlite3 *raw = nullptr;
     // The file exists by now, so SQLite is not asked to create one (it would not set the mode).
-    if (sqlite3_open_v2(resolved.c_str(), &raw, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOFOLLOW,
-                        nullptr) != SQLITE_OK) {
+    // SQLite's NOFOLLOW open refuses a link anywhere in the path, while a linked folder is a
+    // normal set-up: such a path is opened again with its folder resolved.
+    sqlite3 *raw = nullptr;
+    int rc = OpenNoFollow(path.c_str(), &raw);
+    if (rc != SQLITE_OK && sqlite3_extended_errcode(raw) == SQLITE_CANTOPEN_SYMLINK) {
+        sqlite3_close(raw);
+        try {
+            rc = OpenNoFollow(ResolveFolder(path).c_str(), &raw);
+        } catch (const std::bad_alloc &) {
+            VLIBCErrSetEx(KOVA_ERR_OUT_OF_MEMORY, kUnit, kLineOpenError);
+            return nullptr;
+        }
+    }
+    if (rc != SQLITE_OK) {
         VLIBCErrSetEx(KOVA_ERR_DB_OPEN, kUnit, kLineOpenError);
         kova::Log("%s:%d Can't open database: %s\n", kUnit, kLineOpenLog, sqlite3_errmsg(raw));
         sqlite3_close(raw);
@@ -334,8 +407,8 @@ sqlite3 *KOVACredDBInit(void) {
     Database db(raw);
     // The file SQLite opened must be the one whose mode was set, not one swapped in since.
     struct stat now;
-    if (opened && (lstat(resolved.c_str(), &now) != 0 || now.st_dev != st.st_dev ||
-                   now.st_ino != st.st_ino)) {
+    if (opened &&
+        (lstat(path.c_str(), &now) != 0 || now.st_dev != st.st_dev || now.st_ino != st.st_ino)) {
         return Refuse(path, "was replaced while being opened");
     }
     // SQLite reads the file only at the first statement, so a file that is not a database
@@ -387,13 +460,8 @@ KOVA_CRED *KOVACredDBRecordGetList(sqlite3 *db, const char *szCondition, const c
         ArgInvalid(kUnit, kLineGetListArg, "__null != db");
         return nullptr;
     }
-    SqlText sql =
-        FormatListStatement(kCredSelectAll, " WHERE %q", szCondition, szOrderBy, blAscending);
-    KOVA_CRED *head = nullptr;
-    if (sql) {
-        ExecLogged(db, sql.get(), CredRowAppend, &head, kLineGetListExec);
-    }
-    return head;
+    return ReadList<KOVA_CRED>(db, kCredSelectAll, " WHERE %q", szCondition, szOrderBy, blAscending,
+                               CredRowAppend, kLineGetListExec);
 }
 
 int KOVACredDBRecordUpdate(sqlite3 *db, long id, const KOVA_CRED *pCred) {
@@ -414,11 +482,11 @@ int KOVACredDBRecordUpdate(sqlite3 *db, long id, const KOVA_CRED *pCred) {
     if (!check) {
         return -1;
     }
-    KOVA_CRED scratch;
+    bool found = false;
     // A check that could not run is logged; only a check that ran and found nothing fails.
-    if (ExecLoggedAs(db, check.get(), CredRowFirst, &scratch, kLineUpdateCheckExec,
+    if (ExecLoggedAs(db, check.get(), RowFound, &found, kLineUpdateCheckExec,
                      [&] { return FormatCredUpdateCheck(id, *pCred, now, kRedacted); }) &&
-        scratch.filled == 0) {
+        !found) {
         VLIBCErrSetEx(KOVA_ERR_DB_READBACK, kUnit, kLineUpdateReadBack);
         return -1;
     }
@@ -479,13 +547,8 @@ KOVA_CRED_SESS *KOVACredSessDBRecordGetList(sqlite3 *db, const char *szCondition
         ArgInvalid(kUnit, kLineSessGetListArg, "__null != db");
         return nullptr;
     }
-    SqlText sql =
-        FormatListStatement(kSessSelectAll, " WHERE %q ", szCondition, szOrderBy, blAscending);
-    KOVA_CRED_SESS *head = nullptr;
-    if (sql) {
-        ExecLogged(db, sql.get(), CredSessRowAppend, &head, kLineSessGetListExec);
-    }
-    return head;
+    return ReadList<KOVA_CRED_SESS>(db, kSessSelectAll, " WHERE %q ", szCondition, szOrderBy,
+                                    blAscending, CredSessRowAppend, kLineSessGetListExec);
 }
 
 int KOVACredSessDBRecordUpdate(sqlite3 *db, long id, const KOVA_CRED_SESS *pSess) {
@@ -508,10 +571,10 @@ int KOVACredSessDBRecordUpdate(sqlite3 *db, long id, const KOVA_CRED_SESS *pSess
     if (!check) {
         return -1;
     }
-    KOVA_CRED_SESS scratch;
-    if (ExecLoggedAs(db, check.get(), CredSessRowFirst, &scratch, kLineSessUpdateCheckExec,
+    bool found = false;
+    if (ExecLoggedAs(db, check.get(), RowFound, &found, kLineSessUpdateCheckExec,
                      [&] { return FormatSessUpdateCheck(id, *pSess, kRedacted, kRedacted); }) &&
-        scratch.filled == 0) {
+        !found) {
         VLIBCErrSetEx(KOVA_ERR_DB_READBACK, kUnit, kLineSessUpdateReadBack);
         return -1;
     }

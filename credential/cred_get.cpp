@@ -36,14 +36,9 @@ int KOVACredIDGetByApplication(const char *szApplication) {
     if (szApplication == nullptr) {
         return kova::ArgInvalid(kUnit, kLineByApplicationArg, "__null != szApplication");
     }
-    KOVA_CRED *list = nullptr;
-    int id = -1;
-    // The list holds the newest row first, so its head is the newest match.
-    if (KOVACredListGet(&list, KOVACredKeepByApplication, const_cast<char *>(szApplication)) > 0) {
-        id = list->id;
-    }
-    KOVACredListFree(&list);
-    return id;
+    // What the head of KOVACredListGet's list filtered by KOVACredKeepByApplication would be,
+    // without a record for every row.
+    return kova::cred::ListNewestCredIdByApplication(szApplication);
 }
 
 int KOVACredKeepByApplication(KOVA_CRED *pCred, void *pArg) {

@@ -10,6 +10,7 @@
 #include <memory>
 #include <new>
 #include <string>
+#include <vector>
 
 #include <sqlite3.h>
 
@@ -64,9 +65,56 @@ inline Database OpenDatabase() {
     return Database(KOVACredDBInit());
 }
 
+// The id of the newest credential whose application equals `application`, or -1: the list
+// statement of KOVACredDBRecordGetList without condition and ordering, run and logged as that
+// function runs it, with an ApplicationMatch instead of a list.
+int NewestCredIdByApplication(sqlite3 *db, const char *application);
+
+// What KOVACredIDGetByApplication returns for a tag that is not null: KOVACredListGet's open
+// (with its log when that fails, and then -1) and NewestCredIdByApplication.
+int ListNewestCredIdByApplication(const char *application);
+
 // Copies one result row into a record by column name; unknown columns are ignored.
 void CredRowToRecord(KOVA_CRED *pCred, int nCol, char **azVal, char **azCol);
 void CredSessRowToRecord(KOVA_CRED_SESS *pSess, int nCol, char **azVal, char **azCol);
+
+// Reads the rows of one SELECT into a list, newest row first, exactly as CredRowAppend and
+// CredSessRowAppend do, but finds the member each column fills from the first row's names
+// only. sqlite3_exec hands every row of one statement the same array of names, so the text it
+// runs must hold a single statement. Pass the reader as the callback's argument.
+template <typename Record>
+class ListReader {
+  public:
+    static int Row(void *pArg, int nCol, char **azVal, char **azCol);
+    Record *head = nullptr;
+
+  private:
+    // Whether members_ holds the layout of these names (learning it when not); false when
+    // memory ran out, and the row is then copied by name.
+    bool Learn(int nCol, char **azCol);
+    char **names_ = nullptr;
+    std::vector<int> members_;
+};
+extern template class ListReader<KOVA_CRED>;
+extern template class ListReader<KOVA_CRED_SESS>;
+
+// Finds among the credential rows of one SELECT the id of the last whose application equals
+// `application` byte for byte (a NULL column reads as ""): the id a list of those rows,
+// filtered by KOVACredKeepByApplication, starts with. `id` stays -1 when none matches. Pass
+// the match as the callback's argument; the text run must hold a single statement.
+class ApplicationMatch {
+  public:
+    explicit ApplicationMatch(const char *application) : application_(application) {}
+    static int Row(void *pArg, int nCol, char **azVal, char **azCol);
+    int id = -1;
+
+  private:
+    const char *application_;
+    char **names_ = nullptr;
+    int count_ = -1;
+    int idColumn_ = -1;
+    int applicationColumn_ = -1;
+};
 
 // Resets a record to the allocation defaults (the chain after it must already be freed).
 void ResetCred(KOVA_CRED *pCred);

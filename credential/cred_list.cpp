@@ -1,4 +1,5 @@
-// Listing every credential, newest first, through an optional filter.
+// Listing every credential, newest first, through an optional filter, and finding the newest
+// of an application by the same read.
 #include "credential/cred_internal.h"
 #include "kovacredential/kovacred.h"
 #include "platform/kova_log.h"
@@ -38,4 +39,14 @@ int KOVACredListGet(KOVA_CRED **ppCredList, KOVA_CRED_FILTER filter, void *pArg)
         *ppCredList = head;
     }
     return kept;
+}
+
+int kova::cred::ListNewestCredIdByApplication(const char *application) {
+    KOVACredRandInit();
+    Database db = OpenDatabase();
+    if (!db) {
+        kova::LogInnerFailure(kUnit, kLineOpen, "Init sqlite failed. ");
+        return -1;
+    }
+    return NewestCredIdByApplication(db.get(), application);
 }

@@ -194,22 +194,6 @@ TYPED_TEST(AccessorTest, AccessorsReportBadArgumentsInOrder) {
 
 using RecordTest = LogTest;
 
-TEST_F(RecordTest, AllocatedRecordsHaveTheDefaults) {
-    CredPtr cred = NewCred();
-    ASSERT_NE(cred, nullptr);
-    EXPECT_EQ(cred->next, nullptr);
-    EXPECT_EQ((std::vector<int32_t>{cred->filled, cred->id, cred->ctime, cred->mtime, cred->owner,
-                                    cred->port}),
-              (std::vector<int32_t>{0, -1, 0, 0, -1, 0}));
-    EXPECT_TRUE(cred->host.empty() && cred->remote_account.empty() && cred->remote_passwd.empty() &&
-                cred->protocol.empty() && cred->application.empty() && cred->extra_info.empty());
-    SessPtr sess = NewSess();
-    ASSERT_NE(sess, nullptr);
-    EXPECT_EQ(sess->next, nullptr);
-    EXPECT_EQ((std::vector<int32_t>{sess->filled, sess->id}), (std::vector<int32_t>{0, -1}));
-    EXPECT_TRUE(sess->access_token.empty() && sess->csrf_token.empty() && sess->extra_info.empty());
-}
-
 // Column names and texts as sqlite3_exec hands them to a callback.
 struct FakeRow {
     std::vector<std::string> names;
@@ -259,16 +243,28 @@ TEST_F(RecordTest, CredRowFirstCopiesColumnsByExactNameOnce) {
     EXPECT_EQ((std::vector<std::string>{cred->host, cred->remote_account, cred->extra_info}),
               (std::vector<std::string>{"", "acct", "extra"}));
 
-    // Names match exactly; integers out of range saturate instead of wrapping.
+    // Names match exactly.
     CredPtr other = NewCred();
-    FakeRow odd({"ID", "Host", "hostname", "host", "owner", "port", "ctime", "mtime"},
-                {"5", "upper", "longer", "exact", "-99999999999", "99999999999", "4294967297",
-                 "-2147483648"});
+    FakeRow odd({"ID", "Host", "hostname", "host"}, {"5", "upper", "longer", "exact"});
     odd.Feed(CredRowFirst, other.get());
     EXPECT_EQ(other->host, "exact");
-    EXPECT_EQ(
-        (std::vector<int32_t>{other->id, other->owner, other->port, other->ctime, other->mtime}),
-        (std::vector<int32_t>{-1, INT32_MIN, INT32_MAX, INT32_MAX, INT32_MIN}));
+    EXPECT_EQ(other->id, -1);
+    // Integers convert as strtol does; out of range they saturate instead of wrapping.
+    const std::pair<const char *, int32_t> kIntegers[] = {{"1700000000", 1700000000},
+                                                          {"-2147483648", INT32_MIN},
+                                                          {"2147483648", INT32_MAX},
+                                                          {"-4294967297", INT32_MIN},
+                                                          {"99999999999999999999", INT32_MAX},
+                                                          {"000000000000000000042", 42},
+                                                          {"12abc", 12},
+                                                          {" \t+42", 42},
+                                                          {"-", 0},
+                                                          {"", 0}};
+    for (const auto &[text, value] : kIntegers) {
+        CredPtr converted = NewCred();
+        FakeRow({"port"}, {text}).Feed(CredRowFirst, converted.get());
+        EXPECT_EQ(converted->port, value) << text;
+    }
     CredPtr empty = NewCred();
     FakeRow none({}, {});
     none.Feed(CredRowFirst, empty.get());
@@ -318,7 +314,30 @@ TEST_F(RecordTest, SessionRowCallbacksSkipMtime) {
     EXPECT_EQ(sess->extra_info, "e");
 }
 
-TEST_F(RecordTest, ClearFreesTheChainAndResets) {
+// Every member but `next`, so that two records compare whole.
+std::vector<std::string> Members(const KOVA_CRED &c) {
+    std::vector<std::string> out{c.host,     c.remote_account, c.remote_passwd,
+                                 c.protocol, c.application,    c.extra_info};
+    for (int32_t value : {c.filled, c.id, c.ctime, c.mtime, c.owner, c.port}) {
+        out.push_back(std::to_string(value));
+    }
+    return out;
+}
+
+TEST_F(RecordTest, AllocationDefaultsAndClearingBackToThem) {
+    CredPtr fresh = NewCred();
+    ASSERT_NE(fresh, nullptr);
+    EXPECT_EQ(KOVACredNext(fresh.get()), nullptr);
+    EXPECT_EQ(Members(*fresh),
+              (std::vector<std::string>{"", "", "", "", "", "", "0", "-1", "0", "0", "-1", "0"}));
+    SessPtr freshSess = NewSess();
+    ASSERT_NE(freshSess, nullptr);
+    EXPECT_EQ(freshSess->next, nullptr);
+    EXPECT_EQ((std::vector<int32_t>{freshSess->filled, freshSess->id}),
+              (std::vector<int32_t>{0, -1}));
+    EXPECT_TRUE(freshSess->access_token.empty() && freshSess->csrf_token.empty() &&
+                freshSess->extra_info.empty());
+
     KOVA_CRED *head = nullptr;
     for (const char *id : {"1", "2", "3"}) {
         FakeRow row = CredRow(id, "h");
@@ -326,9 +345,7 @@ TEST_F(RecordTest, ClearFreesTheChainAndResets) {
     }
     EXPECT_EQ(KOVACredClear(head), 0);  // ASan reports a leak if the chain is not freed
     EXPECT_EQ(head->next, nullptr);
-    EXPECT_EQ((std::vector<int32_t>{head->filled, head->id, head->owner, head->port, head->ctime}),
-              (std::vector<int32_t>{0, -1, -1, 0, 0}));
-    EXPECT_TRUE(head->host.empty() && head->extra_info.empty() && head->remote_passwd.empty());
+    EXPECT_EQ(Members(*head), Members(*fresh));
     EXPECT_EQ(KOVACredFree(head), 0);
 
     KOVA_CRED_SESS *sessHead = nullptr;
@@ -348,7 +365,7 @@ TEST_F(RecordTest, ClearFreesTheChainAndResets) {
     EXPECT_EQ(VLIBCErrGet(), 0);
 }
 
-TEST_F(RecordTest, FailedAllocationsAreReported) {
+TEST_F(RecordTest, FailedAllocationsAndNullRecords) {
     KOVA_CRED *cred;
     KOVA_CRED_SESS *sess;
     {
@@ -365,9 +382,8 @@ TEST_F(RecordTest, FailedAllocationsAreReported) {
         (std::vector<std::string>{
             std::string("cred_alloc:9 Allocate KOVA_CRED failed. ") + strerror(ENOMEM),
             std::string("cred_sess_alloc:9 Allocate KOVA_CRED_SESS failed. ") + strerror(ENOMEM)}));
-}
 
-TEST_F(RecordTest, FreeAndNextOfNullRecords) {
+    kova_test::ClearLog();
     EXPECT_EQ(KOVACredFree(nullptr), -1);
     EXPECT_TRUE(ArgErrorReported("cred_alloc", 19, "__null != pCred"));
     kova_test::ClearLog();
@@ -375,8 +391,6 @@ TEST_F(RecordTest, FreeAndNextOfNullRecords) {
     EXPECT_TRUE(ArgErrorReported("cred_sess_alloc", 19, "__null != pSess"));
     EXPECT_EQ(KOVACredNext(nullptr), nullptr);
     EXPECT_EQ(KOVACredSessNext(nullptr), nullptr);
-    CredPtr last = NewCred();
-    EXPECT_EQ(KOVACredNext(last.get()), nullptr);
 }
 
 }  // namespace

@@ -12,7 +12,7 @@ using namespace store_test;
 
 using SessionTest = StoreTest;
 
-TEST_F(SessionTest, SaveWithTheCredentialIdStoresAndReplaces) {
+TEST_F(SessionTest, SaveWithTheCredentialIdStoresAndReplacesSetByIdTakesItsId) {
     int id = AddCred("h");
     SessPtr sess = MakeSess(id, "sid-1", "tok-1");
     EXPECT_EQ(KOVACredSessSave(sess.get()), 0) << kova_test::LogDump();
@@ -36,17 +36,14 @@ TEST_F(SessionTest, SaveWithTheCredentialIdStoresAndReplaces) {
     EXPECT_EQ(loaded->filled, 1);
     EXPECT_EQ(loaded->access_token, "sid-2");
     EXPECT_EQ(loaded->csrf_token, "tok-2");
-    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
-}
 
-TEST_F(SessionTest, SetByIdWritesUnderTheGivenId) {
-    int first = AddCred("a");
-    int second = AddCred("b");
-    SessPtr sess = MakeSess(first, "s", "t");  // the record's id is not used by SetByID
-    EXPECT_EQ(KOVACredSessSetByID(second, sess.get()), 0);
-    EXPECT_EQ(Query("SELECT id FROM credential_sessions;"),
-              (std::vector<Row>{{std::to_string(second)}}));
-    EXPECT_EQ(sess->id, first);
+    // SetByID writes under the id it is given, not the record's.
+    int other = AddCred("b");
+    EXPECT_EQ(KOVACredSessSetByID(other, sess.get()), 0);
+    EXPECT_EQ(Query("SELECT id FROM credential_sessions WHERE access_token='sid-2';"),
+              (std::vector<Row>{{std::to_string(id)}, {std::to_string(other)}}));
+    EXPECT_EQ(sess->id, id);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
 }
 
 TEST_F(SessionTest, SetForAMissingCredentialFailsOnTheForeignKey) {
