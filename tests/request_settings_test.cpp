@@ -29,6 +29,14 @@ void *operator new(size_t size) {
     }
     return p;
 }
+// The library's records come from the nothrow form; it takes its memory where the other does.
+void *operator new(size_t size, const std::nothrow_t &) noexcept {
+    try {
+        return ::operator new(size);
+    } catch (const std::bad_alloc &) {
+        return nullptr;
+    }
+}
 // The replaced operator new takes its memory from malloc, so delete gives it back with free.
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wmismatched-new-delete"
