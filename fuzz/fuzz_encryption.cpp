@@ -2,14 +2,10 @@
 // becomes the RSA envelope of a login's parameters (cipher field name, server time member and
 // public key all from the answer), and the AES envelope is made with a token and key from the
 // answer too, and must decrypt to the pair text it wraps.
-#include <stddef.h>
-#include <stdint.h>
 #include <stdio.h>
-#include <stdlib.h>
 #include <string.h>
 
-#include <string>
-
+#include "fuzz_target.h"
 #include "kovacredential/cred_request_util.h"
 #include "kovacredential/kovaplatform.h"
 #include "platform/json_text.h"
@@ -31,18 +27,15 @@ int FuzzTokens(char *token, size_t tokenSize, char *key, size_t keySize) {
 
 }  // namespace
 
-extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
-    const std::string text(reinterpret_cast<const char *>(data), size);
+KOVA_FUZZ_TARGET(text) {
     Json::Value info;
     if (!KOVA::ReadEncInfoAnswer(text, info)) {
-        return 0;
+        return;
     }
     Json::Value root;
-    if (!kova::JsonFromLenientText(text, root, false) || !(info == root["data"])) {
-        abort();
-    }
+    Require(kova::JsonFromLenientText(text, root, false) && info == root["data"]);
     if (!info.isObject()) {
-        return 0;  // the RSA envelope refuses such information before using it
+        return;  // the RSA envelope refuses such information before using it
     }
 
     KOVA::CredRequest request;
@@ -55,10 +48,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     std::string value;
     if (p.GetRSAEncParam(params, info, name, value)) {
         const Json::Value &cipherKey = info["cipherkey"];
-        if (name != (cipherKey.isString() ? cipherKey.asString() : std::string()) ||
-            value.empty()) {
-            abort();
-        }
+        Require(name == (cipherKey.isString() ? cipherKey.asString() : std::string()) &&
+                !value.empty());
     }
 
     gToken = kova::JsonText(info["token"]);
@@ -77,11 +68,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
         std::string plain;
         KOVA::WebAPIUtil::JsonObjTostrPair(info, pairs, true, false);
         const std::string key = gKey.substr(0, strnlen(gKey.c_str(), 32));
-        if (textName != "__tXeTrEhPiC" || tokenName != "__nEkOtReHpIc" ||
-            !KOVA::CredRequestUtil::GetDecryptAESString(key, cipher, plain) ||
-            plain != pairs.substr(0, strnlen(pairs.c_str(), pairs.size()))) {
-            abort();
-        }
+        Require(textName == "__tXeTrEhPiC" && tokenName == "__nEkOtReHpIc" &&
+                KOVA::CredRequestUtil::GetDecryptAESString(key, cipher, plain) &&
+                plain == pairs.substr(0, strnlen(pairs.c_str(), pairs.size())));
     }
-    return 0;
 }
