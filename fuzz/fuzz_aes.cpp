@@ -17,8 +17,7 @@ KOVA_FUZZ_TARGET(input) {
     // A failed decryption leaves the output alone.
     Require(KOVA::CredRequestUtil::GetDecryptAESString(passphrase, text, plain) ||
             plain == "unset");
-    std::string cipher;
-    std::string back;
+    std::string cipher, back;
     Require(KOVA::CredRequestUtil::GetEncryptAESString(passphrase, text, cipher) &&
             KOVA::CredRequestUtil::GetDecryptAESString(passphrase, cipher, back) &&
             back == text.substr(0, strnlen(text.c_str(), text.size())));

@@ -44,8 +44,7 @@ KOVA_FUZZ_TARGET(text) {
     params["account"] = "admin";
     params["passwd"] = "secret";
     params["format"] = "sid";
-    std::string name;
-    std::string value;
+    std::string name, value;
     if (p.GetRSAEncParam(params, info, name, value)) {
         const Json::Value &cipherKey = info["cipherkey"];
         Require(name == (cipherKey.isString() ? cipherKey.asString() : std::string()) &&
@@ -55,17 +54,13 @@ KOVA_FUZZ_TARGET(text) {
     gToken = kova::JsonText(info["token"]);
     gKey = kova::JsonText(info["key"]);
     KOVACloudServiceHxtokenSetProvider(FuzzTokens);
-    std::string textName;
-    std::string cipher;
-    std::string tokenName;
-    std::string token;
+    std::string textName, cipher, tokenName, token;
     const bool aes = p.GetAESEncParam(info, textName, cipher, tokenName, token);
     KOVACloudServiceHxtokenSetProvider(nullptr);
     if (aes) {
         // The envelope opens with the key the token service gave, to the pairs it wraps (cut
         // at a NUL, as every decrypted text is).
-        std::string pairs;
-        std::string plain;
+        std::string pairs, plain;
         KOVA::WebAPIUtil::JsonObjTostrPair(info, pairs, true, false);
         const std::string key = gKey.substr(0, strnlen(gKey.c_str(), 32));
         Require(textName == "__tXeTrEhPiC" && tokenName == "__nEkOtReHpIc" &&

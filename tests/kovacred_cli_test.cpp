@@ -439,11 +439,17 @@ TEST_F(KovacredTest, CompletionOffersCommandsOptionsIdsAndFiles) {
     std::ofstream(db_.dir().File("calls.json")) << "[]";
     const std::string db = db_.path();
     const std::string dir = db_.dir().path();
-    struct Case {
-        std::string line;  // after "kovacred "
-        std::string candidates;
-    };
-    const Case cases[] = {
+    const std::string script = db_.dir().File("complete.sh");
+    std::ofstream(script) << "source /usr/share/bash-completion/bash_completion\n"
+                             "source " KOVA_SOURCE_DIR
+                             "/tools/kovacred/kovacred.bash\n"
+                             "COMP_LINE=\"$1\"\nCOMP_POINT=${#COMP_LINE}\n"
+                             "read -ra COMP_WORDS <<< \"$COMP_LINE\"\n"
+                             "[[ $COMP_LINE == *' ' ]] && COMP_WORDS+=('')\n"
+                             "COMP_CWORD=$((${#COMP_WORDS[@]} - 1))\n"
+                             "_kovacred\necho \"${COMPREPLY[*]}\"\n";
+    const std::pair<std::string, std::string> cases[] = {
+        // the line after "kovacred ", and the candidates offered
         {"se", "session"},
         {"session ", "show set remove"},
         {"--db " + db + " show ", "1 2"},
@@ -456,23 +462,12 @@ TEST_F(KovacredTest, CompletionOffersCommandsOptionsIdsAndFiles) {
         {"batch " + dir + "/ca", dir + "/calls.json"},
         {"request -o " + dir + "/ca", dir + "/calls.json"},
     };
-    for (const Case &c : cases) {
-        const std::string script =
-            "source /usr/share/bash-completion/bash_completion\n"
-            "source " KOVA_SOURCE_DIR
-            "/tools/kovacred/kovacred.bash\n"
-            "COMP_LINE=" +
-            Quote(std::string(KOVACRED_BIN) + " " + c.line) +
-            "\nCOMP_POINT=${#COMP_LINE}\n"
-            "read -ra COMP_WORDS <<< \"$COMP_LINE\"\n"
-            "[[ $COMP_LINE == *' ' ]] && COMP_WORDS+=('')\n"
-            "COMP_CWORD=$((${#COMP_WORDS[@]} - 1))\n"
-            "_kovacred\n"
-            "echo \"${COMPREPLY[*]}\"\n";
-        std::ofstream(db_.dir().File("complete.sh")) << script;
+    for (const auto &c : cases) {
         std::string out;
-        EXPECT_EQ(RunCommand("bash " + db_.dir().File("complete.sh") + " 2>&1", &out), 0);
-        EXPECT_EQ(out, c.candidates + "\n") << c.line;
+        EXPECT_EQ(
+            RunCommand("bash " + script + " " + Quote(KOVACRED_BIN " " + c.first) + " 2>&1", &out),
+            0);
+        EXPECT_EQ(out, c.second + "\n") << c.first;
     }
     EXPECT_FALSE(std::ifstream(dir + "/absent.sqlite").good()) << "completion made a database";
 }

@@ -30,7 +30,7 @@ class RelayConfig : public ::testing::Test {
 
 using kova_test::ParseJson;
 
-TEST_F(RelayConfig, ServiceIdsSelectTheirProtocol) {
+TEST_F(RelayConfig, ServiceIdsSelectTheirProtocolAndServerIdsCarryTheirMd5) {
     kova_test::ClearLog();
     CredRequestFarlinkPrivate client(nullptr);
     EXPECT_EQ(client.GetServiceId(), "zon");
@@ -55,10 +55,8 @@ TEST_F(RelayConfig, ServiceIdsSelectTheirProtocol) {
     EXPECT_EQ(kova_test::LogRecords().back().rfind("cred_request_farlink_conn:", 0), 0u)
         << kova_test::LogDump();
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
-}
 
-TEST_F(RelayConfig, ServerIdCarriesItsLowerCaseMd5) {
-    CredRequestFarlinkPrivate client(nullptr);
+    // The server id carries its lower-case MD5.
     client.SetServerId("abc");
     EXPECT_EQ(client.GetServerId(), "abc");
     EXPECT_EQ(client.GetServerIdMd5(), "900150983cd24fb0d6963f7d28e17f72");
@@ -80,7 +78,7 @@ TEST_F(RelayConfig, ServerIdCarriesItsLowerCaseMd5) {
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":401})"));
 }
 
-TEST_F(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuild) {
+TEST_F(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuildAndClearRestoresIt) {
     unsetenv("kovacredential_farlink_server");
     EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
     setenv("kovacredential_farlink_server", "", 1);
@@ -89,10 +87,8 @@ TEST_F(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuild) {
     setenv("kovacredential_farlink_global", "global.example", 1);
     EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), "dir.example");
     EXPECT_EQ(CredRequestFarlinkPrivate::GlobalServerName(), "global.example");
-}
 
-TEST_F(RelayConfig, ClearRestoresConnectionSettingsOnly) {
-    setenv("kovacredential_farlink_server", "dir.example", 1);
+    // Clear restores the connection settings only.
     CredRequestFarlinkPrivate client(nullptr);
     client.SetServerId("abc");
     client.SetServiceId("zon_portal_https");
@@ -111,7 +107,7 @@ TEST_F(RelayConfig, ClearRestoresConnectionSettingsOnly) {
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":"kept"})"));
 }
 
-TEST_F(RelayConfig, ErrorDocumentsAndAnswerChecks) {
+TEST_F(RelayConfig, ErrorDocumentsAnswerChecksAndPreparedRequests) {
     // The error document carries the detail only when there is one.
     CredRequestFarlink client;
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":0})"));
@@ -133,37 +129,34 @@ TEST_F(RelayConfig, ErrorDocumentsAndAnswerChecks) {
     EXPECT_TRUE(core.CheckResponse("{\"errno\":0,\"sites\":[\"s\"]}", &out));
     EXPECT_EQ(out, ParseJson(R"({"errno":0,"sites":["s"]})"));
     EXPECT_EQ(core.GetError(), KOVA::CRED_REQ_ERR_NONE);
-}
 
-TEST_F(RelayConfig, PreparedRequestNeedsAHostAndABody) {
-    // A missing directory host is reported before an empty body.
-    CredRequestFarlinkPrivate client(nullptr);
-    client.SetServerName("");
-    EXPECT_EQ(client.CreateFarlinkRequest(Json::Value()), nullptr);
-    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_SERVICE_ID);
+    // A prepared request needs a directory host (reported first), then a body.
+    core.SetServerName("");
+    EXPECT_EQ(core.CreateFarlinkRequest(Json::Value()), nullptr);
+    EXPECT_EQ(core.GetError(), KOVA::CRED_REQ_ERR_NO_SERVICE_ID);
     Json::Value body = ParseJson(R"({"version":1})");
     Json::Value answer;
     // Sending reports any failure to make the request as 22 with the document.
-    EXPECT_FALSE(client.SendFarlinkRequest(body, answer));
-    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":22,"error":{"version":1}})"));
-    client.SetServerName("dir.example");
-    EXPECT_EQ(client.CreateFarlinkRequest(Json::Value(Json::objectValue)), nullptr);
-    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_EMPTY_REQUEST);
+    EXPECT_FALSE(core.SendFarlinkRequest(body, answer));
+    EXPECT_EQ(core.GetErrors(), ParseJson(R"({"code":22,"error":{"version":1}})"));
+    core.SetServerName("dir.example");
+    EXPECT_EQ(core.CreateFarlinkRequest(Json::Value(Json::objectValue)), nullptr);
+    EXPECT_EQ(core.GetError(), KOVA::CRED_REQ_ERR_EMPTY_REQUEST);
 
     // The port is explicit; the response time-out is set only when positive.
-    std::unique_ptr<CredRequest> request(client.CreateFarlinkRequest(body));
+    std::unique_ptr<CredRequest> request(core.CreateFarlinkRequest(body));
     ASSERT_TRUE(request);
     EXPECT_EQ(request->GetURL().rfind("http://dir.example:80/", 0), 0u) << request->GetURL();
     EXPECT_EQ(request->GetResponseTimeout(), 5);
     const std::pair<int, int> timeouts[] = {{0, 120}, {-3, 120}, {42, 42}};
     for (const auto &row : timeouts) {
-        client.SetTimeout(row.first);
-        request.reset(client.CreateFarlinkRequest(body));
+        core.SetTimeout(row.first);
+        request.reset(core.CreateFarlinkRequest(body));
         ASSERT_TRUE(request);
         EXPECT_EQ(request->GetResponseTimeout(), row.second) << row.first;
     }
-    client.SetHTTPS(true, false);
-    request.reset(client.CreateFarlinkRequest(body));
+    core.SetHTTPS(true, false);
+    request.reset(core.CreateFarlinkRequest(body));
     EXPECT_EQ(request->GetURL().rfind("https://dir.example:443/", 0), 0u) << request->GetURL();
 }
 
