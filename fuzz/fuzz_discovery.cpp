@@ -3,19 +3,14 @@
 // texts, and an API it does not describe fails without a cache entry of its own. The
 // credential's scheme is one libcurl does not speak, so a look-up that queries the server
 // again fails at once without any network use.
-#include <stddef.h>
-#include <stdint.h>
-#include <stdlib.h>
-
-#include <string>
 #include <vector>
 
+#include "fuzz_target.h"
 #include "kovacredential/cred_request_util.h"
 #include "platform/json_text.h"
 #include "request/cred_request_util_p.h"
 
-extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
-    const std::string text(reinterpret_cast<const char *>(data), size);
+KOVA_FUZZ_TARGET(text) {
     KOVA_CRED cred;
     cred.id = 7;
     cred.protocol = "kova-fuzz";
@@ -25,16 +20,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     const bool stored = KOVA::StoreWebAPIDescAnswer("7", text);
     Json::Value answer;
     const bool success = kova::JsonFromString(text, answer) && kova::JsonIsSuccess(answer);
-    if (stored != success || stored != KOVA::CredRequestUtil::IsCredIdCached(7)) {
-        abort();
-    }
+    Require(stored == success && stored == KOVA::CredRequestUtil::IsCredIdCached(7));
     if (!stored) {
-        return 0;
+        return;
     }
     const Json::Value desc = answer["data"];
-    if (!(KOVA::CredRequestUtil::m_jsData["webapiDesc"]["7"] == desc)) {
-        abort();
-    }
+    Require(KOVA::CredRequestUtil::m_jsData["webapiDesc"]["7"] == desc);
     std::vector<std::string> apis{"KOVA.API.Missing"};
     if (desc.isObject()) {
         for (const std::string &name : desc.getMemberNames()) {
@@ -50,22 +41,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
         const bool formatFound = KOVA::CredRequestUtil::GetWebAPIRequestFormat(&cred, api, format);
         if (entry.empty()) {
             // Not described: the look-ups query the server again, which fails.
-            if (!path.empty() || formatFound) {
-                abort();
-            }
+            Require(path.empty() && !formatFound);
             continue;
         }
         const Json::Value none;
-        const Json::Value &pathValue = entry.isObject() ? entry["path"] : none;
-        const Json::Value &formatValue = entry.isObject() ? entry["requestFormat"] : none;
-        if (path != kova::JsonText(pathValue) || !formatFound ||
-            format != kova::JsonText(formatValue)) {
-            abort();
-        }
+        Require(path == kova::JsonText(entry.isObject() ? entry["path"] : none) && formatFound &&
+                format == kova::JsonText(entry.isObject() ? entry["requestFormat"] : none));
     }
     KOVA::CredRequestUtil::RemoveWebAPIDesc(&cred);
-    if (KOVA::CredRequestUtil::IsCredIdCached(7)) {
-        abort();
-    }
-    return 0;
+    Require(!KOVA::CredRequestUtil::IsCredIdCached(7));
 }

@@ -2,14 +2,10 @@
 // becomes the RSA envelope of a login's parameters (cipher field name, server time member and
 // public key all from the answer), and the AES envelope is made with a token and key from the
 // answer too, and must decrypt to the pair text it wraps.
-#include <stddef.h>
-#include <stdint.h>
 #include <stdio.h>
-#include <stdlib.h>
 #include <string.h>
 
-#include <string>
-
+#include "fuzz_target.h"
 #include "kovacredential/cred_request_util.h"
 #include "kovacredential/kovaplatform.h"
 #include "platform/json_text.h"
@@ -31,18 +27,15 @@ int FuzzTokens(char *token, size_t tokenSize, char *key, size_t keySize) {
 
 }  // namespace
 
-extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
-    const std::string text(reinterpret_cast<const char *>(data), size);
+KOVA_FUZZ_TARGET(text) {
     Json::Value info;
     if (!KOVA::ReadEncInfoAnswer(text, info)) {
-        return 0;
+        return;
     }
     Json::Value root;
-    if (!kova::JsonFromLenientText(text, root, false) || !(info == root["data"])) {
-        abort();
-    }
+    Require(kova::JsonFromLenientText(text, root, false) && info == root["data"]);
     if (!info.isObject()) {
-        return 0;  // the RSA envelope refuses such information before using it
+        return;  // the RSA envelope refuses such information before using it
     }
 
     KOVA::CredRequest request;
@@ -51,37 +44,27 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     params["account"] = "admin";
     params["passwd"] = "secret";
     params["format"] = "sid";
-    std::string name;
-    std::string value;
+    std::string name, value;
     if (p.GetRSAEncParam(params, info, name, value)) {
         const Json::Value &cipherKey = info["cipherkey"];
-        if (name != (cipherKey.isString() ? cipherKey.asString() : std::string()) ||
-            value.empty()) {
-            abort();
-        }
+        Require(name == (cipherKey.isString() ? cipherKey.asString() : std::string()) &&
+                !value.empty());
     }
 
     gToken = kova::JsonText(info["token"]);
     gKey = kova::JsonText(info["key"]);
     KOVACloudServiceHxtokenSetProvider(FuzzTokens);
-    std::string textName;
-    std::string cipher;
-    std::string tokenName;
-    std::string token;
+    std::string textName, cipher, tokenName, token;
     const bool aes = p.GetAESEncParam(info, textName, cipher, tokenName, token);
     KOVACloudServiceHxtokenSetProvider(nullptr);
     if (aes) {
         // The envelope opens with the key the token service gave, to the pairs it wraps (cut
         // at a NUL, as every decrypted text is).
-        std::string pairs;
-        std::string plain;
+        std::string pairs, plain;
         KOVA::WebAPIUtil::JsonObjTostrPair(info, pairs, true, false);
         const std::string key = gKey.substr(0, strnlen(gKey.c_str(), 32));
-        if (textName != "__tXeTrEhPiC" || tokenName != "__nEkOtReHpIc" ||
-            !KOVA::CredRequestUtil::GetDecryptAESString(key, cipher, plain) ||
-            plain != pairs.substr(0, strnlen(pairs.c_str(), pairs.size()))) {
-            abort();
-        }
+        Require(textName == "__tXeTrEhPiC" && tokenName == "__nEkOtReHpIc" &&
+                KOVA::CredRequestUtil::GetDecryptAESString(key, cipher, plain) &&
+                plain == pairs.substr(0, strnlen(pairs.c_str(), pairs.size())));
     }
-    return 0;
 }

@@ -1,17 +1,9 @@
 // kovacred as a user runs it: against a kovasim process and a temporary database, every
 // command's text and --json output, the failure lines and exit statuses, the batch summary
 // and progress, streamed request bodies, the shell completion and the manual page.
-#include <fcntl.h>
-#include <poll.h>
-#include <pty.h>
-#include <signal.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <fstream>
 #include <memory>
-#include <random>
 #include <regex>
 #include <set>
 #include <sstream>
@@ -42,13 +34,6 @@ struct Result {
     std::string err;
 };
 
-std::string ReadFile(const std::string &path) {
-    std::ifstream in(path, std::ios::binary);
-    std::stringstream text;
-    text << in.rdbuf();
-    return text.str();
-}
-
 Json::Value ParseOut(const std::string &text) {
     Json::Value value;
     EXPECT_TRUE(kova::JsonFromString(text.substr(0, text.find_last_not_of('\n') + 1), value))
@@ -70,16 +55,11 @@ class KovacredTest : public ::testing::Test {
   protected:
     static void SetUpTestSuite() {
         simDir_ = new TempDir();
-        Json::Value config;
-        Json::Value &accounts = config["webapi"]["accounts"];
-        accounts[0]["account"] = "admin";
-        accounts[0]["password"] = "secret";
-        accounts[1]["account"] = "otpuser";
-        accounts[1]["password"] = "secret";
-        accounts[1]["otp"] = "123456";
-        accounts[2]["account"] = "keeper";
-        accounts[2]["password"] = kPassword;
-        std::ofstream(simDir_->File("sim.json")) << kova::JsonToString(config);
+        std::ofstream(simDir_->File("sim.json"))
+            << R"({"webapi": {"accounts": [{"account": "admin", "password": "secret"},
+                  {"account": "otpuser", "password": "secret", "otp": "123456"},
+                  {"account": "keeper", "password": ")"
+            << kPassword << "\"}]}}";
         sim_ = new SimProcess(*simDir_, "--config " + simDir_->File("sim.json"));
     }
     static void TearDownTestSuite() {
@@ -114,12 +94,9 @@ class KovacredTest : public ::testing::Test {
     }
 
     TempDatabase db_;
-    static TempDir *simDir_;
-    static SimProcess *sim_;
+    static inline TempDir *simDir_ = nullptr;
+    static inline SimProcess *sim_ = nullptr;
 };
-
-TempDir *KovacredTest::simDir_ = nullptr;
-SimProcess *KovacredTest::sim_ = nullptr;
 
 TEST_F(KovacredTest, VersionNamesTheLibrariesTheToolsRunWith) {
     const std::string libraries = std::string("libcurl ") +
@@ -190,36 +167,34 @@ TEST_F(KovacredTest, StoreCommandsPrintTextOrJson) {
 
 TEST_F(KovacredTest, FailuresPrintOneLineWithTheCodesNameAndExitNonZero) {
     Add("admin", "secret");
-    struct Case {
+    const struct {
         std::string args;
-        std::string input;
         int status;
         std::string err;
-    };
-    const Case cases[] = {
-        {"show 42", "", 1, "kovacred: show: no credential with id 42\n"},
-        {"remove 42", "", 1, "kovacred: remove: no credential with id 42\n"},
-        {"add --host h --port 1 --account a", "", 1,
+    } cases[] = {
+        {"show 42", 1, "kovacred: show: no credential with id 42\n"},
+        {"remove 42", 1, "kovacred: remove: no credential with id 42\n"},
+        {"add --host h --port 1 --account a", 1,
          "kovacred: add: no password on standard input (give it as one line)\n"},
-        {"session show 1", "", 1, "kovacred: session show: no session for credential 1\n"},
-        {"session remove 1", "", 1, "kovacred: session remove: no session for credential 1\n"},
-        {"session set 9 --sid x", "", 1, "kovacred: session set: no credential with id 9\n"},
-        {"call 9 KOVA.Demo.Echo 1 echo", "", 1, "kovacred: call failed: no credential with id 9\n"},
-        {"logout 1", "", 1, "kovacred: logout failed: no stored session for credential 1\n"},
-        {"call 1 KOVA.No.Such 1 get", "", 6,
+        {"session show 1", 1, "kovacred: session show: no session for credential 1\n"},
+        {"session remove 1", 1, "kovacred: session remove: no session for credential 1\n"},
+        {"session set 9 --sid x", 1, "kovacred: session set: no credential with id 9\n"},
+        {"call 9 KOVA.Demo.Echo 1 echo", 1, "kovacred: call failed: no credential with id 9\n"},
+        {"logout 1", 1, "kovacred: logout failed: no stored session for credential 1\n"},
+        {"call 1 KOVA.No.Such 1 get", 6,
          "kovacred: call KOVA.No.Such failed (error 6 CRED_REQ_ERR_NO_SUCH_API: the server does "
          "not offer the API)\n"},
-        {"request " + Url("/missing"), "", 14,
+        {"request " + Url("/missing"), 14,
          "kovacred: request failed (error 14 CRED_REQ_ERR_HTTP_CLIENT: HTTP status 400 to 499)\n"},
-        {"probe " + Url("/missing"), "", 5,
+        {"probe " + Url("/missing"), 5,
          "kovacred: probe failed (error 5 CRED_REQ_ERR_QUERY_FAIL: a probe or API-description "
          "query failed)\n"},
-        {"request http://127.0.0.1:1/", "", 20,
+        {"request http://127.0.0.1:1/", 20,
          "kovacred: request failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
          "failed)\n"},
     };
-    for (const Case &c : cases) {
-        Result r = Run(c.args, c.input);
+    for (const auto &c : cases) {
+        Result r = Run(c.args);
         EXPECT_EQ(r.status, c.status) << c.args << ": " << r.err;
         EXPECT_EQ(r.err, c.err) << c.args;
         EXPECT_EQ(r.out, "") << c.args;
@@ -293,21 +268,12 @@ TEST_F(KovacredTest, SecretsAppearOnlyInSessionShow) {
     const std::string batch = R"([{"cred": 1, "api": "KOVA.Demo.Echo", "version": 1,
                                   "method": "echo", "params": {"p": ")" +
                               std::string(kPassword) + "\"}}]";
-    const std::string commands[] = {"list",
-                                    "list --json",
-                                    "show 1",
-                                    "show 1 --json",
-                                    "apis 1",
-                                    "apis 1 --json",
-                                    "batch -",
-                                    "batch - --json",
-                                    "login 1",
-                                    "call 1 KOVA.Demo.Echo 1 echo",
-                                    "call 1 KOVA.Demo.Echo 1 echo --json",
-                                    "logout 1"};
     std::set<std::string> secrets = {kPassword};
     bool echoed = false;
-    for (const std::string &command : commands) {
+    for (const std::string command :
+         {"list", "list --json", "show 1", "show 1 --json", "apis 1", "apis 1 --json", "batch -",
+          "batch - --json", "login 1", "call 1 KOVA.Demo.Echo 1 echo",
+          "call 1 KOVA.Demo.Echo 1 echo --json", "logout 1"}) {
         Result r = Run(command, command.rfind("batch", 0) == 0 ? batch : "");
         EXPECT_TRUE(r.status == 0) << command << ": " << r.err;
         KOVA_CRED_SESS sess;
@@ -394,42 +360,22 @@ TEST_F(KovacredTest, BatchSummarisesEveryCallAndFailsWhenOneDoes) {
     EXPECT_EQ(r.err, "kovacred: batch: standard input must hold a JSON array of calls\n");
 }
 
-// Progress goes to standard error only on a terminal, and ends on the final counts.
+// Progress goes to standard error only on a terminal, and ends on the final counts. script(1)
+// runs the batch on a terminal of its own and copies what reaches it.
 TEST_F(KovacredTest, BatchShowsProgressOnATerminal) {
     Add("admin", "secret");
-    const std::string calls = R"([{"cred": 1, "api": "KOVA.Demo.Delay", "version": 1,
-        "method": "wait", "params": {"ms": "1500"}}, {"url": ")" +
-                              Url("/missing") + "\"}]";
     const std::string file = db_.dir().File("calls.json");
-    std::ofstream(file) << calls;
+    std::ofstream(file) << R"([{"cred": 1, "api": "KOVA.Demo.Delay", "version": 1,
+        "method": "wait", "params": {"ms": "1500"}}, {"url": ")"
+                        << Url("/missing") << "\"}]";
     const std::string out = db_.dir().File("stdout");
-    int master = -1;
-    pid_t pid = forkpty(&master, nullptr, nullptr, nullptr);
-    ASSERT_GE(pid, 0);
-    if (pid == 0) {
-        alarm(60);
-        int fd = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        dup2(fd, STDOUT_FILENO);
-        execl(KOVACRED_BIN, KOVACRED_BIN, "--db", db_.path().c_str(), "batch", file.c_str(),
-              static_cast<char *>(nullptr));
-        _exit(127);
-    }
     std::string terminal;
-    for (int i = 0; i < 300; ++i) {  // at most 30 s
-        struct pollfd p = {master, POLLIN, 0};
-        if (poll(&p, 1, 100) > 0) {
-            char buf[512];
-            ssize_t n = read(master, buf, sizeof(buf));
-            if (n <= 0) {
-                break;
-            }
-            terminal.append(buf, static_cast<size_t>(n));
-        }
-    }
-    close(master);
-    int status = 0;
-    waitpid(pid, &status, 0);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 1) << status;
+    EXPECT_EQ(RunCommand("script -qec " +
+                             Quote("timeout 60 " KOVACRED_BIN " --db " + db_.path() + " batch " +
+                                   file + " >" + out) +
+                             " /dev/null </dev/null",
+                         &terminal),
+              1);
     EXPECT_NE(terminal.find("kovacred: batch: 1/2 done, 1 failed, "), std::string::npos)
         << terminal;
     EXPECT_TRUE(std::regex_search(terminal, std::regex("\rkovacred: batch: 2/2 done, 1 failed, "
@@ -440,14 +386,7 @@ TEST_F(KovacredTest, BatchShowsProgressOnATerminal) {
 
 TEST_F(KovacredTest, RequestStreamsTwentyMegabytesBothWaysByteExact) {
     const std::string in = db_.dir().File("in.bin");
-    {
-        std::mt19937 random(12);
-        std::string data(20 << 20, '\0');
-        for (char &c : data) {
-            c = static_cast<char>(random());
-        }
-        std::ofstream(in, std::ios::binary) << data;
-    }
+    ASSERT_EQ(RunCommand("head -c " + std::to_string(20 << 20) + " /dev/urandom >" + in), 0);
     const std::string out = db_.dir().File("out.bin");
     Result r = Run("request -T " + in + " -o " + out + " " + Url("/raw/echo"));
     ASSERT_EQ(r.status, 0) << r.err;
@@ -500,11 +439,17 @@ TEST_F(KovacredTest, CompletionOffersCommandsOptionsIdsAndFiles) {
     std::ofstream(db_.dir().File("calls.json")) << "[]";
     const std::string db = db_.path();
     const std::string dir = db_.dir().path();
-    struct Case {
-        std::string line;  // after "kovacred "
-        std::string candidates;
-    };
-    const Case cases[] = {
+    const std::string script = db_.dir().File("complete.sh");
+    std::ofstream(script) << "source /usr/share/bash-completion/bash_completion\n"
+                             "source " KOVA_SOURCE_DIR
+                             "/tools/kovacred/kovacred.bash\n"
+                             "COMP_LINE=\"$1\"\nCOMP_POINT=${#COMP_LINE}\n"
+                             "read -ra COMP_WORDS <<< \"$COMP_LINE\"\n"
+                             "[[ $COMP_LINE == *' ' ]] && COMP_WORDS+=('')\n"
+                             "COMP_CWORD=$((${#COMP_WORDS[@]} - 1))\n"
+                             "_kovacred\necho \"${COMPREPLY[*]}\"\n";
+    const std::pair<std::string, std::string> cases[] = {
+        // the line after "kovacred ", and the candidates offered
         {"se", "session"},
         {"session ", "show set remove"},
         {"--db " + db + " show ", "1 2"},
@@ -517,23 +462,12 @@ TEST_F(KovacredTest, CompletionOffersCommandsOptionsIdsAndFiles) {
         {"batch " + dir + "/ca", dir + "/calls.json"},
         {"request -o " + dir + "/ca", dir + "/calls.json"},
     };
-    for (const Case &c : cases) {
-        const std::string script =
-            "source /usr/share/bash-completion/bash_completion\n"
-            "source " KOVA_SOURCE_DIR
-            "/tools/kovacred/kovacred.bash\n"
-            "COMP_LINE=" +
-            Quote(std::string(KOVACRED_BIN) + " " + c.line) +
-            "\nCOMP_POINT=${#COMP_LINE}\n"
-            "read -ra COMP_WORDS <<< \"$COMP_LINE\"\n"
-            "[[ $COMP_LINE == *' ' ]] && COMP_WORDS+=('')\n"
-            "COMP_CWORD=$((${#COMP_WORDS[@]} - 1))\n"
-            "_kovacred\n"
-            "echo \"${COMPREPLY[*]}\"\n";
-        std::ofstream(db_.dir().File("complete.sh")) << script;
+    for (const auto &c : cases) {
         std::string out;
-        EXPECT_EQ(RunCommand("bash " + db_.dir().File("complete.sh") + " 2>&1", &out), 0);
-        EXPECT_EQ(out, c.candidates + "\n") << c.line;
+        EXPECT_EQ(
+            RunCommand("bash " + script + " " + Quote(KOVACRED_BIN " " + c.first) + " 2>&1", &out),
+            0);
+        EXPECT_EQ(out, c.second + "\n") << c.first;
     }
     EXPECT_FALSE(std::ifstream(dir + "/absent.sqlite").good()) << "completion made a database";
 }

@@ -1,6 +1,7 @@
 // The request manager with WebAPI requests against the in-process WebAPI simulator: requests
 // by credential id, by records and by bare server address, discovery under pseudo-ids, and
 // the factories' failures.
+#include <algorithm>
 #include <memory>
 #include <string>
 
@@ -23,18 +24,17 @@ class ManagerWebApiTest : public kova_test::WebApiTest {
     }
 
     // Negative member names left in the description cache.
-    static int PseudoEntries() {
-        int count = 0;
+    static long PseudoEntries() {
         const Json::Value &desc = CredRequestUtil::m_jsData["webapiDesc"];
-        if (!desc.isObject()) {
-            return 0;
-        }
-        for (const std::string &name : desc.getMemberNames()) {
-            if (!name.empty() && name[0] == '-') {
-                ++count;
-            }
-        }
-        return count;
+        const auto names = desc.isObject() ? desc.getMemberNames() : Json::Value::Members();
+        return std::count_if(names.begin(), names.end(),
+                             [](const std::string &name) { return name.rfind('-', 0) == 0; });
+    }
+
+    static Json::Value Word(const std::string &word) {
+        Json::Value params;
+        params["word"] = word;
+        return params;
     }
 
     std::unique_ptr<kovasim::LoopbackServer> plain_;
@@ -51,16 +51,10 @@ TEST_F(ManagerWebApiTest, MixedRequestsRunTogetherInAddingOrder) {
     ASSERT_FALSE(sess.access_token.empty());
 
     CredRequestMgr mgr;
-    Json::Value one;
-    one["word"] = "one";
-    EXPECT_EQ(0, mgr.AddWebAPIRequest(credId, "KOVA.Demo.Echo", 1, "echo", one));
-    Json::Value two;
-    two["word"] = "two";
-    EXPECT_EQ(1, mgr.AddWebAPIRequest(&cred, &sess, "KOVA.Demo.Echo", 2, "echo", two));
-    Json::Value three;
-    three["word"] = "three";
+    EXPECT_EQ(0, mgr.AddWebAPIRequest(credId, "KOVA.Demo.Echo", 1, "echo", Word("one")));
+    EXPECT_EQ(1, mgr.AddWebAPIRequest(&cred, &sess, "KOVA.Demo.Echo", 2, "echo", Word("two")));
     EXPECT_EQ(2, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), sess.access_token,
-                                    "KOVA.Demo.Echo", 1, "echo", three));
+                                    "KOVA.Demo.Echo", 1, "echo", Word("three")));
     auto *plain = new CredRequest();
     ASSERT_TRUE(plain->SetURL(plain_->BaseUrl() + "/plain"));
     EXPECT_EQ(3, mgr.AddCredRequest(plain));
@@ -91,13 +85,11 @@ TEST_F(ManagerWebApiTest, MixedRequestsRunTogetherInAddingOrder) {
     EXPECT_EQ(4u, Sim().Hits("KOVA.Demo.Echo") - echoes_);
 }
 
-TEST_F(ManagerWebApiTest, ServerAddressDiscoversUnderPseudoIdAndDropsIt) {
+TEST_F(ManagerWebApiTest, ServerAddressDiscoversUnderAFreePseudoIdAndDropsIt) {
     CredRequestMgr mgr;
     ASSERT_FALSE(CredRequestUtil::IsCredIdCached(-1));
-    Json::Value params;
-    params["word"] = "x";
     ASSERT_EQ(0, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), "", "KOVA.Demo.Echo", 1,
-                                    "echo", params))
+                                    "echo", Word("x")))
         << kova_test::LogDump();
     EXPECT_EQ(1u, Sim().QueryHits() - queries_);
     EXPECT_FALSE(CredRequestUtil::IsCredIdCached(-1));
@@ -119,19 +111,15 @@ TEST_F(ManagerWebApiTest, ServerAddressDiscoversUnderPseudoIdAndDropsIt) {
     // No session id given: none is sent.
     EXPECT_FALSE(answer["data"]["params"].isMember("_sid"));
     EXPECT_TRUE(ParseBody(mgr.GetResponse(1))["success"].asBool());
-}
 
-TEST_F(ManagerWebApiTest, ServerAddressSkipsPseudoIdsAlreadyCached) {
-    // Whatever sits under -1 must be neither used nor dropped by the manager.
+    // Whatever sits under a pseudo-id must be neither used nor dropped by the manager.
     Json::Value bogus;
     bogus["KOVA.Demo.Echo"]["path"] = "bogus.cgi";
     CredRequestUtil::m_jsData["webapiDesc"]["-1"] = bogus;
-
-    CredRequestMgr mgr;
-    ASSERT_EQ(0, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), "", "KOVA.Demo.Echo", 1,
+    ASSERT_EQ(2, mgr.AddCredRequest("http", "127.0.0.1", Server().Port(), "", "KOVA.Demo.Echo", 1,
                                     "echo", Json::Value()))
         << kova_test::LogDump();
-    EXPECT_EQ(Server().BaseUrl() + "/webapi/entry.cgi", mgr.GetRequest(0)->GetURL());
+    EXPECT_EQ(Server().BaseUrl() + "/webapi/entry.cgi", mgr.GetRequest(2)->GetURL());
     EXPECT_EQ(bogus, CredRequestUtil::m_jsData["webapiDesc"]["-1"]);
     EXPECT_FALSE(CredRequestUtil::IsCredIdCached(-2));
     EXPECT_EQ(1, PseudoEntries());

@@ -19,26 +19,18 @@ using KOVA::CredRequest;
 using KOVA::CredRequestFarlink;
 using KOVA::CredRequestFarlinkPrivate;
 
-// Sets (or, with nullptr, unsets) an environment variable for the object's lifetime.
-class ScopedEnv {
-  public:
-    ScopedEnv(const char *name, const char *value) : name_(name) {
-        const char *old = getenv(name);
-        hadOld_ = old != nullptr;
-        old_ = old != nullptr ? old : "";
-        value != nullptr ? setenv(name, value, 1) : unsetenv(name);
+// The directory hosts come from the environment, which each test leaves without them.
+class RelayConfig : public ::testing::Test {
+  protected:
+    void TearDown() override {
+        unsetenv("kovacredential_farlink_global");
+        unsetenv("kovacredential_farlink_server");
     }
-    ~ScopedEnv() { hadOld_ ? setenv(name_.c_str(), old_.c_str(), 1) : unsetenv(name_.c_str()); }
-
-  private:
-    std::string name_;
-    bool hadOld_;
-    std::string old_;
 };
 
 using kova_test::ParseJson;
 
-TEST(RelayConfig, ServiceIdsSelectTheirProtocol) {
+TEST_F(RelayConfig, ServiceIdsSelectTheirProtocolAndServerIdsCarryTheirMd5) {
     kova_test::ClearLog();
     CredRequestFarlinkPrivate client(nullptr);
     EXPECT_EQ(client.GetServiceId(), "zon");
@@ -63,10 +55,8 @@ TEST(RelayConfig, ServiceIdsSelectTheirProtocol) {
     EXPECT_EQ(kova_test::LogRecords().back().rfind("cred_request_farlink_conn:", 0), 0u)
         << kova_test::LogDump();
     EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
-}
 
-TEST(RelayConfig, ServerIdCarriesItsLowerCaseMd5) {
-    CredRequestFarlinkPrivate client(nullptr);
+    // The server id carries its lower-case MD5.
     client.SetServerId("abc");
     EXPECT_EQ(client.GetServerId(), "abc");
     EXPECT_EQ(client.GetServerIdMd5(), "900150983cd24fb0d6963f7d28e17f72");
@@ -88,20 +78,17 @@ TEST(RelayConfig, ServerIdCarriesItsLowerCaseMd5) {
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":401})"));
 }
 
-TEST(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuild) {
-    const char *const unsetOrEmpty[] = {nullptr, ""};
-    for (const char *value : unsetOrEmpty) {
-        ScopedEnv env("kovacredential_farlink_server", value);
-        EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
-    }
-    ScopedEnv server("kovacredential_farlink_server", "dir.example");
-    ScopedEnv global("kovacredential_farlink_global", "global.example");
+TEST_F(RelayConfig, DirectoryHostComesFromTheEnvironmentOrTheBuildAndClearRestoresIt) {
+    unsetenv("kovacredential_farlink_server");
+    EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
+    setenv("kovacredential_farlink_server", "", 1);
+    EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), KOVA_DEFAULT_FARLINK_SERVER);
+    setenv("kovacredential_farlink_server", "dir.example", 1);
+    setenv("kovacredential_farlink_global", "global.example", 1);
     EXPECT_EQ(CredRequestFarlinkPrivate(nullptr).GetServerName(), "dir.example");
     EXPECT_EQ(CredRequestFarlinkPrivate::GlobalServerName(), "global.example");
-}
 
-TEST(RelayConfig, ClearRestoresConnectionSettingsOnly) {
-    ScopedEnv server("kovacredential_farlink_server", "dir.example");
+    // Clear restores the connection settings only.
     CredRequestFarlinkPrivate client(nullptr);
     client.SetServerId("abc");
     client.SetServiceId("zon_portal_https");
@@ -120,9 +107,9 @@ TEST(RelayConfig, ClearRestoresConnectionSettingsOnly) {
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":23,"error":"kept"})"));
 }
 
-TEST(RelayConfig, ErrorDocumentCarriesTheDetailOnlyWhenThereIsOne) {
+TEST_F(RelayConfig, ErrorDocumentsAnswerChecksAndPreparedRequests) {
+    // The error document carries the detail only when there is one.
     CredRequestFarlink client;
-    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":0})"));
     client.SetError(KOVA::CRED_REQ_ERR_NO_PORT);
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":405})"));
@@ -130,66 +117,52 @@ TEST(RelayConfig, ErrorDocumentCarriesTheDetailOnlyWhenThereIsOne) {
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":22,"error":20})"));
     client.SetError(KOVA::CRED_REQ_ERR_NO_CONN_INFO, Json::Value(Json::objectValue));
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":402})"));
-}
 
-TEST(RelayConfig, CheckResponseAcceptsOnlyObjectsWithErrnoZero) {
-    CredRequestFarlinkPrivate client(nullptr);
+    // Only objects whose "errno" is 0, or that have none, are accepted, and nothing else is kept.
+    CredRequestFarlinkPrivate core(nullptr);
     Json::Value out = "untouched";
     for (const char *text : {"", "{\"errno\":0", "[0]", "{\"errno\":1}", "{\"errno\":\"x\"}"}) {
-        EXPECT_FALSE(client.CheckResponse(text, &out)) << text;
+        EXPECT_FALSE(core.CheckResponse(text, &out)) << text;
     }
     EXPECT_EQ(out, Json::Value("untouched"));
-    EXPECT_TRUE(client.CheckResponse("{\"a\":1}", nullptr));
-    EXPECT_TRUE(client.CheckResponse("{\"errno\":0,\"sites\":[\"s\"]}", &out));
+    EXPECT_TRUE(core.CheckResponse("{\"a\":1}", nullptr));
+    EXPECT_TRUE(core.CheckResponse("{\"errno\":0,\"sites\":[\"s\"]}", &out));
     EXPECT_EQ(out, ParseJson(R"({"errno":0,"sites":["s"]})"));
-    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
-}
+    EXPECT_EQ(core.GetError(), KOVA::CRED_REQ_ERR_NONE);
 
-TEST(RelayConfig, MissingDirectoryHostIsReportedBeforeAnEmptyBody) {
-    CredRequestFarlinkPrivate client(nullptr);
-    client.SetServerName("");
-    EXPECT_EQ(client.CreateFarlinkRequest(Json::Value()), nullptr);
-    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_SERVICE_ID);
-    client.SetServerName("dir.example");
-    EXPECT_EQ(client.CreateFarlinkRequest(Json::Value(Json::objectValue)), nullptr);
-    EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_EMPTY_REQUEST);
-    // Sending reports any failure to make the request as 22 with the document.
+    // A prepared request needs a directory host (reported first), then a body.
+    core.SetServerName("");
+    EXPECT_EQ(core.CreateFarlinkRequest(Json::Value()), nullptr);
+    EXPECT_EQ(core.GetError(), KOVA::CRED_REQ_ERR_NO_SERVICE_ID);
+    Json::Value body = ParseJson(R"({"version":1})");
     Json::Value answer;
-    client.SetServerName("");
-    Json::Value body(Json::objectValue);
-    body["version"] = 1;
-    EXPECT_FALSE(client.SendFarlinkRequest(body, answer));
-    EXPECT_EQ(client.GetErrors()["code"], 22);
-    EXPECT_EQ(client.GetErrors()["error"], body);
-}
+    // Sending reports any failure to make the request as 22 with the document.
+    EXPECT_FALSE(core.SendFarlinkRequest(body, answer));
+    EXPECT_EQ(core.GetErrors(), ParseJson(R"({"code":22,"error":{"version":1}})"));
+    core.SetServerName("dir.example");
+    EXPECT_EQ(core.CreateFarlinkRequest(Json::Value(Json::objectValue)), nullptr);
+    EXPECT_EQ(core.GetError(), KOVA::CRED_REQ_ERR_EMPTY_REQUEST);
 
-TEST(RelayConfig, PreparedRequestFollowsTimeoutAndHttpsFlag) {
-    Json::Value body(Json::objectValue);
-    body["version"] = 1;
-    CredRequestFarlinkPrivate client(nullptr);
-    client.SetServerName("dir.example");
-    std::unique_ptr<CredRequest> request(client.CreateFarlinkRequest(body));
+    // The port is explicit; the response time-out is set only when positive.
+    std::unique_ptr<CredRequest> request(core.CreateFarlinkRequest(body));
     ASSERT_TRUE(request);
-    EXPECT_EQ(request->GetResponseTimeout(), 5);
     EXPECT_EQ(request->GetURL().rfind("http://dir.example:80/", 0), 0u) << request->GetURL();
-    // The response time-out is set only when positive.
+    EXPECT_EQ(request->GetResponseTimeout(), 5);
     const std::pair<int, int> timeouts[] = {{0, 120}, {-3, 120}, {42, 42}};
     for (const auto &row : timeouts) {
-        client.SetTimeout(row.first);
-        request.reset(client.CreateFarlinkRequest(body));
+        core.SetTimeout(row.first);
+        request.reset(core.CreateFarlinkRequest(body));
         ASSERT_TRUE(request);
         EXPECT_EQ(request->GetResponseTimeout(), row.second) << row.first;
     }
-    client.SetHTTPS(true, false);
-    request.reset(client.CreateFarlinkRequest(body));
-    ASSERT_TRUE(request);
+    core.SetHTTPS(true, false);
+    request.reset(core.CreateFarlinkRequest(body));
     EXPECT_EQ(request->GetURL().rfind("https://dir.example:443/", 0), 0u) << request->GetURL();
-    EXPECT_NE(request->GetURL().find("Serv.php"), std::string::npos);
 }
 
 // The same on the wire: a directory host listening on both 80 and 443 sees plain HTTP on 80
 // and TLS on 443, with nothing on any other port.
-TEST(RelayConfig, DirectoryRequestsReachPort80OrTls443) {
+TEST_F(RelayConfig, DirectoryRequestsReachPort80OrTls443) {
     kovasim::RelaySim sim;
     kovasim::LoopbackServer::Options plainOptions;
     plainOptions.host = kovasim::ProcessLoopbackAddress(0);
@@ -211,7 +184,7 @@ TEST(RelayConfig, DirectoryRequestsReachPort80OrTls443) {
             FAIL() << server->Error();
         }
     }
-    ScopedEnv global("kovacredential_farlink_global", plainOptions.host.c_str());
+    setenv("kovacredential_farlink_global", plainOptions.host.c_str(), 1);
     CredRequestFarlink client;
     Json::Value answer;
     ASSERT_TRUE(client.GetSiteList(answer)) << client.GetErrors().toStyledString();

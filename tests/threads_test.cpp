@@ -20,25 +20,28 @@ namespace {
 using KOVA::CredRequest;
 using KOVA::CredRequestUtil;
 
-// Runs `work(thread, round)` for `rounds` rounds on each of `threads` threads; the number of
-// calls that returned false (each reported on standard error).
-int OnThreads(int threads, int rounds, const std::function<bool(int, int)> &work) {
-    std::atomic<int> failures{0};
-    std::vector<std::thread> pool;
-    for (int t = 0; t < threads; ++t) {
-        pool.emplace_back([&, t] {
-            for (int r = 0; r < rounds; ++r) {
-                if (!work(t, r)) {
-                    fprintf(stderr, "thread %d round %d failed\n", t, r);
-                    ++failures;
+// In a forked child, runs `work(thread, round)` for `rounds` rounds on each of `threads`
+// threads and expects every call to return true (each failure is reported on standard error).
+void ExpectOnThreads(int threads, int rounds, const std::function<bool(int, int)> &work) {
+    const std::string ended = kova_test::RunInChild(60, [&] {
+        std::atomic<int> failures{0};
+        std::vector<std::thread> pool;
+        for (int t = 0; t < threads; ++t) {
+            pool.emplace_back([&, t] {
+                for (int r = 0; r < rounds; ++r) {
+                    if (!work(t, r)) {
+                        fprintf(stderr, "thread %d round %d failed\n", t, r);
+                        ++failures;
+                    }
                 }
-            }
-        });
-    }
-    for (std::thread &thread : pool) {
-        thread.join();
-    }
-    return failures;
+            });
+        }
+        for (std::thread &thread : pool) {
+            thread.join();
+        }
+        return failures.load();
+    });
+    EXPECT_EQ(ended, "exit 0");
 }
 
 class ThreadsWebApiTest : public kova_test::WebApiTest {};
@@ -48,40 +51,27 @@ class ThreadsWebApiTest : public kova_test::WebApiTest {};
 TEST_F(ThreadsWebApiTest, RequestsWithJsonParameters) {
     const KOVA_CRED cred = Cred();
     ASSERT_FALSE(CredRequestUtil::GetWebAPIPath(&cred, "KOVA.Demo.Json").empty());
-    EXPECT_EQ(kova_test::RunInChild(60,
-                                    [&] {
-                                        return OnThreads(8, 20, [&](int t, int r) {
-                                            CredRequest req;
-                                            Json::Value params(Json::objectValue);
-                                            params["n"] = t * 1000 + r;
-                                            params["list"].append(t);
-                                            params["list"].append(1.5);
-                                            if (!CredRequestUtil::SetWebAPIURL(
-                                                    &cred, "KOVA.Demo.Json", 1, "get", &req) ||
-                                                !req.AddPostParam(params) || !req.Process()) {
-                                                return false;
-                                            }
-                                            Json::Value answer;
-                                            return kova::JsonFromString(req.GetResponse(),
-                                                                        answer) &&
-                                                   answer["data"]["params"] == params;
-                                        });
-                                    }),
-              "exit 0");
+    ExpectOnThreads(8, 20, [&](int t, int r) {
+        CredRequest req;
+        Json::Value params(Json::objectValue);
+        params["n"] = t * 1000 + r;
+        params["list"].append(t);
+        params["list"].append(1.5);
+        Json::Value answer;
+        return CredRequestUtil::SetWebAPIURL(&cred, "KOVA.Demo.Json", 1, "get", &req) &&
+               req.AddPostParam(params) && req.Process() &&
+               kova::JsonFromString(req.GetResponse(), answer) &&
+               answer["data"]["params"] == params;
+    });
 }
 
 TEST_F(ThreadsWebApiTest, EncryptionInformation) {
     const std::string url = Server().BaseUrl() + "/webapi/encryption.cgi";
-    EXPECT_EQ(kova_test::RunInChild(60,
-                                    [&] {
-                                        return OnThreads(4, 25, [&](int, int) {
-                                            Json::Value info;
-                                            return CredRequestUtil::GetEncInfo(url, info) &&
-                                                   info["public_key"].asString() ==
-                                                       Sim().PublicKeyHex();
-                                        });
-                                    }),
-              "exit 0");
+    ExpectOnThreads(4, 25, [&](int, int) {
+        Json::Value info;
+        return CredRequestUtil::GetEncInfo(url, info) &&
+               info["public_key"].asString() == Sim().PublicKeyHex();
+    });
 }
 
 // The threads start with an empty cache, so they race to fill and read it.
@@ -91,21 +81,15 @@ TEST_F(ThreadsWebApiTest, FactoriesShareTheDescriptionCache) {
     ASSERT_TRUE(CredRequestUtil::GetAccessToken(static_cast<long>(id), &sess))
         << kova_test::LogDump();
     CredRequestUtil::m_jsData = Json::Value();
-    EXPECT_EQ(kova_test::RunInChild(
-                  60,
-                  [&] {
-                      return OnThreads(8, 10, [&](int t, int r) {
-                          Json::Value params(Json::objectValue);
-                          params["who"] = std::to_string(t * 100 + r);
-                          std::unique_ptr<CredRequest> req(CredRequest::CreateWebAPIRequest(
-                              id, "KOVA.Demo.Echo", 1, "echo", params));
-                          Json::Value answer;
-                          return req && req->Process() &&
-                                 kova::JsonFromString(req->GetResponse(), answer) &&
-                                 answer["data"]["params"]["who"] == params["who"];
-                      });
-                  }),
-              "exit 0");
+    ExpectOnThreads(8, 10, [&](int t, int r) {
+        Json::Value params(Json::objectValue);
+        params["who"] = std::to_string(t * 100 + r);
+        std::unique_ptr<CredRequest> req(
+            CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Echo", 1, "echo", params));
+        Json::Value answer;
+        return req && req->Process() && kova::JsonFromString(req->GetResponse(), answer) &&
+               answer["data"]["params"]["who"] == params["who"];
+    });
 }
 
 class ThreadsRelayTest : public kova_test::RelayDirectoryTest {
@@ -120,28 +104,15 @@ TEST_F(ThreadsRelayTest, LookUpsWithClientsOfTheirOwn) {
     kovasim::LoopbackServer target(options);
     kovasim::InstallPingPong(target, "S1");
     ASSERT_TRUE(target.Start()) << target.Error();
-    Json::Value config(Json::objectValue);
-    config["sites"].append(Host(1));
-    Json::Value &server = config["servers"].append(Json::Value(Json::objectValue));
-    server["serverID"] = "S1";
-    server["interface"].append(Json::Value(Json::objectValue))["ip"] = options.host;
-    server["services"]["zon"]["port"] = target.Port();
-    ASSERT_TRUE(Sim().Configure(config));
-
-    Json::Value expected(Json::objectValue);
-    expected["protocol"] = "http";
-    expected["host"] = options.host;
-    expected["port"] = target.Port();
-    EXPECT_EQ(kova_test::RunInChild(60,
-                                    [&] {
-                                        return OnThreads(8, 5, [&](int, int) {
-                                            Json::Value candidate;
-                                            return KOVA::CredRequestFarlink::GetConnInfo(
-                                                       "S1", candidate, nullptr) &&
-                                                   candidate == expected;
-                                        });
-                                    }),
-              "exit 0");
+    Serve(kova_test::ParseJson(
+        R"({"serverID": "S1", "interface": [{"ip": "$0"}], "services": {"zon": {"port": $1}}})",
+        {options.host, std::to_string(target.Port())}));
+    const Json::Value expected = kova_test::Candidate("http", options.host, target.Port());
+    ExpectOnThreads(8, 5, [&](int, int) {
+        Json::Value candidate;
+        return KOVA::CredRequestFarlink::GetConnInfo("S1", candidate, nullptr) &&
+               candidate == expected;
+    });
 }
 
 }  // namespace

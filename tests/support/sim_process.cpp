@@ -11,6 +11,12 @@
 
 namespace kova_test {
 
+std::string ReadFile(const std::string &path) {
+    std::stringstream text;
+    text << std::ifstream(path, std::ios::binary).rdbuf();
+    return text.str();
+}
+
 SimProcess::SimProcess(const TempDir &dir, const std::string &args, int relayHosts)
     : portsFile_(dir.File("kovasim.ports")), errorFile_(dir.File("kovasim.err")) {
     pid_ = fork();
@@ -20,21 +26,17 @@ SimProcess::SimProcess(const TempDir &dir, const std::string &args, int relayHos
         execl("/bin/sh", "sh", "-c", command.c_str(), static_cast<char *>(nullptr));
         _exit(127);
     }
-    for (int i = 0; i < 300; ++i) {
+    for (int i = 0; i < 300 && pid_ > 0; ++i) {
         std::this_thread::sleep_for(std::chrono::milliseconds(50));
-        std::ifstream in(portsFile_);
-        std::string kind;
-        std::string address;
+        std::istringstream lines(ReadFile(portsFile_));
         int http = 0;
         int https = 0;
         std::vector<std::string> relays;
-        while (in >> kind >> address) {
-            int port = std::stoi(address.substr(address.rfind(':') + 1));
-            if (kind == "http") {
-                http = port;
-            } else if (kind == "https") {
-                https = port;
-            } else if (kind == "relay") {
+        for (std::string kind, address; lines >> kind >> address;) {
+            const int port = std::stoi(address.substr(address.rfind(':') + 1));
+            http = kind == "http" ? port : http;
+            https = kind == "https" ? port : https;
+            if (kind == "relay") {
                 relays.push_back(address);
             }
         }
@@ -44,44 +46,25 @@ SimProcess::SimProcess(const TempDir &dir, const std::string &args, int relayHos
             relayHosts_ = relays;
             return;
         }
-        if (waitpid(pid_, &status_, WNOHANG) == pid_) {
-            pid_ = 0;
-            status_ = WIFEXITED(status_) ? WEXITSTATUS(status_) : -1;
-            return;
+        if (waitpid(pid_, nullptr, WNOHANG) == pid_) {
+            pid_ = 0;  // reaped: never signal the number again
         }
     }
 }
 
 SimProcess::~SimProcess() {
-    Stop();
-}
-
-int SimProcess::Stop() {
     if (pid_ <= 0) {
-        return status_;
+        return;
     }
     kill(pid_, SIGTERM);
     for (int i = 0; i < 100; ++i) {
-        int status = 0;
-        if (waitpid(pid_, &status, WNOHANG) == pid_) {
-            pid_ = 0;
-            status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-            return status_;
+        if (waitpid(pid_, nullptr, WNOHANG) == pid_) {
+            return;
         }
         std::this_thread::sleep_for(std::chrono::milliseconds(50));
     }
     kill(pid_, SIGKILL);
     waitpid(pid_, nullptr, 0);
-    pid_ = 0;
-    status_ = -1;
-    return status_;
-}
-
-std::string SimProcess::ErrorOutput() const {
-    std::ifstream in(errorFile_);
-    std::stringstream text;
-    text << in.rdbuf();
-    return text.str();
 }
 
 }  // namespace kova_test

@@ -12,6 +12,9 @@
 
 namespace kova_test {
 
+// The whole content of the file at `path` ("" when it cannot be read).
+std::string ReadFile(const std::string &path);
+
 class SimProcess {
   public:
     // Runs `kovasim ARGS` and waits (at most 15 s) until it has printed its listeners; the
@@ -21,18 +24,15 @@ class SimProcess {
     SimProcess(const SimProcess &) = delete;
     SimProcess &operator=(const SimProcess &) = delete;
 
-    // Exit status after SIGTERM; -1 when it had to be killed or did not exit normally.
-    int Stop();
     int HttpPort() const { return httpPort_; }
     int HttpsPort() const { return httpsPort_; }
     // "HOST:PORT" of each relay-directory listener, in the order printed.
     const std::vector<std::string> &RelayHosts() const { return relayHosts_; }
     // Everything kovasim wrote to its standard error.
-    std::string ErrorOutput() const;
+    std::string ErrorOutput() const { return ReadFile(errorFile_); }
 
   private:
     pid_t pid_ = 0;
-    int status_ = -1;
     std::string portsFile_;
     std::string errorFile_;
     int httpPort_ = 0;
