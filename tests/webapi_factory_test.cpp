@@ -14,15 +14,6 @@ namespace {
 using KOVA::CredRequest;
 using KOVA::CredRequestUtil;
 
-using kova_test::File;
-
-File StreamWith(const std::string &text) {
-    File f(tmpfile());
-    fputs(text.c_str(), f.get());
-    rewind(f.get());
-    return f;
-}
-
 class WebApiFactoryTest : public WebApiTest {
   protected:
     std::string EntryUrl() const { return Server().BaseUrl() + "/webapi/entry.cgi"; }
