@@ -3,13 +3,12 @@
 // in memory stops at the cap, plain or gzip-encoded, while a response stream or the caller's
 // writer takes a 200 MB body in flat memory. Each case runs in a forked child under an alarm, so
 // that a crash or a hang fails that case alone.
-#include <errno.h>
-#include <fcntl.h>
 #include <signal.h>
 #include <stdint.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/mman.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -26,6 +25,7 @@
 
 namespace {
 
+using kova_test::File;
 using kovasim::Fault;
 
 // What a child reports about its case.
@@ -39,67 +39,50 @@ struct Outcome {
     bool writeErrorLogged = false;  // "CURL Error(23)", the write error, in the log
 };
 
-long PeakRssKiB() {
-    FILE *status = fopen("/proc/self/status", "r");
-    long kib = -1;
+// The peak resident set; with `reset` it first starts the peak afresh from the current set.
+long PeakRssKiB(bool reset = false) {
+    if (reset) {
+        File clear(fopen("/proc/self/clear_refs", "w"));
+        if (clear) {
+            fputs("5", clear.get());
+        }
+    }
+    File status(fopen("/proc/self/status", "r"));
     char line[256];
-    while (status != nullptr && fgets(line, sizeof(line), status) != nullptr) {
+    while (status && fgets(line, sizeof(line), status.get()) != nullptr) {
         if (strncmp(line, "VmHWM:", 6) == 0) {
-            kib = strtol(line + 6, nullptr, 10);
+            return strtol(line + 6, nullptr, 10);
         }
     }
-    if (status != nullptr) {
-        fclose(status);
-    }
-    return kib;
+    return -1;
 }
 
-// Resets the peak resident set to the current one, so that a later PeakRssKiB shows the peak
-// of what ran in between.
-void ResetPeakRss() {
-    int fd = open("/proc/self/clear_refs", O_WRONLY);
-    if (fd >= 0) {
-        if (write(fd, "5", 1) != 1) {
-            perror("clear_refs");
-        }
-        close(fd);
-    }
-}
-
-// Runs `body` in a forked child that an alarm ends after `seconds`. Fails when the child
-// crashed, hung, leaked (the sanitizer build checks at the child's exit) or reported nothing.
+// Runs `body` in a forked child that an alarm ends after `seconds`, and hands back its outcome
+// through shared memory. Fails when the child crashed, hung or leaked (the sanitizer build
+// checks at the child's exit).
 template <typename Body>
 ::testing::AssertionResult InChild(unsigned seconds, Body body, Outcome *out) {
-    int fds[2];
-    if (pipe(fds) != 0) {
-        return ::testing::AssertionFailure() << "pipe: " << strerror(errno);
-    }
+    void *shared =
+        mmap(nullptr, sizeof(Outcome), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
     fflush(nullptr);
-    const pid_t pid = fork();
-    if (pid < 0) {
-        return ::testing::AssertionFailure() << "fork: " << strerror(errno);
-    }
+    const pid_t pid = shared != MAP_FAILED ? fork() : -1;
     if (pid == 0) {
-        close(fds[0]);
         alarm(seconds);
-        Outcome outcome = body();
-        const bool sent = write(fds[1], &outcome, sizeof(outcome)) == sizeof(outcome);
-        close(fds[1]);
-        exit(sent ? 0 : 3);  // exit, not _exit: the leak check runs at exit
+        *static_cast<Outcome *>(shared) = body();
+        exit(0);  // exit, not _exit: the leak check runs at exit
     }
-    close(fds[1]);
-    const ssize_t got = read(fds[0], out, sizeof(*out));  // the alarm bounds the wait
-    close(fds[0]);
-    int status = 0;
-    waitpid(pid, &status, 0);
-    if (WIFSIGNALED(status)) {
-        return ::testing::AssertionFailure() << "the child died of signal " << WTERMSIG(status)
-                                             << (WTERMSIG(status) == SIGALRM ? " (hung)" : "");
+    int status = -1;
+    if (pid > 0) {
+        waitpid(pid, &status, 0);
+        *out = *static_cast<Outcome *>(shared);
     }
-    if (!WIFEXITED(status) || WEXITSTATUS(status) != 0 || got != sizeof(*out)) {
-        return ::testing::AssertionFailure() << "the child exited with status " << status;
+    munmap(shared, sizeof(Outcome));
+    if (WIFEXITED(status) && WEXITSTATUS(status) == 0) {
+        return ::testing::AssertionSuccess();
     }
-    return ::testing::AssertionSuccess();
+    return ::testing::AssertionFailure()
+           << "the child ended with status " << status
+           << (WIFSIGNALED(status) && WTERMSIG(status) == SIGALRM ? " (hung)" : "");
 }
 
 // Where a response body goes.
@@ -117,14 +100,19 @@ size_t CountingWriter(char *, size_t size, size_t nmemb, void *user) {
     return size * nmemb;
 }
 
-// One request to `url` with its headers collected as JSON and its body sent to `sink`.
-Outcome Fetch(const std::string &url, Sink sink) {
+// One request to a server with `fault`, its headers collected as JSON and its body sent to
+// `sink`.
+Outcome Fetch(Fault fault, Sink sink) {
     Outcome outcome;
+    kovasim::FaultServer server(fault);
+    if (!server.Start()) {
+        return outcome;
+    }
     uint64_t counted = 0;
     cookie_io_functions_t io = {nullptr, CountWrite, nullptr, nullptr};
     FILE *stream = sink == Sink::kStream ? fopencookie(&counted, "w", io) : nullptr;
     KOVA::CredRequest request;
-    request.SetURL(url + "/webapi/entry.cgi");
+    request.SetURL(server.BaseUrl() + "/webapi/entry.cgi");
     request.SetRespHeaderToJsonValue(true);
     request.SetResponseTimeout(1);  // a silent peer is given up after one second
     if (stream != nullptr) {
@@ -132,8 +120,7 @@ Outcome Fetch(const std::string &url, Sink sink) {
     } else if (sink == Sink::kWriter) {
         request.SetRespStream(reinterpret_cast<FILE *>(&counted), CountingWriter);
     }
-    ResetPeakRss();
-    const long before = PeakRssKiB();
+    const long before = PeakRssKiB(true);
     outcome.ok = request.Process(true, 0);
     outcome.rssGrowthKiB = PeakRssKiB() - before;
     outcome.error = request.GetError();
@@ -172,12 +159,7 @@ TEST(HostilePeerTest, EveryFaultEndsWithItsMappedError) {
         SCOPED_TRACE(kovasim::FaultName(c.fault));
         Outcome outcome;
         ASSERT_TRUE(InChild(
-            30,
-            [&] {
-                kovasim::FaultServer server(c.fault);
-                return server.Start() ? Fetch(server.BaseUrl(), Sink::kMemory) : Outcome();
-            },
-            &outcome));
+            30, [&] { return Fetch(c.fault, Sink::kMemory); }, &outcome));
         EXPECT_EQ(outcome.ok, c.ok);
         EXPECT_EQ(outcome.error, c.error);
         if (c.headers >= 0) {
@@ -193,12 +175,7 @@ TEST(HostilePeerTest, HugeBodyStreamsWholeButStopsAtTheCapInMemory) {
         SCOPED_TRACE(static_cast<int>(sink));
         Outcome outcome;
         ASSERT_TRUE(InChild(
-            120,
-            [&] {
-                kovasim::FaultServer server(Fault::kHugeBody);
-                return server.Start() ? Fetch(server.BaseUrl(), sink) : Outcome();
-            },
-            &outcome));
+            120, [&] { return Fetch(Fault::kHugeBody, sink); }, &outcome));
         if (sink != Sink::kMemory) {
             EXPECT_TRUE(outcome.ok);
             EXPECT_EQ(outcome.bytes, kovasim::kFaultBodyBytes);
@@ -239,8 +216,7 @@ TEST(HostilePeerTest, GzipBombThroughDiscoveryStopsAtTheCap) {
             cred.host = "127.0.0.1";
             cred.port = server.Port();
             KOVA::CredRequestUtil::m_errCode = 0;
-            ResetPeakRss();
-            const long before = PeakRssKiB();
+            const long before = PeakRssKiB(true);
             result.ok = KOVA::CredRequestUtil::GetWebAPIDesc(&cred);
             result.rssGrowthKiB = PeakRssKiB() - before;
             result.queryError = KOVA::CredRequestUtil::m_errCode;

@@ -6,7 +6,6 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <chrono>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -29,18 +28,8 @@
 namespace {
 
 using kova_test::File;
-
-std::string ReadAll(FILE *f) {
-    fflush(f);
-    rewind(f);
-    std::string out;
-    char buf[65536];
-    size_t n;
-    while ((n = fread(buf, 1, sizeof(buf), f)) > 0) {
-        out.append(buf, n);
-    }
-    return out;
-}
+using kova_test::ReadAll;
+using kova_test::StreamWith;
 
 class ProcessTest : public ::testing::Test {
   protected:
@@ -55,10 +44,6 @@ class ProcessTest : public ::testing::Test {
                               res.set_header("Location", "/ok");
                           }
                       });
-        server_.Route("GET", "/headers", [](const httplib::Request &, httplib::Response &res) {
-            res.set_header("X-Kova", "value 1");
-            res.set_content("body", "text/plain");
-        });
         ASSERT_TRUE(server_.Start()) << server_.Error();
         kova_test::ClearLog();
         kova_test::ClearSleeps();
@@ -67,24 +52,6 @@ class ProcessTest : public ::testing::Test {
 
     kovasim::LoopbackServer server_;
 };
-
-// A raw server that answers every connection with `reply`.
-std::unique_ptr<kovasim::RawServer> StartRaw(const std::string &reply) {
-    auto raw = std::make_unique<kovasim::RawServer>(
-        [reply](kovasim::RawServer::Connection &c) { c.Send(reply); });
-    EXPECT_TRUE(raw->Start());
-    return raw;
-}
-
-// A temporary stream holding `text`, positioned at its end.
-File StreamWith(const std::string &text) {
-    File f(tmpfile());
-    if (f) {
-        fputs(text.c_str(), f.get());
-        fflush(f.get());
-    }
-    return f;
-}
 
 // A set-up-only run makes the handle without a transfer; every later run reuses it as it was
 // set up, so settings changed afterwards do not reach the wire.
@@ -212,7 +179,7 @@ TEST_F(ProcessTest, ConnectFailuresRetryWithTheirOwnPauses) {
                      (c.proxy ? c.proxy : "none"));
         kova_test::FakeSleepScope fake;
         kova_test::ClearLog();
-        File out = StreamWith("kept");
+        File out = StreamWith("kept", true);
         ASSERT_TRUE(out);
         KOVA::CredRequest req;
         ASSERT_TRUE(req.SetURL(c.url));
@@ -224,9 +191,7 @@ TEST_F(ProcessTest, ConnectFailuresRetryWithTheirOwnPauses) {
             ASSERT_TRUE(req.Process(false, 0));
             ASSERT_EQ(curl_easy_setopt(req.GetCurlHandler(), CURLOPT_PROXY, c.proxy), CURLE_OK);
         }
-        const auto start = std::chrono::steady_clock::now();
         EXPECT_FALSE(req.Process(true, c.retries));
-        EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(20));
         EXPECT_EQ(req.GetError(), c.error);
         EXPECT_EQ(kova_test::SleepCalls(), std::vector<unsigned>(c.pauses, 1u));
         EXPECT_EQ(kova_test::LogCount("CURL Error"), c.curlLogs) << kova_test::LogDump();
@@ -266,7 +231,7 @@ TEST_F(ProcessTest, CutOffBodyIsRetriedAndEachAttemptStartsClean) {
         kova_test::FakeSleepScope fake;
         kova_test::ClearLog();
         cuts = c.cuts;
-        File out = StreamWith("kept");
+        File out = StreamWith("kept", true);
         ASSERT_TRUE(out);
         KOVA::CredRequest req;
         ASSERT_TRUE(req.SetURL(raw.BaseUrl() + "/cut"));
@@ -290,22 +255,15 @@ TEST_F(ProcessTest, CutOffBodyIsRetriedAndEachAttemptStartsClean) {
 // De-chunks a chunked request body; "" when it is malformed or incomplete.
 std::string Dechunk(const std::string &chunked) {
     std::string body;
-    size_t pos = 0;
-    for (;;) {
-        const size_t eol = chunked.find("\r\n", pos);
-        if (eol == std::string::npos) {
-            return "";
-        }
+    for (size_t pos = 0, eol; (eol = chunked.find("\r\n", pos)) != std::string::npos;) {
         const size_t size = std::stoul(chunked.substr(pos, eol - pos), nullptr, 16);
-        if (size == 0) {
-            return body;
-        }
-        if (eol + 2 + size + 2 > chunked.size()) {
-            return "";
+        if (size == 0 || eol + 4 + size > chunked.size()) {
+            return size == 0 ? body : "";
         }
         body.append(chunked, eol + 2, size);
-        pos = eol + 2 + size + 2;
+        pos = eol + 4 + size;
     }
+    return "";
 }
 
 // A raw server that takes request bodies. For its connections, in order, it follows a plan:
@@ -401,49 +359,41 @@ TEST_F(ProcessTest, RequestStreamIsSentWholeAfterResetsAndRedirects) {
             << server.Taken().size() << " bytes";
     }
 
+    // A pipe, fed by a thread, in a child: its request reaches the parent's server once.
     BodyServer server({"reset", "take"});
     ASSERT_TRUE(server.Start());
-    EXPECT_EQ(kova_test::RunInChild(30,
-                                    [&] {
-                                        signal(SIGPIPE, SIG_IGN);
-                                        int fds[2];
-                                        if (pipe(fds) != 0) {
-                                            return 2;
-                                        }
-                                        std::thread writer([&] {
-                                            size_t sent = 0;
-                                            while (sent < body.size()) {
-                                                ssize_t n = write(fds[1], body.data() + sent,
-                                                                  body.size() - sent);
-                                                if (n <= 0) {
-                                                    break;
-                                                }
-                                                sent += static_cast<size_t>(n);
-                                            }
-                                            close(fds[1]);
-                                        });
-                                        FILE *in = fdopen(fds[0], "r");
-                                        KOVA::CredRequest req;
-                                        req.SetURL(server.Url());
-                                        req.SetReqStream(in);
-                                        const bool ok = req.Process(true, 2);
-                                        const KOVA::CRED_REQ_ERR error = req.GetError();
-                                        fclose(in);
-                                        writer.join();
-                                        fprintf(stderr, "ok %d error %d\n", ok, error);
-                                        return !ok && (error == KOVA::CRED_REQ_ERR_SEND ||
-                                                       error == KOVA::CRED_REQ_ERR_CONNECT)
-                                                   ? 0
-                                                   : 1;
-                                    }),
-              "exit 0");
-    // The child's request reached the parent's server once: nothing was sent again.
+    auto pipeCase = [&] {
+        signal(SIGPIPE, SIG_IGN);
+        int fds[2];
+        if (pipe(fds) != 0) {
+            return 2;
+        }
+        std::thread writer([&] {
+            // A blocking write to a pipe takes everything unless the reader goes.
+            (void)!write(fds[1], body.data(), body.size());
+            close(fds[1]);
+        });
+        FILE *in = fdopen(fds[0], "r");
+        KOVA::CredRequest req;
+        req.SetURL(server.Url());
+        req.SetReqStream(in);
+        const bool ok = req.Process(true, 2);
+        const KOVA::CRED_REQ_ERR error = req.GetError();
+        fclose(in);
+        writer.join();
+        fprintf(stderr, "ok %d error %d\n", ok, error);
+        return !ok && (error == KOVA::CRED_REQ_ERR_SEND || error == KOVA::CRED_REQ_ERR_CONNECT) ? 0
+                                                                                                : 1;
+    };
+    EXPECT_EQ(kova_test::RunInChild(30, pipeCase), "exit 0");
     EXPECT_EQ(server.Connections(), 1);
 }
 
+// A stalled attempt times out (one second without data), is not logged, pauses one second and
+// is cut off the response stream, which keeps what it held before Process. The first two
+// connections stall; the third sends the whole body.
 TEST_F(ProcessTest, StallTimesOutAndCutsTheResponseStreamBackBeforeTheNextAttempt) {
-    // The first two connections send one byte of the body and stall (libcurl averages the speed
-    // over several seconds, so one byte is all it gets); the third sends the whole body.
+    // libcurl averages the speed over several seconds, so one byte is all the stall sends.
     kovasim::RawServer raw([](kovasim::RawServer::Connection &c) {
         if (c.Index() < 2) {
             c.Send("HTTP/1.1 200 OK\r\nContent-Length: 8\r\n\r\ns");
@@ -456,15 +406,11 @@ TEST_F(ProcessTest, StallTimesOutAndCutsTheResponseStreamBackBeforeTheNextAttemp
     KOVA::CredRequest stalled;
     ASSERT_TRUE(stalled.SetURL(raw.BaseUrl() + "/"));
     ASSERT_TRUE(stalled.SetResponseTimeout(1));
-    const auto start = std::chrono::steady_clock::now();
     EXPECT_FALSE(stalled.Process(true, 0));
-    const auto elapsed = std::chrono::steady_clock::now() - start;
     EXPECT_EQ(stalled.GetError(), KOVA::CRED_REQ_ERR_TIMEOUT);
-    EXPECT_GE(elapsed, std::chrono::milliseconds(900));
-    EXPECT_LT(elapsed, std::chrono::seconds(4));
     EXPECT_FALSE(kova_test::LogHas("CURL Error")) << kova_test::LogDump();
 
-    File out = StreamWith("stale content from before");
+    File out = StreamWith("stale content from before", true);
     ASSERT_TRUE(out);
     kova_test::FakeSleepScope fake;
     KOVA::CredRequest req;
@@ -472,8 +418,8 @@ TEST_F(ProcessTest, StallTimesOutAndCutsTheResponseStreamBackBeforeTheNextAttemp
     ASSERT_TRUE(req.SetResponseTimeout(1));
     ASSERT_TRUE(req.SetRespStream(out.get()));
     EXPECT_TRUE(req.Process(true, 1)) << req.GetError();
+    EXPECT_EQ(raw.ConnectionCount(), 3);
     EXPECT_EQ(kova_test::SleepCalls(), std::vector<unsigned>{1u});
-    // The failed attempt's byte is cut off; what the stream held before Process stays.
     EXPECT_EQ(ReadAll(out.get()), "stale content from beforecomplete");
     EXPECT_EQ(req.GetResponse(), "");
     raw.Stop();
@@ -481,25 +427,44 @@ TEST_F(ProcessTest, StallTimesOutAndCutsTheResponseStreamBackBeforeTheNextAttemp
 
 // Headers reach the JSON value only when asked for. A header without a value is logged and
 // skipped, an empty one after the colon is kept, the status line is not a header, and a huge
-// one comes through whole.
+// one comes through whole. Printed headers come after their message, which shows once per
+// process.
 TEST_F(ProcessTest, HeadersAsJsonOnlyWhenAsked) {
-    auto raw = StartRaw("HTTP/1.1 200 OK\r\nX-Kova: value 1\r\nX-Empty: \r\nX-Bare:\r\nX-Huge: " +
-                        std::string(90000, 'h') + "\r\nContent-Length: 2\r\n\r\nok");
-    for (bool asked : {true, false}) {
-        SCOPED_TRACE(asked);
+    const std::string reply =
+        "HTTP/1.1 200 OK\r\nX-Kova: value 1\r\nX-Empty: \r\nX-Bare:\r\nX-Huge: " +
+        std::string(90000, 'h') + "\r\nContent-Length: 2\r\n\r\nok";
+    kovasim::RawServer raw([&reply](kovasim::RawServer::Connection &c) { c.Send(reply); });
+    ASSERT_TRUE(raw.Start());
+    enum Mode { kJson, kNone, kStdout, kStdoutAgain };
+    for (Mode mode : {kJson, kNone, kStdout, kStdoutAgain}) {
+        SCOPED_TRACE(mode);
         kova_test::ClearLog();
         KOVA::CredRequest req;
-        ASSERT_TRUE(req.SetURL(raw->BaseUrl() + "/"));
-        ASSERT_TRUE(req.SetRespHeaderToJsonValue(asked));
-        ASSERT_TRUE(req.Process(true, 0));
+        ASSERT_TRUE(req.SetURL(raw.BaseUrl() + "/"));
+        ASSERT_TRUE(mode >= kStdout ? req.SetRespHeaderToStdout(true, "== headers ==")
+                                    : req.SetRespHeaderToJsonValue(mode == kJson));
+        ::testing::internal::CaptureStdout();
+        const bool ok = req.Process(true, 0);
+        fflush(stdout);
+        const std::string printed = ::testing::internal::GetCapturedStdout();
+        ASSERT_TRUE(ok);
         EXPECT_EQ(req.GetResponse(), "ok");
         const Json::Value &h = req.GetResponseHeader();
-        EXPECT_EQ(kova_test::LogCount("HTTP header has no value:"), asked ? 1u : 0u)
-            << kova_test::LogDump();
-        if (!asked) {
+        if (mode != kJson) {
             EXPECT_TRUE(h.empty());
+            EXPECT_EQ(printed.find("X-Kova: value 1\r\n") != std::string::npos, mode >= kStdout)
+                << printed.substr(0, 200);
+            EXPECT_EQ(printed.find("== headers ==\r\n"), mode == kStdout ? 0 : std::string::npos);
+            if (mode == kNone) {
+                EXPECT_FALSE(kova_test::LogHas("HTTP header has no value:"))
+                    << kova_test::LogDump();
+            } else {
+                EXPECT_EQ(printed.find("HTTP/1.1 200"), std::string::npos);
+                EXPECT_EQ(printed.substr(printed.size() - 4), "\r\n\r\n");
+            }
             continue;
         }
+        EXPECT_EQ(kova_test::LogCount("HTTP header has no value:"), 1u) << kova_test::LogDump();
         EXPECT_EQ(h.getMemberNames(),
                   (std::vector<std::string>{"Content-Length", "X-Empty", "X-Huge", "X-Kova"}));
         EXPECT_EQ(h["X-Kova"].asString(), "value 1");
@@ -507,36 +472,6 @@ TEST_F(ProcessTest, HeadersAsJsonOnlyWhenAsked) {
         EXPECT_EQ(h["X-Huge"].asString().size(), 90000u);
         EXPECT_EQ(h["Content-Length"].asString(), "2");
     }
-}
-
-TEST_F(ProcessTest, HeadersToStdoutWithMessageOncePerProcess) {
-    std::string out[2];
-    for (std::string &captured : out) {
-        KOVA::CredRequest req;
-        ASSERT_TRUE(req.SetURL(Url("/headers")));
-        ASSERT_TRUE(req.SetRespHeaderToStdout(true, "== headers =="));
-        ::testing::internal::CaptureStdout();
-        const bool ok = req.Process(true, 0);
-        fflush(stdout);
-        captured = ::testing::internal::GetCapturedStdout();
-        ASSERT_TRUE(ok);
-        EXPECT_EQ(req.GetResponse(), "body");
-        EXPECT_NE(captured.find("X-Kova: value 1\r\n"), std::string::npos) << captured;
-    }
-    EXPECT_EQ(out[0].rfind("== headers ==\r\n", 0), 0u) << out[0];
-    EXPECT_EQ(out[0].find("HTTP/1.1 200"), std::string::npos) << out[0];
-    EXPECT_EQ(out[0].substr(out[0].size() - 4), "\r\n\r\n");
-    EXPECT_EQ(out[1].find("== headers =="), std::string::npos) << out[1];
-}
-
-// The probe itself is TestURL's; its error goes to the static error.
-TEST_F(ProcessTest, ProbeUsesTestURL) {
-    KOVA::CredRequestUtil::m_errCode = 0;
-    KOVA::CredRequest req;
-    EXPECT_TRUE(req.isURLValid(Url("/ok")));
-    EXPECT_FALSE(req.isURLValid(Url("/status/404")));
-    EXPECT_EQ(KOVA::CredRequestUtil::m_errCode, KOVA::CRED_REQ_ERR_QUERY_FAIL);
-    EXPECT_EQ(server_.RequestCount(), 2u);
 }
 
 class HttpsTest : public ::testing::Test {

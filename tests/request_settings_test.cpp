@@ -3,6 +3,7 @@
 #include <stdlib.h>
 
 #include <atomic>
+#include <functional>
 #include <new>
 #include <string>
 
@@ -74,61 +75,64 @@ TEST_F(SettingsTest, HeadersMergeAndReplace) {
     EXPECT_TRUE(p_.GetData("", "", null_).isMember("Header"));
 }
 
-TEST_F(SettingsTest, RejectedArgumentsSetBadParam) {
-    CredRequest req;
-    EXPECT_FALSE(req.AddGetParam("", "v"));
-    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_BAD_PARAM);
-    req.SetError(KOVA::CRED_REQ_ERR_NONE);
-    Json::Value array(Json::arrayValue);
-    array.append(1);
-    EXPECT_FALSE(req.AddGetParam(array));
-    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_BAD_PARAM);
-    req.SetError(KOVA::CRED_REQ_ERR_NONE);
-    EXPECT_FALSE(req.AddPostParam(Json::Value("text")));
-    EXPECT_FALSE(req.AddHeader(Json::Value(3)));
-    EXPECT_FALSE(req.AddCookie("", "x"));
-    EXPECT_FALSE(req.SetReqStream(nullptr));
-    EXPECT_FALSE(req.SetRespStream(nullptr));
-    EXPECT_FALSE(req.SetUploadFile(nullptr, "/tmp/x"));
-    EXPECT_FALSE(req.SetUploadFile("f", nullptr));
-    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_BAD_PARAM);
-    // With both arguments given the result is true, even when the document refuses the name.
-    req.SetError(KOVA::CRED_REQ_ERR_NONE);
-    EXPECT_TRUE(req.SetUploadFile("", "/tmp/x"));
-    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_BAD_PARAM);
-    req.SetError(KOVA::CRED_REQ_ERR_NONE);
-    EXPECT_TRUE(req.SetUploadFile("f", "/tmp/x"));
-    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_NONE);
-    req.SetError(KOVA::CRED_REQ_ERR_BAD_PARAM);
-    // The error is never cleared by a later successful setter.
-    EXPECT_TRUE(req.AddGetParam(Json::Value(Json::objectValue)));
-    EXPECT_TRUE(req.AddHeader("X", ""));
-    EXPECT_TRUE(req.AddRawParam(""));
-    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_BAD_PARAM);
-    EXPECT_TRUE(kova_test::LogRecords().empty());
-}
-
 TEST_F(SettingsTest, RawDataRejectsEmptyValuesOnly) {
-    EXPECT_FALSE(p_.SetRawData("K", Json::Value()));
-    EXPECT_FALSE(p_.SetRawData("K", Json::Value(Json::objectValue)));
-    EXPECT_FALSE(p_.SetRawData("K", Json::Value(Json::arrayValue)));
+    for (const Json::Value &empty :
+         {Json::Value(), Json::Value(Json::objectValue), Json::Value(Json::arrayValue)}) {
+        EXPECT_FALSE(p_.SetRawData("K", empty));
+    }
     EXPECT_FALSE(p_.SetRawData("", Json::Value(1)));
     EXPECT_EQ(p_.error, KOVA::CRED_REQ_ERR_BAD_PARAM);
     EXPECT_FALSE(p_.HasRawData("K"));
-    EXPECT_TRUE(p_.SetRawData("K", Json::Value("")));
-    EXPECT_TRUE(p_.SetRawData("B", Json::Value(false)));
-    EXPECT_TRUE(p_.SetRawData("N", Json::Value(0)));
+    for (const Json::Value &value : {Json::Value(""), Json::Value(false), Json::Value(0)}) {
+        EXPECT_TRUE(p_.SetRawData("K", value));
+    }
     EXPECT_TRUE(p_.HasRawData("K"));
+}
+
+// Each setter's result and error code: a refused argument sets bad-parameter (a refused
+// timeout or mode does not), and no setter clears an earlier error.
+TEST_F(SettingsTest, RejectedArgumentsSetBadParam) {
+    Json::Value array(Json::arrayValue);
+    array.append(1);
+    const struct {
+        std::function<bool(CredRequest &)> call;
+        bool result, setsBadParam;
+    } cases[] = {
+        {[](CredRequest &r) { return r.AddGetParam("", "v"); }, false, true},
+        {[&](CredRequest &r) { return r.AddGetParam(array); }, false, true},
+        {[](CredRequest &r) { return r.AddPostParam(Json::Value("text")); }, false, true},
+        {[](CredRequest &r) { return r.AddHeader(Json::Value(3)); }, false, true},
+        {[](CredRequest &r) { return r.AddCookie("", "x"); }, false, true},
+        {[](CredRequest &r) { return r.SetReqStream(nullptr); }, false, true},
+        {[](CredRequest &r) { return r.SetRespStream(nullptr); }, false, true},
+        {[](CredRequest &r) { return r.SetUploadFile(nullptr, "/tmp/x"); }, false, true},
+        {[](CredRequest &r) { return r.SetUploadFile("f", nullptr); }, false, true},
+        // With both arguments given the result is true, even when the document refuses the name.
+        {[](CredRequest &r) { return r.SetUploadFile("", "/tmp/x"); }, true, true},
+        {[](CredRequest &r) { return r.SetUploadFile("f", "/tmp/x"); }, true, false},
+        {[](CredRequest &r) { return r.AddGetParam(Json::Value(Json::objectValue)); }, true, false},
+        {[](CredRequest &r) { return r.AddHeader("X", ""); }, true, false},
+        {[](CredRequest &r) { return r.AddRawParam(""); }, true, false},
+        {[](CredRequest &r) { return r.SetDefaultTimeout(0); }, false, false},
+        {[](CredRequest &r) { return r.SetEncryptMode(KOVA::CRED_REQ_CRYPTO(3)); }, false, false},
+    };
+    for (KOVA::CRED_REQ_ERR before : {KOVA::CRED_REQ_ERR_NONE, KOVA::CRED_REQ_ERR_BAD_PARAM}) {
+        for (size_t i = 0; i < sizeof(cases) / sizeof(cases[0]); ++i) {
+            SCOPED_TRACE(std::to_string(i) + " after error " + std::to_string(before));
+            CredRequest req;
+            req.SetError(before);
+            EXPECT_EQ(cases[i].call(req), cases[i].result);
+            EXPECT_EQ(req.GetError(),
+                      cases[i].setsBadParam ? KOVA::CRED_REQ_ERR_BAD_PARAM : before);
+        }
+    }
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
 }
 
 TEST_F(SettingsTest, DefaultsTimeoutsAndEncryptionModes) {
     CredRequest req;
-    EXPECT_EQ(req.GetURL(), "");
-    EXPECT_EQ(req.GetRequestFormat(), "");
-    EXPECT_EQ(req.GetResponse(), "");
-    EXPECT_TRUE(req.GetResponseHeader().isObject());
-    EXPECT_TRUE(req.GetResponseHeader().empty());
-    EXPECT_FALSE(req.SetDefaultTimeout(0));
+    EXPECT_EQ(req.GetURL() + req.GetRequestFormat() + req.GetResponse(), "");
+    EXPECT_TRUE(req.GetResponseHeader().isObject() && req.GetResponseHeader().empty());
     EXPECT_FALSE(req.SetDefaultTimeout(-3));
     EXPECT_EQ(req.GetDefaultTimeout(), 120);
     EXPECT_TRUE(req.SetDefaultTimeout(30));
@@ -140,12 +144,11 @@ TEST_F(SettingsTest, DefaultsTimeoutsAndEncryptionModes) {
     EXPECT_TRUE(req.SetResponseTimeout(-7));
     EXPECT_EQ(req.GetResponseTimeout(), -7);
     EXPECT_TRUE(req.SetEncryptMode(KOVA::CRED_REQ_CRYPTO_AES));
-    EXPECT_FALSE(req.SetEncryptMode(static_cast<KOVA::CRED_REQ_CRYPTO>(3)));
-    // Neither a refused timeout nor a refused mode counts as a bad parameter.
-    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_NONE);
 }
 
-TEST_F(SettingsTest, ParamStringAndObject) {
+// The encoders that read the document back: parameters (plain, JSON-formatted, under an unknown
+// encryption mode, not an object), cookies (only the last in name order) and the URL.
+TEST_F(SettingsTest, EncodersReadTheDocument) {
     Json::Value params;
     params["b"] = "2";
     params["KovaToken"] = "T";
@@ -154,46 +157,35 @@ TEST_F(SettingsTest, ParamStringAndObject) {
     EXPECT_FALSE(p_.jsonFormat);
     EXPECT_EQ(p_.GetParamString(Json::Value()), "");
     // The JSON format writes values as JSON, but never the token.
-    ASSERT_TRUE(p_.SetRawData("Format", "JSON"));
-    EXPECT_EQ(p_.GetParamString(params), "b=%222%22&KovaToken=T");
-    EXPECT_TRUE(p_.jsonFormat);
-    // An empty token is left out.
-    CredRequestPrivate plain(nullptr);
+    CredRequestPrivate json(nullptr);
+    ASSERT_TRUE(json.SetRawData("Format", "JSON"));
+    EXPECT_EQ(json.GetParamString(params), "b=%222%22&KovaToken=T");
+    EXPECT_TRUE(json.jsonFormat);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+    EXPECT_EQ(p_.GetParamString(Json::Value("text")), "");
+    EXPECT_EQ(kova_test::LogCount("cred_request:"), 1u);
+    EXPECT_TRUE(kova_test::LogHas("JsonObjTostrPair Fail"));
+    // Unknown encryption modes are plain, and an empty token is left out.
     params["KovaToken"] = "";
-    EXPECT_EQ(plain.GetParamString(params), "b=2");
-}
-
-TEST_F(SettingsTest, UnknownModesAreTreatedAsPlain) {
-    Json::Value params;
-    params["b"] = "2";
+    EXPECT_EQ(p_.GetParamString(params), "b=2");
+    params.removeMember("KovaToken");
     for (const Json::Value &mode : {Json::Value(3), Json::Value("x")}) {
         SCOPED_TRACE(kova::JsonToString(mode));
         ASSERT_TRUE(p_.SetRawData("Crypto", mode));
         EXPECT_EQ(p_.GetParamString(params), "b=2");
         EXPECT_EQ(kova::JsonToString(p_.GetParamJsonObj(params)), "{\"b\":\"2\"}");
     }
-}
 
-TEST_F(SettingsTest, ParamStringOfANonObjectFails) {
-    EXPECT_EQ(p_.GetParamString(Json::Value("text")), "");
-    EXPECT_TRUE(kova_test::LogHas("cred_request:"));
-    EXPECT_TRUE(kova_test::LogHas("JsonObjTostrPair Fail"));
-}
-
-TEST_F(SettingsTest, Cookies) {
     EXPECT_EQ(p_.GetCookies(), "");
     ASSERT_TRUE(p_.SetData("Cookie", Json::Value(Json::objectValue)));
     EXPECT_EQ(p_.GetCookies(), "");
     ASSERT_TRUE(p_.SetData("Cookie", "a", "1"));
     ASSERT_TRUE(p_.SetData("Cookie", "b", "2"));
     EXPECT_EQ(p_.GetCookies(), "b=2");
-    CredRequestPrivate bad(nullptr);
-    ASSERT_TRUE(bad.SetRawData("Cookie", "id=1"));
-    EXPECT_EQ(bad.GetCookies(), "");
+    ASSERT_TRUE(json.SetRawData("Cookie", "id=1"));
+    EXPECT_EQ(json.GetCookies(), "");
     EXPECT_TRUE(kova_test::LogHas("Invalid Cookie format"));
-}
 
-TEST_F(SettingsTest, NonStringUrlFailsSetUp) {
     ASSERT_TRUE(p_.SetRawData("URL", 5));
     EXPECT_FALSE(p_.InitCurlHandler());
     EXPECT_EQ(p_.error, KOVA::CRED_REQ_ERR_NO_URL);

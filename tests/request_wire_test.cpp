@@ -17,16 +17,7 @@
 namespace {
 
 using kova_test::File;
-
-// A temporary stream holding `text`, positioned at its start.
-File StreamWith(const std::string &text) {
-    File f(tmpfile());
-    if (f) {
-        fwrite(text.data(), 1, text.size(), f.get());
-        rewind(f.get());
-    }
-    return f;
-}
+using kova_test::StreamWith;
 
 class WireTest : public ::testing::Test {
   protected:

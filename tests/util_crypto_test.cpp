@@ -1,10 +1,9 @@
 // Encryption helpers and the encrypted parameter envelopes, checked by decrypting with OpenSSL
 // directly: RSA with the private half of a key made here, AES with a key derived here.
 #include <string.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <string>
 #include <thread>
@@ -23,6 +22,7 @@
 #include "platform/json_text.h"
 #include "request/cred_request_p.h"
 #include "simlib/loopback_server.h"
+#include "support/child.h"
 #include "support/interpose.h"
 #include "support/temp_dir.h"
 
@@ -45,57 +45,49 @@ std::string ModulusHex(EVP_PKEY *key) {
     return out;
 }
 
+const unsigned char *Bytes(const std::string &s) {
+    return reinterpret_cast<const unsigned char *>(s.data());
+}
+
 std::string Unbase64(const std::string &text) {
     std::string out(text.size(), '\0');
-    int n = EVP_DecodeBlock(reinterpret_cast<unsigned char *>(&out[0]),
-                            reinterpret_cast<const unsigned char *>(text.data()),
-                            static_cast<int>(text.size()));
-    if (n < 0)
-        return "<bad base64>";
-    size_t pad = 0;
-    while (pad < text.size() && text[text.size() - 1 - pad] == '=')
-        ++pad;
-    out.resize(static_cast<size_t>(n) - pad);
-    return out;
+    const int n = EVP_DecodeBlock(reinterpret_cast<unsigned char *>(&out[0]), Bytes(text),
+                                  static_cast<int>(text.size()));
+    const size_t pad = text.size() - text.find_last_not_of('=') - 1;
+    return n < 0 ? "<bad base64>" : out.substr(0, static_cast<size_t>(n) - pad);
 }
 
 std::string RsaDecrypt(EVP_PKEY *key, const std::string &base64) {
-    std::string raw = Unbase64(base64);
-    EVP_PKEY_CTX *ctx = EVP_PKEY_CTX_new(key, nullptr);
+    const std::string raw = Unbase64(base64);
+    std::unique_ptr<EVP_PKEY_CTX, void (*)(EVP_PKEY_CTX *)> ctx(EVP_PKEY_CTX_new(key, nullptr),
+                                                                EVP_PKEY_CTX_free);
     std::string out(1024, '\0');
     size_t len = out.size();
-    bool ok = ctx && EVP_PKEY_decrypt_init(ctx) > 0 &&
-              EVP_PKEY_CTX_set_rsa_padding(ctx, RSA_PKCS1_PADDING) > 0 &&
-              EVP_PKEY_decrypt(ctx, reinterpret_cast<unsigned char *>(&out[0]), &len,
-                               reinterpret_cast<const unsigned char *>(raw.data()), raw.size()) > 0;
-    EVP_PKEY_CTX_free(ctx);
-    if (!ok)
-        return "<decrypt failed>";
-    out.resize(len);
-    return out;
+    const bool ok = ctx && EVP_PKEY_decrypt_init(ctx.get()) > 0 &&
+                    EVP_PKEY_CTX_set_rsa_padding(ctx.get(), RSA_PKCS1_PADDING) > 0 &&
+                    EVP_PKEY_decrypt(ctx.get(), reinterpret_cast<unsigned char *>(&out[0]), &len,
+                                     Bytes(raw), raw.size()) > 0;
+    return ok ? out.substr(0, len) : "<decrypt failed>";
 }
 
+// AES-256-CBC under a key and IV derived from `pass` (SHA-1, five rounds, no salt).
 std::string AesDecrypt(const std::string &pass, const std::string &base64) {
     unsigned char key[32];
     unsigned char iv[16];
-    EVP_BytesToKey(EVP_aes_256_cbc(), EVP_sha1(), nullptr,
-                   reinterpret_cast<const unsigned char *>(pass.data()),
+    EVP_BytesToKey(EVP_aes_256_cbc(), EVP_sha1(), nullptr, Bytes(pass),
                    static_cast<int>(pass.size()), 5, key, iv);
-    std::string raw = Unbase64(base64);
+    const std::string raw = Unbase64(base64);
     std::string out(raw.size() + 32, '\0');
+    auto *at = reinterpret_cast<unsigned char *>(&out[0]);
     int n1 = 0;
     int n2 = 0;
-    EVP_CIPHER_CTX *ctx = EVP_CIPHER_CTX_new();
-    bool ok = EVP_DecryptInit_ex(ctx, EVP_aes_256_cbc(), nullptr, key, iv) == 1 &&
-              EVP_DecryptUpdate(ctx, reinterpret_cast<unsigned char *>(&out[0]), &n1,
-                                reinterpret_cast<const unsigned char *>(raw.data()),
-                                static_cast<int>(raw.size())) == 1 &&
-              EVP_DecryptFinal_ex(ctx, reinterpret_cast<unsigned char *>(&out[n1]), &n2) == 1;
-    EVP_CIPHER_CTX_free(ctx);
-    if (!ok)
-        return "<decrypt failed>";
-    out.resize(static_cast<size_t>(n1 + n2));
-    return out;
+    std::unique_ptr<EVP_CIPHER_CTX, void (*)(EVP_CIPHER_CTX *)> ctx(EVP_CIPHER_CTX_new(),
+                                                                    EVP_CIPHER_CTX_free);
+    const bool ok =
+        EVP_DecryptInit_ex(ctx.get(), EVP_aes_256_cbc(), nullptr, key, iv) == 1 &&
+        EVP_DecryptUpdate(ctx.get(), at, &n1, Bytes(raw), static_cast<int>(raw.size())) == 1 &&
+        EVP_DecryptFinal_ex(ctx.get(), at + n1, &n2) == 1;
+    return ok ? out.substr(0, static_cast<size_t>(n1 + n2)) : "<decrypt failed>";
 }
 
 std::string PercentDecode(const std::string &s) {
@@ -189,40 +181,37 @@ TEST_F(CryptoTest, RsaKeysBeyondTheCacheFromThreads) {
         ASSERT_NE(keys.back(), nullptr);
         moduli.push_back(ModulusHex(keys.back().get()));
     }
-    const pid_t pid = fork();
-    ASSERT_GE(pid, 0);
-    if (pid == 0) {
-        alarm(60);
+    auto walk = [&](int t, std::atomic<int> &wrong) {
+        for (int i = 0; i < kCalls; ++i) {
+            const int k = (i * (t + 1) + t) % kKeys;  // an order of the keys per thread
+            const std::string text = std::to_string(t) + "/" + std::to_string(i);
+            std::string cipher;
+            if (!CredRequestUtil::GetEncString(moduli[k], text, cipher) ||
+                RsaDecrypt(keys[k].get(), cipher) != text ||
+                (i % 10 == 0 && CredRequestUtil::GetEncString("not-hex", text, cipher))) {
+                ++wrong;
+            }
+        }
+    };
+    // Exit 1: a wrong result; 2: records other than one per unusable key.
+    auto run = [&] {
         kova_test::ClearLog();
         std::atomic<int> wrong{0};
         std::vector<std::thread> threads;
         for (int t = 0; t < kThreads; ++t) {
-            threads.emplace_back([&, t] {
-                for (int i = 0; i < kCalls; ++i) {
-                    // Each thread walks the keys in an order of its own.
-                    const int k = (i * (t + 1) + t) % kKeys;
-                    const std::string text = std::to_string(t) + "/" + std::to_string(i);
-                    std::string cipher;
-                    if (!CredRequestUtil::GetEncString(moduli[k], text, cipher) ||
-                        RsaDecrypt(keys[k].get(), cipher) != text ||
-                        (i % 10 == 0 && CredRequestUtil::GetEncString("not-hex", text, cipher))) {
-                        ++wrong;
-                    }
-                }
-            });
+            threads.emplace_back(walk, t, std::ref(wrong));
         }
         for (std::thread &thread : threads) {
             thread.join();
         }
         const size_t failures = kThreads * kCalls / 10;
-        const bool logged = kova_test::LogCount(" RSA encrypt fail") == failures &&
-                            kova_test::LogRecords().size() == failures;
-        _exit(wrong != 0 ? 1 : logged ? 0 : 2);
-    }
-    int status = 0;
-    ASSERT_EQ(waitpid(pid, &status, 0), pid);
-    ASSERT_TRUE(WIFEXITED(status)) << "the child crashed or hung (status " << status << ")";
-    EXPECT_EQ(WEXITSTATUS(status), 0) << "1: a wrong result, 2: other log records";
+        return wrong != 0 ? 1
+               : kova_test::LogCount(" RSA encrypt fail") == failures &&
+                       kova_test::LogRecords().size() == failures
+                   ? 0
+                   : 2;
+    };
+    EXPECT_EQ(kova_test::RunInChild(60, run), "exit 0");
 }
 
 // The AES text is deterministic for a passphrase, padded to whole blocks (one block for an
@@ -287,15 +276,10 @@ class EncInfoTest : public CryptoTest {
                           res.set_content(req.body, "text/plain");
                       });
         ASSERT_TRUE(server_.Start());
-        Json::Value data;
-        data["cipherkey"] = "__cIpHeRtExT";
-        data["ciphertoken"] = "client_time";
-        data["public_key"] = ModulusHex(key2048_);
-        data["server_time"] = 1700000000;
-        Json::Value root;
-        root["success"] = true;
-        root["data"] = data;
-        answer_ = kova::JsonToString(root);
+        answer_ =
+            "{\"success\":true,\"data\":{\"cipherkey\":\"__cIpHeRtExT\",\"ciphertoken\":"
+            "\"client_time\",\"public_key\":\"" +
+            ModulusHex(key2048_) + "\",\"server_time\":1700000000}}";
     }
     std::string EncUrl() const { return server_.BaseUrl() + "/webapi/encryption.cgi"; }
 

@@ -12,35 +12,15 @@ namespace {
 
 using KOVA::CredRequestUtil;
 
-struct Parsed {
-    bool ok;
-    std::string scheme, host, port;
-};
-
-Parsed Parse(const std::string &url) {
-    Parsed p{false, "s?", "h?", "p?"};
-    p.ok = CredRequestUtil::ParseURL(url, p.scheme, p.host, p.port);
-    return p;
-}
-
-TEST(ParseURL, EmptyLeavesOutputsUntouched) {
-    Parsed p = Parse("");
-    EXPECT_FALSE(p.ok);
-    EXPECT_EQ(p.scheme, "s?");
-    EXPECT_EQ(p.host, "h?");
-    EXPECT_EQ(p.port, "p?");
-}
-
 // Every way a text is split: schemes and default ports, bracketed IPv6, no scheme, the
 // case-sensitive prefix, the last colon winning, a query without a path, an unclosed bracket
-// (which fails after the scheme's defaults were set).
+// (which fails after the scheme's defaults were set), and an empty text, which leaves the
+// outputs untouched.
 TEST(ParseURL, SplitsEveryForm) {
     const struct {
         const char *url;
         bool ok;
-        const char *scheme;
-        const char *host;
-        const char *port;
+        const char *scheme, *host, *port;
     } cases[] = {
         {"http://nas.example/webapi/query.cgi?x=1", true, "http", "nas.example", "80"},
         {"https://nas.example:5001/", true, "https", "nas.example", "5001"},
@@ -53,42 +33,42 @@ TEST(ParseURL, SplitsEveryForm) {
         {"HTTPS://h/", true, "http", "HTTPS", ""},
         {"http://u:p@h:81/", true, "http", "u:p@h", "81"},
         {"host?x=1", true, "http", "host?x=1", "80"},
+        {"", false, "s?", "h?", "p?"},
     };
     for (const auto &c : cases) {
         SCOPED_TRACE(c.url);
-        Parsed p = Parse(c.url);
-        EXPECT_EQ(p.ok, c.ok);
-        EXPECT_EQ(p.scheme, c.scheme);
-        EXPECT_EQ(p.host, c.host);
-        EXPECT_EQ(p.port, c.port);
+        std::string scheme = "s?", host = "h?", port = "p?";
+        EXPECT_EQ(CredRequestUtil::ParseURL(c.url, scheme, host, port), c.ok);
+        EXPECT_EQ(scheme + " " + host + " " + port,
+                  std::string(c.scheme) + " " + c.host + " " + c.port);
     }
 }
 
-TEST(GetURL, AlwaysWritesThePort) {
-    EXPECT_EQ(CredRequestUtil::GetURL("https", "a.b", 443, "webapi/query.cgi"),
-              "https://a.b:443/webapi/query.cgi");
-    EXPECT_EQ(CredRequestUtil::GetURL("http", "10.0.0.1", 5000, "/x"), "http://10.0.0.1:5000//x");
-}
-
-TEST(GetURL, FldMeansDirectHttps) {
-    EXPECT_EQ(CredRequestUtil::GetURL("fld", "1.2.3.4", 443, "webapi/auth.cgi"),
-              "https://1.2.3.4:443/direct/webapi/auth.cgi");
-    EXPECT_EQ(CredRequestUtil::GetURL("FLD", "h", 1, "p"), "FLD://h:1/p");
-}
-
-TEST(GetURL, BracketsOnlyIPv6Literals) {
-    EXPECT_EQ(CredRequestUtil::GetURL("http", "::1", 5000, "x"), "http://[::1]:5000/x");
-    EXPECT_EQ(CredRequestUtil::GetURL("https", "fe80::1%eth0", 5001, ""),
-              "https://[fe80::1%eth0]:5001/");
-    EXPECT_EQ(CredRequestUtil::GetURL("http", "nas.local", 80, ""), "http://nas.local:80/");
-}
-
-TEST(GetURL, FourPartSetURLStoresIt) {
+// The port is always written, only IPv6 literals are bracketed, and "fld" (in lower case only)
+// means HTTPS below "/direct".
+TEST(GetURL, BuildsEveryForm) {
+    const struct {
+        const char *scheme, *host;
+        int port;
+        const char *path, *url;
+    } cases[] = {
+        {"https", "a.b", 443, "webapi/query.cgi", "https://a.b:443/webapi/query.cgi"},
+        {"http", "10.0.0.1", 5000, "/x", "http://10.0.0.1:5000//x"},
+        {"fld", "1.2.3.4", 443, "webapi/auth.cgi", "https://1.2.3.4:443/direct/webapi/auth.cgi"},
+        {"FLD", "h", 1, "p", "FLD://h:1/p"},
+        {"http", "::1", 5000, "x", "http://[::1]:5000/x"},
+        {"https", "fe80::1%eth0", 5001, "", "https://[fe80::1%eth0]:5001/"},
+        {"http", "nas.local", 80, "", "http://nas.local:80/"},
+    };
+    for (const auto &c : cases) {
+        EXPECT_EQ(CredRequestUtil::GetURL(c.scheme, c.host, c.port, c.path), c.url);
+    }
     KOVA::CredRequest req;
     ASSERT_TRUE(req.SetURL("http", "::1", 5000, "webapi/query.cgi"));
     EXPECT_EQ(req.GetURL(), "http://[::1]:5000/webapi/query.cgi");
 }
 
+// The probe answers through the static error; CredRequest::isURLValid is the same probe.
 TEST(TestURL, AnsweringServerAndFailures) {
     kovasim::LoopbackServer server;
     server.Route("GET", "/ok", [](const httplib::Request &, httplib::Response &res) {
@@ -118,6 +98,13 @@ TEST(TestURL, AnsweringServerAndFailures) {
     CredRequestUtil::m_errCode = 0;
     EXPECT_FALSE(CredRequestUtil::TestURL(""));
     EXPECT_EQ(CredRequestUtil::m_errCode, KOVA::CRED_REQ_ERR_QUERY_FAIL);
+
+    KOVA::CredRequest req;
+    CredRequestUtil::m_errCode = 0;
+    EXPECT_TRUE(req.isURLValid(server.BaseUrl() + "/ok"));
+    EXPECT_FALSE(req.isURLValid(server.BaseUrl() + "/missing"));
+    EXPECT_EQ(CredRequestUtil::m_errCode, KOVA::CRED_REQ_ERR_QUERY_FAIL);
+    EXPECT_EQ(server.CountPath("/ok"), 2u);
 }
 
 }  // namespace

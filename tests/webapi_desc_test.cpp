@@ -16,32 +16,30 @@ class WebApiDescTest : public WebApiTest {
     static std::unique_ptr<kovasim::LoopbackServer> FixedQuery(const std::string &body,
                                                                KOVA_CRED &cred, int id) {
         auto server = FixedAnswer("/webapi/query.cgi", body, false);
-        FillCred(cred);
-        cred.port = server->Port();
+        cred = Cred(server->Port());
         cred.id = id;
         return server;
     }
 };
 
+// Each credential is described once, by one POST with the three standard parameters only, and
+// answered from the cache (by record or by id) until its description is removed.
 TEST_F(WebApiDescTest, DiscoversOncePerCredentialAndAnswersFromTheCache) {
-    int id = StoreCred();
-    KOVA_CRED cred;
-    ASSERT_EQ(0, KOVACredGetByID(id, &cred));
+    KOVA_CRED a = StoredCred("admin");
+    KOVA_CRED b = StoredCred("otpuser");
     size_t before = Sim().QueryHits();
 
-    EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&cred, "KOVA.Demo.Echo"));
+    EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&a, "KOVA.Demo.Echo"));
     EXPECT_EQ(before + 1, Sim().QueryHits());
-    EXPECT_TRUE(CredRequestUtil::IsCredIdCached(id));
-
-    EXPECT_EQ("upload.cgi", CredRequestUtil::GetWebAPIPath(&cred, "KOVA.Demo.Upload"));
-    EXPECT_EQ("JSON", CredRequestUtil::GetWebAPIRequestFormat(&cred, "KOVA.Demo.Json"));
-    EXPECT_EQ("", CredRequestUtil::GetWebAPIRequestFormat(&cred, "KOVA.Demo.Echo"));
-    EXPECT_EQ("auth.cgi", CredRequestUtil::GetWebAPIPath(static_cast<long>(id), "KOVA.API.Auth"));
+    EXPECT_TRUE(CredRequestUtil::IsCredIdCached(a.id));
+    EXPECT_FALSE(CredRequestUtil::IsCredIdCached(b.id));
+    EXPECT_EQ("upload.cgi", CredRequestUtil::GetWebAPIPath(&a, "KOVA.Demo.Upload"));
+    EXPECT_EQ("JSON", CredRequestUtil::GetWebAPIRequestFormat(&a, "KOVA.Demo.Json"));
+    EXPECT_EQ("", CredRequestUtil::GetWebAPIRequestFormat(&a, "KOVA.Demo.Echo"));
+    EXPECT_EQ("auth.cgi", CredRequestUtil::GetWebAPIPath(static_cast<long>(a.id), "KOVA.API.Auth"));
     EXPECT_EQ("JSON",
-              CredRequestUtil::GetWebAPIRequestFormat(static_cast<long>(id), "KOVA.Demo.Json"));
+              CredRequestUtil::GetWebAPIRequestFormat(static_cast<long>(a.id), "KOVA.Demo.Json"));
     EXPECT_EQ(before + 1, Sim().QueryHits());
-
-    // What reached the wire: one POST with the three standard parameters only.
     ASSERT_EQ(1u, Server().CountPath("/webapi/query.cgi"));
     kovasim::RecordedRequest query = Server().Requests().front();
     EXPECT_EQ("POST", query.method);
@@ -49,10 +47,26 @@ TEST_F(WebApiDescTest, DiscoversOncePerCredentialAndAnswersFromTheCache) {
     EXPECT_EQ("1", query.Param("version"));
     EXPECT_EQ("query", query.Param("method"));
     EXPECT_EQ((std::set<std::string>{"api", "method", "version"}), ParamNames(query));
-
-    const Json::Value &entry = CredRequestUtil::m_jsData["webapiDesc"][std::to_string(id)];
+    const Json::Value &entry = CredRequestUtil::m_jsData["webapiDesc"][std::to_string(a.id)];
     EXPECT_EQ("delay.cgi", entry["KOVA.Demo.Delay"]["path"].asString());
     EXPECT_EQ(1, entry["KOVA.Demo.Delay"]["minVersion"].asInt());
+
+    // A second credential of the same server has its own entry.
+    EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&b, "KOVA.Demo.Echo"));
+    EXPECT_EQ(before + 2, Sim().QueryHits());
+    CredRequestUtil::RemoveWebAPIDesc(&a);
+    EXPECT_FALSE(CredRequestUtil::IsCredIdCached(a.id));
+    EXPECT_TRUE(CredRequestUtil::IsCredIdCached(b.id));
+    EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&b, "KOVA.Demo.Echo"));
+    EXPECT_EQ(before + 2, Sim().QueryHits());
+    EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&a, "KOVA.Demo.Echo"));
+    EXPECT_EQ(before + 3, Sim().QueryHits());
+
+    // An unstored credential is cached under -1.
+    KOVA_CRED unstored = Cred();
+    ASSERT_EQ(-1, unstored.id);
+    EXPECT_EQ("encryption.cgi", CredRequestUtil::GetWebAPIPath(&unstored, "KOVA.API.Encryption"));
+    EXPECT_TRUE(CredRequestUtil::m_jsData["webapiDesc"].isMember("-1"));
 }
 
 TEST_F(WebApiDescTest, UnknownApiSetsErrorSixAndIsQueriedAgain) {
@@ -123,45 +137,14 @@ TEST_F(WebApiDescTest, UnusableAnswersAreNotCached) {
 }
 
 TEST_F(WebApiDescTest, FailedTransferSetsErrorFive) {
-    KOVA_CRED cred = Cred();
     kovasim::RefusedPort closed;
-    cred.port = closed.Port();
+    KOVA_CRED cred = Cred(closed.Port());
     cred.id = 11;
     EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, CredRequestUtil::m_errCode);
     EXPECT_TRUE(LogHas("Cred Error:[http://127.0.0.1:" + std::to_string(cred.port) +
                        "/webapi/query.cgi][20]"))
         << LogDump();
-}
-
-TEST_F(WebApiDescTest, TwoCredentialsOfOneServerAreCachedSeparately) {
-    int first = StoreCred("admin");
-    int second = StoreCred("otpuser");
-    KOVA_CRED a;
-    KOVA_CRED b;
-    ASSERT_EQ(0, KOVACredGetByID(first, &a));
-    ASSERT_EQ(0, KOVACredGetByID(second, &b));
-    size_t before = Sim().QueryHits();
-
-    EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&a, "KOVA.Demo.Echo"));
-    EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&b, "KOVA.Demo.Echo"));
-    EXPECT_EQ(before + 2, Sim().QueryHits());
-    EXPECT_TRUE(CredRequestUtil::IsCredIdCached(first));
-    EXPECT_TRUE(CredRequestUtil::IsCredIdCached(second));
-
-    CredRequestUtil::RemoveWebAPIDesc(&a);
-    EXPECT_FALSE(CredRequestUtil::IsCredIdCached(first));
-    EXPECT_TRUE(CredRequestUtil::IsCredIdCached(second));
-    EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&b, "KOVA.Demo.Echo"));
-    EXPECT_EQ(before + 2, Sim().QueryHits());
-    EXPECT_EQ("entry.cgi", CredRequestUtil::GetWebAPIPath(&a, "KOVA.Demo.Echo"));
-    EXPECT_EQ(before + 3, Sim().QueryHits());
-
-    // An unstored credential is cached under -1.
-    KOVA_CRED unstored = Cred();
-    ASSERT_EQ(-1, unstored.id);
-    EXPECT_EQ("encryption.cgi", CredRequestUtil::GetWebAPIPath(&unstored, "KOVA.API.Encryption"));
-    EXPECT_TRUE(CredRequestUtil::m_jsData["webapiDesc"].isMember("-1"));
 }
 
 TEST_F(WebApiDescTest, BadArgumentsAndUnknownIdsAreRefusedWithoutTraffic) {

@@ -14,15 +14,6 @@ namespace {
 using KOVA::CredRequest;
 using KOVA::CredRequestUtil;
 
-using kova_test::File;
-
-File StreamWith(const std::string &text) {
-    File f(tmpfile());
-    fputs(text.c_str(), f.get());
-    rewind(f.get());
-    return f;
-}
-
 class WebApiFactoryTest : public WebApiTest {
   protected:
     std::string EntryUrl() const { return Server().BaseUrl() + "/webapi/entry.cgi"; }
@@ -59,8 +50,7 @@ TEST_F(WebApiFactoryTest, RecordFormSendsSessionAsPostCookieAndTokenInQuery) {
             CredRequest::CreateWebAPIRequest(&cred, &sess, "KOVA.Demo.Echo", 2, "echo", params));
         ASSERT_TRUE(request) << LogDump();
         EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, request->GetError());
-        ASSERT_TRUE(request->Process(true, 0));
-
+        EXPECT_EQ("1", Answer(*request)["data"]["params"]["x"].asString());
         kovasim::RecordedRequest wire = Server().Last();
         EXPECT_EQ("/webapi/entry.cgi", wire.path);
         EXPECT_EQ("POST", wire.method);
@@ -71,7 +61,6 @@ TEST_F(WebApiFactoryTest, RecordFormSendsSessionAsPostCookieAndTokenInQuery) {
         EXPECT_EQ(c.names, ParamNames(wire));
         EXPECT_EQ(c.sid, wire.Param("_sid"));
         EXPECT_NE(std::string::npos, wire.body.find(std::string("_sid=") + c.sid));
-        EXPECT_EQ("1", ParseBody(request->GetResponse())["data"]["params"]["x"].asString());
     }
 }
 
@@ -85,12 +74,10 @@ TEST_F(WebApiFactoryTest, JsonFormatApiGetsJsonEncodedValues) {
         CredRequest::CreateWebAPIRequest(&cred, &sess, "KOVA.Demo.Json", 1, "get", params));
     ASSERT_TRUE(request);
     EXPECT_EQ("JSON", request->GetRequestFormat());
-    ASSERT_TRUE(request->Process(true, 0));
-    Json::Value answer = ParseBody(request->GetResponse());
-    ASSERT_TRUE(answer["success"].asBool()) << request->GetResponse();
-    EXPECT_TRUE(answer["data"]["params"]["count"].isInt());
-    EXPECT_EQ(5, answer["data"]["params"]["count"].asInt());
-    EXPECT_EQ("kova", answer["data"]["params"]["name"].asString());
+    const Json::Value answer = Answer(*request)["data"]["params"];
+    EXPECT_TRUE(answer["count"].isInt());
+    EXPECT_EQ(5, answer["count"].asInt());
+    EXPECT_EQ("kova", answer["name"].asString());
 }
 
 TEST_F(WebApiFactoryTest, FillFormErrorCodes) {
@@ -163,17 +150,13 @@ TEST_F(WebApiFactoryTest, CredentialIdFormLogsInOnceAndReusesTheSession) {
         CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Session", 1, "whoami", Json::Value()));
     ASSERT_TRUE(first) << LogDump();
     EXPECT_EQ(logins + 1, Sim().Hits("KOVA.API.Auth"));
-    ASSERT_TRUE(first->Process(true, 0));
-    Json::Value answer = ParseBody(first->GetResponse());
-    ASSERT_TRUE(answer["success"].asBool()) << first->GetResponse();
-    EXPECT_EQ("admin", answer["data"]["account"].asString());
+    EXPECT_EQ("admin", Answer(*first)["data"]["account"].asString());
 
     std::unique_ptr<CredRequest> second(
         CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Session", 1, "whoami", Json::Value()));
     ASSERT_TRUE(second);
     EXPECT_EQ(logins + 1, Sim().Hits("KOVA.API.Auth"));
-    ASSERT_TRUE(second->Process(true, 0));
-    EXPECT_TRUE(ParseBody(second->GetResponse())["success"].asBool());
+    EXPECT_EQ("admin", Answer(*second)["data"]["account"].asString());
 
     EXPECT_EQ(nullptr,
               CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Echo", 0, "echo", Json::Value()));
@@ -233,9 +216,7 @@ TEST_F(WebApiFactoryTest, ProcessWithLoginAttachesAFreshSession) {
     CredRequest request;
     WhoAmI(request);
     ASSERT_TRUE(request.ProcessWithLogin(id, true, 0)) << LogDump();
-    Json::Value answer = ParseBody(request.GetResponse());
-    ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
-    EXPECT_EQ("admin", answer["data"]["account"].asString());
+    EXPECT_EQ("admin", ParseBody(request.GetResponse())["data"]["account"].asString());
     kovasim::RecordedRequest wire = Server().Last();
     EXPECT_TRUE(wire.HasParam("KovaToken"));
     EXPECT_EQ("", wire.query);
@@ -268,9 +249,7 @@ TEST_F(WebApiFactoryTest, RequestLoginAndLogout) {
     CredRequest request;
     WhoAmI(request);
     ASSERT_TRUE(request.Login("admin", "secret")) << LogDump();
-    ASSERT_TRUE(request.Process(true, 0));
-    Json::Value answer = ParseBody(request.GetResponse());
-    ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
+    Answer(request);
     kovasim::RecordedRequest wire = Server().Last();
     const std::string sid = wire.Param("_sid");
     EXPECT_NE(std::string::npos, wire.query.find("_sid=" + sid));
@@ -313,9 +292,7 @@ TEST_F(WebApiFactoryTest, SetWebApiRequestUsesTheRequestsOwnCredential) {
     Json::Value params;
     params["a"] = "b";
     ASSERT_TRUE(request.SetWebAPIRequest("KOVA.Demo.Echo", 1, "echo", params)) << LogDump();
-    ASSERT_TRUE(request.Process(true, 0));
-    Json::Value answer = ParseBody(request.GetResponse());
-    ASSERT_TRUE(answer["success"].asBool()) << request.GetResponse();
+    const Json::Value answer = Answer(request);
     EXPECT_EQ("b", answer["data"]["params"]["a"].asString());
     EXPECT_EQ("KOVA.Demo.Echo", answer["data"]["api"].asString());
 

@@ -53,21 +53,17 @@ class WebApiTest : public ::testing::Test {
     static kovasim::WebApiSim &Sim() { return *sim_; }
     static kovasim::LoopbackServer &Server() { return *server_; }
 
-    // A credential record for the simulator (not stored).
-    static void FillCred(KOVA_CRED &cred, const std::string &account = "admin",
-                         const std::string &password = "secret",
-                         const std::string &application = "") {
+    // A credential record for the simulator, or for the server on `port` (not stored).
+    static KOVA_CRED Cred(int port = 0, const std::string &account = "admin",
+                          const std::string &password = "secret",
+                          const std::string &application = "") {
+        KOVA_CRED cred;
         cred.protocol = "http";
         cred.host = "127.0.0.1";
-        cred.port = Server().Port();
+        cred.port = port != 0 ? port : Server().Port();
         cred.remote_account = account;
         cred.remote_passwd = password;
         cred.application = application;
-    }
-
-    static KOVA_CRED Cred() {
-        KOVA_CRED cred;
-        FillCred(cred);
         return cred;
     }
 
@@ -75,11 +71,27 @@ class WebApiTest : public ::testing::Test {
     static int StoreCred(const std::string &account = "admin",
                          const std::string &password = "secret",
                          const std::string &application = "") {
-        KOVA_CRED cred;
-        FillCred(cred, account, password, application);
+        KOVA_CRED cred = Cred(0, account, password, application);
         EXPECT_EQ(0, KOVACredAdd(&cred));
         EXPECT_GT(cred.id, 0);
         return cred.id;
+    }
+
+    // Stores a credential for the simulator and returns it as the store gives it back.
+    static KOVA_CRED StoredCred(const std::string &account = "admin",
+                                const std::string &password = "secret",
+                                const std::string &application = "") {
+        KOVA_CRED cred;
+        EXPECT_EQ(0, KOVACredGetByID(StoreCred(account, password, application), &cred));
+        return cred;
+    }
+
+    // Runs `request` and returns its parsed answer, expecting both to succeed.
+    static Json::Value Answer(KOVA::CredRequest &request) {
+        EXPECT_TRUE(request.Process(true, 0)) << request.GetError() << "\n" << LogDump();
+        Json::Value answer = ParseBody(request.GetResponse());
+        EXPECT_TRUE(answer["success"].asBool()) << request.GetResponse();
+        return answer;
     }
 
     // A started server answering `path` with `body`; with `withSim` the simulator serves its

@@ -1,7 +1,7 @@
 // The simulator's own contract: JSON error answers for every bad request (never a crash),
 // configuration checks, and enough worker threads for many concurrent slow calls.
 #include <atomic>
-#include <chrono>
+#include <fstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -33,29 +33,38 @@ class WebApiSimTest : public WebApiTest {
 
 TEST_F(WebApiSimTest, BadRequestsGetJsonErrors) {
     using S = kovasim::WebApiSim;
-    EXPECT_EQ(S::kErrMissingParam, Post("entry.cgi", "version=1&method=echo"));
-    EXPECT_EQ(S::kErrMissingParam, Post("entry.cgi", "garbage"));
-    EXPECT_EQ(S::kErrNoSuchApi, Post("entry.cgi", "api=KOVA.None&version=1&method=x"));
-    EXPECT_EQ(S::kErrNoSuchApi, Post("auth.cgi", "api=KOVA.Demo.Echo&version=1&method=x"));
-    EXPECT_EQ(S::kErrBadVersion, Post("entry.cgi", "api=KOVA.Demo.Echo&version=3&method=x"));
-    EXPECT_EQ(S::kErrBadParam, Post("entry.cgi", "api=KOVA.Demo.Echo&version=one&method=x"));
-    EXPECT_EQ(S::kErrNoSuchMethod, Post("query.cgi", "api=KOVA.API.Info&version=1&method=x"));
-    EXPECT_EQ(S::kErrNeedEncryption, Post("auth.cgi",
-                                          "api=KOVA.API.Auth&version=3&method=login&account=admin&"
-                                          "passwd=secret"));
-    EXPECT_EQ(S::kErrBadVersion,
-              Post("auth.cgi", "api=KOVA.API.Auth&version=1&method=login&account=admin"));
-    EXPECT_EQ(S::kErrBadEnvelope, Post("auth.cgi", Sim().CipherKey() + "=%21%21notbase64"));
-    EXPECT_EQ(S::kErrBadEnvelope, Post("auth.cgi", Sim().CipherKey() + "=QUJDRA%3D%3D"));
-    EXPECT_EQ(S::kErrBadEnvelope, Post("entry.cgi", "__tXeTrEhPiC=QUJD&__nEkOtReHpIc=wrong"));
-    EXPECT_EQ(S::kErrInvalidSession,
-              Post("entry.cgi", "api=KOVA.Demo.Session&version=1&method=x&_sid=unknown"));
-    EXPECT_EQ(S::kErrInvalidSession,
-              Post("auth.cgi", "api=KOVA.API.Auth&version=1&method=logout&_sid=unknown"));
-    EXPECT_EQ(S::kErrMissingParam, Post("auth.cgi", "api=KOVA.API.Auth&version=1&method=logout"));
-    EXPECT_EQ(S::kErrBadParam, Post("entry.cgi", "count=notjson", nullptr,
-                                    "?api=%22KOVA.Demo.Json%22&version=%221%22&method=%22get%22"));
-    EXPECT_EQ(S::kErrBadParam, Post("delay.cgi", "api=KOVA.Demo.Delay&version=1&method=x&ms=z"));
+    const std::string login = "api=KOVA.API.Auth&version=3&method=login&account=admin";
+    const struct {
+        const char *cgi;
+        std::string body;
+        int code;
+        const char *query;
+    } cases[] = {
+        {"entry.cgi", "version=1&method=echo", S::kErrMissingParam, ""},
+        {"entry.cgi", "garbage", S::kErrMissingParam, ""},
+        {"entry.cgi", "api=KOVA.None&version=1&method=x", S::kErrNoSuchApi, ""},
+        {"auth.cgi", "api=KOVA.Demo.Echo&version=1&method=x", S::kErrNoSuchApi, ""},
+        {"entry.cgi", "api=KOVA.Demo.Echo&version=3&method=x", S::kErrBadVersion, ""},
+        {"entry.cgi", "api=KOVA.Demo.Echo&version=one&method=x", S::kErrBadParam, ""},
+        {"query.cgi", "api=KOVA.API.Info&version=1&method=x", S::kErrNoSuchMethod, ""},
+        {"auth.cgi", login + "&passwd=secret", S::kErrNeedEncryption, ""},
+        {"auth.cgi", "api=KOVA.API.Auth&version=1&method=login&account=admin", S::kErrBadVersion,
+         ""},
+        {"auth.cgi", Sim().CipherKey() + "=%21%21notbase64", S::kErrBadEnvelope, ""},
+        {"auth.cgi", Sim().CipherKey() + "=QUJDRA%3D%3D", S::kErrBadEnvelope, ""},
+        {"entry.cgi", "__tXeTrEhPiC=QUJD&__nEkOtReHpIc=wrong", S::kErrBadEnvelope, ""},
+        {"entry.cgi", "api=KOVA.Demo.Session&version=1&method=x&_sid=unknown",
+         S::kErrInvalidSession, ""},
+        {"auth.cgi", "api=KOVA.API.Auth&version=1&method=logout&_sid=unknown",
+         S::kErrInvalidSession, ""},
+        {"auth.cgi", "api=KOVA.API.Auth&version=1&method=logout", S::kErrMissingParam, ""},
+        {"entry.cgi", "count=notjson", S::kErrBadParam,
+         "?api=%22KOVA.Demo.Json%22&version=%221%22&method=%22get%22"},
+        {"delay.cgi", "api=KOVA.Demo.Delay&version=1&method=x&ms=z", S::kErrBadParam, ""},
+    };
+    for (const auto &c : cases) {
+        EXPECT_EQ(c.code, Post(c.cgi, c.body, nullptr, c.query)) << c.cgi << " " << c.body;
+    }
 
     Json::Value answer;
     EXPECT_EQ(0,
@@ -68,23 +77,17 @@ TEST_F(WebApiSimTest, BadRequestsGetJsonErrors) {
 }
 
 TEST_F(WebApiSimTest, UploadNeedsASessionAndAFile) {
-    KOVA_CRED cred;
-    FillCred(cred);
+    KOVA_CRED cred = Cred();
     KOVA_CRED_SESS sess;
     ASSERT_TRUE(KOVA::CredRequestUtil::Login(&cred, &sess));
     TempDir dir;
     std::string path = dir.File("data.bin");
-    FILE *f = fopen(path.c_str(), "wb");
-    ASSERT_NE(nullptr, f);
-    fputs("0123456789", f);
-    fclose(f);
+    std::ofstream(path) << "0123456789";
     std::unique_ptr<CredRequest> request(CredRequest::CreateWebAPIRequest(
         &cred, &sess, "KOVA.Demo.Upload", 1, "put", Json::Value()));
     ASSERT_TRUE(request);
     ASSERT_TRUE(request->SetUploadFile("file", path.c_str()));
-    ASSERT_TRUE(request->Process(true, 0));
-    Json::Value answer = ParseBody(request->GetResponse());
-    ASSERT_TRUE(answer["success"].asBool()) << request->GetResponse();
+    Json::Value answer = Answer(*request);
     EXPECT_EQ(10, answer["data"]["size"].asInt());
     EXPECT_EQ("data.bin", answer["data"]["name"].asString());
     ASSERT_FALSE(Sim().Uploads().empty());
@@ -104,39 +107,23 @@ TEST_F(WebApiSimTest, UploadNeedsASessionAndAFile) {
 TEST_F(WebApiSimTest, ConfigurationIsCheckedBeforeItApplies) {
     kovasim::WebApiSim sim;
     std::string error;
-    Json::Value bad;
-    bad["apis"]["X.Y"]["handler"] = "echo";
-    EXPECT_FALSE(sim.Configure(bad, &error));
+    EXPECT_FALSE(sim.Configure(ParseBody(R"({"apis": {"X.Y": {"handler": "echo"}}})"), &error));
     EXPECT_NE(std::string::npos, error.find("path")) << error;
-    bad = Json::Value();
-    bad["accounts"] = "admin";
-    EXPECT_FALSE(sim.Configure(bad, &error));
-    bad = Json::Value();
-    bad["delayMs"] = "slow";
-    EXPECT_FALSE(sim.Configure(bad, &error));
-    bad = Json::Value();
-    bad["apis"]["X.Y"]["path"] = "x.cgi";
-    bad["apis"]["X.Y"]["handler"] = "nonsense";
-    EXPECT_FALSE(sim.Configure(bad, &error));
+    for (const char *bad : {R"({"accounts": "admin"})", R"({"delayMs": "slow"})",
+                            R"({"apis": {"X.Y": {"path": "x.cgi", "handler": "nonsense"}}})"}) {
+        EXPECT_FALSE(sim.Configure(ParseBody(bad), &error)) << bad;
+    }
     EXPECT_FALSE(sim.Configure(Json::Value("text"), &error));
 
-    Json::Value good;
-    good["apis"]["X.Custom"]["path"] = "custom.cgi";
-    good["apis"]["X.Custom"]["requestFormat"] = "JSON";
-    good["apis"]["KOVA.Demo.Delay"] = Json::Value();
-    good["accounts"][0]["account"] = "ops";
-    good["accounts"][0]["password"] = "pw";
-    good["delayMs"] = 5;
-    EXPECT_TRUE(sim.Configure(good, &error)) << error;
+    EXPECT_TRUE(sim.Configure(ParseBody(R"({"apis": {"X.Custom": {"path": "custom.cgi",
+        "requestFormat": "JSON"}, "KOVA.Demo.Delay": null}, "delayMs": 5,
+        "accounts": [{"account": "ops", "password": "pw"}]})"),
+                              &error))
+        << error;
     kovasim::LoopbackServer server;
     sim.Install(server);
     ASSERT_TRUE(server.Start());
-    KOVA_CRED cred;
-    cred.protocol = "http";
-    cred.host = "127.0.0.1";
-    cred.port = server.Port();
-    cred.remote_account = "ops";
-    cred.remote_passwd = "pw";
+    KOVA_CRED cred = Cred(server.Port(), "ops", "pw");
     EXPECT_EQ("custom.cgi", KOVA::CredRequestUtil::GetWebAPIPath(&cred, "X.Custom"));
     EXPECT_EQ("JSON", KOVA::CredRequestUtil::GetWebAPIRequestFormat(&cred, "X.Custom"));
     EXPECT_EQ("", KOVA::CredRequestUtil::GetWebAPIPath(&cred, "KOVA.Demo.Delay"));
@@ -160,18 +147,14 @@ TEST_F(WebApiSimTest, ServesManySlowCallsAtOnce) {
     const int clients = 96;
     std::atomic<int> done{0};
     std::vector<std::thread> threads;
-    auto start = std::chrono::steady_clock::now();
     for (int i = 0; i < clients; ++i) {
         threads.emplace_back([&] { done += call() ? 1 : 0; });
     }
     for (auto &t : threads) {
         t.join();
     }
-    double seconds =
-        std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
     EXPECT_EQ(clients, done.load());
     EXPECT_GE(Sim().MaxConcurrent(), clients / 2);
-    EXPECT_LT(seconds, 0.4 * clients / 4);  // far from one call after another
 }
 
 }  // namespace

@@ -2,12 +2,11 @@
 
 #include <errno.h>
 #include <stdarg.h>
-#include <stdio.h>
 #include <stdlib.h>
-#include <string.h>
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <mutex>
 
@@ -21,9 +20,8 @@ std::atomic<bool> gFakeSleep{false};
 std::atomic<unsigned> gSleepDivisor{1};
 
 void Capture(const char *fmt, va_list ap) {
-    int saved = errno;
+    const int saved = errno;  // the caller's errno survives, and %m reads it
     char buf[8192];
-    errno = saved;  // keeps %m meaningful
     vsnprintf(buf, sizeof(buf), fmt, ap);
     std::lock_guard<std::mutex> lock(gMutex);
     gRecords.emplace_back(buf);
@@ -33,13 +31,25 @@ void Capture(const char *fmt, va_list ap) {
     errno = saved;
 }
 
-void RealSleep(unsigned long micros) {
+void Pause(std::vector<unsigned> &calls, unsigned asked, unsigned long micros) {
+    {
+        std::lock_guard<std::mutex> lock(gMutex);
+        calls.push_back(asked);
+    }
+    if (gFakeSleep) {
+        return;
+    }
     micros /= gSleepDivisor;
-    struct timespec ts;
-    ts.tv_sec = static_cast<time_t>(micros / 1000000);
-    ts.tv_nsec = static_cast<long>((micros % 1000000) * 1000);
+    struct timespec ts = {static_cast<time_t>(micros / 1000000),
+                          static_cast<long>((micros % 1000000) * 1000)};
     while (nanosleep(&ts, &ts) != 0 && errno == EINTR) {
     }
+}
+
+template <typename T>
+T Locked(const T &value) {
+    std::lock_guard<std::mutex> lock(gMutex);
+    return value;
 }
 
 }  // namespace
@@ -69,24 +79,12 @@ void __syslog_chk(int, int, const char *fmt, ...) {
 }
 
 int usleep(useconds_t usec) {
-    {
-        std::lock_guard<std::mutex> lock(gMutex);
-        gUsleeps.push_back(usec);
-    }
-    if (!gFakeSleep) {
-        RealSleep(usec);
-    }
+    Pause(gUsleeps, usec, usec);
     return 0;
 }
 
 unsigned int sleep(unsigned int seconds) {
-    {
-        std::lock_guard<std::mutex> lock(gMutex);
-        gSleeps.push_back(seconds);
-    }
-    if (!gFakeSleep) {
-        RealSleep(static_cast<unsigned long>(seconds) * 1000000UL);
-    }
+    Pause(gSleeps, seconds, seconds * 1000000UL);
     return 0;
 }
 
@@ -95,8 +93,7 @@ unsigned int sleep(unsigned int seconds) {
 namespace kova_test {
 
 std::vector<std::string> LogRecords() {
-    std::lock_guard<std::mutex> lock(gMutex);
-    return gRecords;
+    return Locked(gRecords);
 }
 
 void ClearLog() {
@@ -105,22 +102,16 @@ void ClearLog() {
 }
 
 size_t LogCount(const std::string &needle) {
-    std::lock_guard<std::mutex> lock(gMutex);
-    size_t n = 0;
-    for (const auto &r : gRecords) {
-        if (r.find(needle) != std::string::npos) {
-            ++n;
-        }
-    }
-    return n;
+    const auto records = LogRecords();
+    return static_cast<size_t>(std::count_if(records.begin(), records.end(), [&](const auto &r) {
+        return r.find(needle) != std::string::npos;
+    }));
 }
 
 std::string LogDump() {
-    std::lock_guard<std::mutex> lock(gMutex);
     std::string out;
-    for (const auto &r : gRecords) {
-        out += r;
-        out += '\n';
+    for (const auto &r : LogRecords()) {
+        out += r + '\n';
     }
     return out;
 }
@@ -134,19 +125,37 @@ void SetSleepDivisor(unsigned divisor) {
 }
 
 std::vector<unsigned> UsleepCalls() {
-    std::lock_guard<std::mutex> lock(gMutex);
-    return gUsleeps;
+    return Locked(gUsleeps);
 }
 
 std::vector<unsigned> SleepCalls() {
-    std::lock_guard<std::mutex> lock(gMutex);
-    return gSleeps;
+    return Locked(gSleeps);
 }
 
 void ClearSleeps() {
     std::lock_guard<std::mutex> lock(gMutex);
     gUsleeps.clear();
     gSleeps.clear();
+}
+
+File StreamWith(const std::string &text, bool atEnd) {
+    File f(tmpfile());
+    if (f) {
+        fwrite(text.data(), 1, text.size(), f.get());
+        fseek(f.get(), 0, atEnd ? SEEK_END : SEEK_SET);
+    }
+    return f;
+}
+
+std::string ReadAll(FILE *f) {
+    fflush(f);
+    rewind(f);
+    std::string out;
+    char buf[65536];
+    for (size_t n; (n = fread(buf, 1, sizeof(buf), f)) > 0;) {
+        out.append(buf, n);
+    }
+    return out;
 }
 
 }  // namespace kova_test

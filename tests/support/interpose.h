@@ -1,11 +1,16 @@
 // Test-side replacements of libc's syslog, usleep and sleep. Every test program links
 // interpose.cpp and exports its symbols, so the library's calls land here: log records are
 // captured for assertions, and sleeps are counted (and skipped while fake sleeping is on).
+// Also the temporary streams the request tests hand to the library.
 #ifndef KOVA_TESTS_SUPPORT_INTERPOSE_H
 #define KOVA_TESTS_SUPPORT_INTERPOSE_H
 
+#include <stdio.h>
+
 #include <string>
 #include <vector>
+
+#include "support/temp_dir.h"
 
 namespace kova_test {
 
@@ -38,6 +43,11 @@ class FakeSleepScope {
     }
     ~FakeSleepScope() { SetFakeSleep(false); }
 };
+
+// A temporary stream holding `text`, positioned at its start (or its end).
+File StreamWith(const std::string &text, bool atEnd = false);
+// Everything `f` holds (after flushing it), from its start.
+std::string ReadAll(FILE *f);
 
 }  // namespace kova_test
 
