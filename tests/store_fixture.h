@@ -61,7 +61,9 @@ inline SessPtr MakeSess(int id, const std::string &sid, const std::string &token
     return sess;
 }
 
-using Row = std::vector<std::string>;  // column texts; NULL reads as "<NULL>"
+using Ints = std::vector<int32_t>;
+using Texts = std::vector<std::string>;
+using Row = Texts;  // column texts; NULL reads as "<NULL>"
 
 // Runs `sql` on its own connection and returns every row.
 inline std::vector<Row> RawQuery(const std::string &dbPath, const std::string &sql) {

@@ -15,8 +15,6 @@ using namespace store_test;
 
 using InterfaceTest = StoreTest;
 using SessionTest = StoreTest;
-using Ints = std::vector<int32_t>;
-using Texts = std::vector<std::string>;
 
 TEST_F(InterfaceTest, ArgumentErrorsTouchNoDatabase) {
     CredPtr cred = NewCred();
