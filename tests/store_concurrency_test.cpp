@@ -11,7 +11,6 @@
 #include <chrono>
 #include <functional>
 #include <map>
-#include <memory>
 #include <numeric>
 #include <random>
 #include <string>
@@ -103,12 +102,12 @@ TEST_F(LockTest, LockedWriteIsTried101TimesThenLoggedOnce) {
     EXPECT_EQ(id, -1);
     EXPECT_EQ(counter.count, 101);
     ExpectSleepsInRange(100);
-    auto records = kova_test::LogRecords();
-    ASSERT_EQ(records.size(), 1u) << kova_test::LogDump();
-    EXPECT_EQ(records[0].rfind("cred_db:214 Exec sql:[INSERT INTO credentials \t\t(ctime", 0), 0u);
-    EXPECT_NE(records[0].find("'admin', '***', '5001'"), std::string::npos) << records[0];
-    EXPECT_EQ(records[0].find("pw-locked"), std::string::npos) << "the password was logged";
-    EXPECT_NE(records[0].find("] error: database is locked\n"), std::string::npos);
+    // One record, the password hidden.
+    EXPECT_EQ(kova_test::LogRecords().size(), 1u) << kova_test::LogDump();
+    EXPECT_EQ(LogCountPrefix("cred_db:214 Exec sql:[INSERT INTO credentials \t\t(ctime"), 1u);
+    EXPECT_EQ(kova_test::LogCount("'admin', '***', '5001', 'https', 'app', '{\"k\":1}', " +
+                                  std::to_string(getpid()) + ");] error: database is locked\n"),
+              1u);
 
     // Reads retry the same way.
     counter = {"SELECT * FROM credentials"};
@@ -125,12 +124,9 @@ TEST_F(LockTest, LockedWriteIsTried101TimesThenLoggedOnce) {
     EXPECT_EQ(KOVACredAdd(added.get()), -1);
     EXPECT_EQ(added->id, -1);
     ExpectSleepsInRange(100);
-    records = kova_test::LogRecords();
-    ASSERT_EQ(records.size(), 2u) << kova_test::LogDump();
-    EXPECT_EQ(records[0].rfind("cred_db:175 Exec sql:[CREATE TABLE if not exists credentials", 0),
-              0u);
-    EXPECT_NE(records[0].find("error: database is locked"), std::string::npos);
-    EXPECT_EQ(records[1].rfind("cred_add:16 Init sqlite failed. [0x", 0), 0u);
+    EXPECT_EQ(kova_test::LogRecords(), (Texts{"cred_db:175 Exec sql:[" + std::string(kCredSchema) +
+                                                  "] error: database is locked\n",
+                                              "cred_add:16 Init sqlite failed. [0x0000 :0]"}));
 
     // Once the other connection lets go, the same write goes through at once.
     ASSERT_EQ(sqlite3_exec(raw, "COMMIT;", nullptr, nullptr, nullptr), SQLITE_OK);
@@ -160,11 +156,7 @@ Draw DrawInChild() {
         draw.before = time(nullptr);
         std::vector<std::thread> threads;
         for (int i = 0; i < 4; ++i) {
-            threads.emplace_back([] {
-                KOVA_CRED *list = nullptr;
-                KOVACredListGet(&list, nullptr, nullptr);
-                KOVACredListFree(&list);
-            });
+            threads.emplace_back([] { KOVACredIDGetByApplication("app"); });
         }
         for (auto &t : threads) {
             t.join();
@@ -188,14 +180,11 @@ Draw DrawInChild() {
 TEST_F(StoreTest, EveryProcessSeedsOnceWithItsOwnPid) {
     // The parent is seeded and its children inherit the generator. The tables exist, so that
     // the children's reads meet no lock (whose pauses would draw from rand()).
-    DbPtr db(KOVACredDBInit());
-    ASSERT_NE(db, nullptr);
+    ASSERT_NE(DbPtr(KOVACredDBInit()), nullptr);
     const Draw first = DrawInChild();
     const Draw second = DrawInChild();
-    std::vector<int> parent;
-    for (int i = 0; i < 8; ++i) {
-        parent.push_back(rand());
-    }
+    std::vector<int> parent(8);
+    std::generate(parent.begin(), parent.end(), rand);
     EXPECT_NE(std::vector<int>(first.values.begin(), first.values.begin() + 8), parent)
         << "the child went on with the parent's sequence";
     EXPECT_NE(first.values, second.values);
@@ -265,10 +254,7 @@ void WriteUntilKilled(const std::string &prefix) {
 }
 
 TEST_F(StoreTest, WritersKilledAtRandomMomentsLeaveWholeRows) {
-    {
-        DbPtr db(KOVACredDBInit());
-        ASSERT_NE(db, nullptr);
-    }
+    ASSERT_NE(DbPtr(KOVACredDBInit()), nullptr);
     const unsigned seed = std::random_device{}();
     SCOPED_TRACE("kill moments from seed " + std::to_string(seed));
     std::mt19937 rng(seed);
@@ -297,11 +283,10 @@ TEST_F(StoreTest, WritersKilledAtRandomMomentsLeaveWholeRows) {
     // Each credential was added, given a session and updated, and was killed at any step.
     const auto rows = Query(kJoinedRows);
     for (const Row &row : rows) {
-        bool whole = false;
-        for (int step = 0; step < 3 && !whole; ++step) {
-            whole = row == Written(row[0], row[1], step == 2 ? 2 : 1, step == 0 ? 0 : 1);
-        }
-        EXPECT_TRUE(whole) << "torn row " << row[0];
+        auto is = [&](int version, int session) {
+            return row == Written(row[0], row[1], version, session);
+        };
+        EXPECT_TRUE(is(1, 0) || is(1, 1) || is(2, 1)) << "torn row " << row[0];
     }
     EXPECT_GT(rows.size(), 0u) << "the writers wrote nothing before they were killed";
     EXPECT_EQ(Query("SELECT count(DISTINCT host) FROM credentials;"),
@@ -422,10 +407,7 @@ TEST_F(StoreTest, SoakOfEightProcessesLosesNothing) {
     const kova_test::TempDir dir(access("/dev/shm", W_OK) == 0 ? "/dev/shm" : "");
     const std::string path = dir.File("credentials.sqlite");
     setenv("kovacredential_db", path.c_str(), 1);
-    {
-        DbPtr db(KOVACredDBInit());
-        ASSERT_NE(db, nullptr);
-    }
+    ASSERT_NE(DbPtr(KOVACredDBInit()), nullptr);
     const size_t size = sizeof(SoakReport) * kSoakProcesses;
     void *shared = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
     ASSERT_NE(shared, MAP_FAILED);

@@ -464,10 +464,8 @@ TEST_F(DatabaseTest, PathsThatAreNotOpened) {
          [](auto &p) { return WriteFile(p, "", 0600) ? p + "/sub/db.sqlite" : ""; }},
         {"file that is not a database",
          0,
-         {"cred_db:175 Exec sql:[CREATE TABLE if not exists credentials (id INTEGER PRIMARY KEY "
-          "ASC, \t\t\t\t\t\t ctime INTEGER, mtime INTEGER, host TEXT, owner INTEGER, "
-          "remote_account TEXT, \t\t\t\t\t\t remote_passwd TEXT, port INTEGER, protocol TEXT, "
-          "application TEXT, extra_info TEXT, pid INTEGER);] error: file is not a database\n"},
+         {"cred_db:175 Exec sql:[" + std::string(kCredSchema) +
+          "] error: file is not a database\n"},
          [](auto &p) { return WriteFile(p, std::string(8192, 'J'), 0600) ? p : ""; }},
     };
     for (size_t i = 0; i < cases.size(); ++i) {

@@ -61,6 +61,13 @@ inline SessPtr MakeSess(int id, const std::string &sid, const std::string &token
     return sess;
 }
 
+// The credential table's schema statement.
+constexpr const char kCredSchema[] =
+    "CREATE TABLE if not exists credentials (id INTEGER PRIMARY KEY ASC, \t\t\t\t\t\t ctime "
+    "INTEGER, mtime INTEGER, host TEXT, owner INTEGER, remote_account TEXT, \t\t\t\t\t\t "
+    "remote_passwd TEXT, port INTEGER, protocol TEXT, application TEXT, extra_info TEXT, pid "
+    "INTEGER);";
+
 using Ints = std::vector<int32_t>;
 using Texts = std::vector<std::string>;
 using Row = Texts;  // column texts; NULL reads as "<NULL>"
