@@ -3,6 +3,7 @@
 #include <stddef.h>
 #include <stdint.h>
 
+#include <algorithm>
 #include <string>
 #include <vector>
 
@@ -32,43 +33,33 @@ const char *const kNames[] = {"id",
 // Input: a sequence of columns, each a name selector byte, a value length byte (255 = NULL)
 // and that many value bytes. Every fourth column starts a new row.
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
+    constexpr size_t kMaxColumns = 64;
     std::vector<std::string> values;
-    std::vector<bool> nulls;
+    values.reserve(kMaxColumns);  // the texts point into it
     std::vector<const char *> names;
-    size_t pos = 0;
-    while (pos + 2 <= size && names.size() < 64) {
+    std::vector<char *> texts;
+    for (size_t pos = 0; pos + 2 <= size && names.size() < kMaxColumns;) {
         names.push_back(kNames[data[pos] % (sizeof(kNames) / sizeof(kNames[0]))]);
         const uint8_t length = data[pos + 1];
         pos += 2;
-        const bool isNull = length == 255;
-        const size_t take = isNull ? 0 : (length < size - pos ? length : size - pos);
+        const size_t take = length == 255 ? 0 : std::min<size_t>(length, size - pos);
         values.emplace_back(reinterpret_cast<const char *>(data + pos), take);
-        nulls.push_back(isNull);
+        texts.push_back(length == 255 ? nullptr : &values.back()[0]);
         pos += take;
     }
-    std::vector<char *> texts;
-    for (size_t i = 0; i < values.size(); ++i) {
-        texts.push_back(nulls[i] ? nullptr : &values[i][0]);
-    }
-    char **azVal = texts.empty() ? nullptr : texts.data();
-    char **azCol = const_cast<char **>(names.empty() ? nullptr : names.data());
     const int nCol = static_cast<int>(names.size());
-
     KOVA_CRED cred;
     KOVA_CRED_SESS sess;
     KOVA_CRED *credList = nullptr;
     KOVA_CRED_SESS *sessList = nullptr;
-    for (int start = 0; start < nCol || start == 0; start += 4) {
-        const int n = nCol - start < 4 ? nCol - start : 4;
-        char **vals = azVal ? azVal + start : nullptr;
-        char **cols = azCol ? azCol + start : nullptr;
+    for (int start = 0; start == 0 || start < nCol; start += 4) {
+        const int n = std::min(4, nCol - start);
+        char **vals = texts.data() + start;
+        char **cols = const_cast<char **>(names.data()) + start;
         CredRowFirst(&cred, n, vals, cols);
         CredRowAppend(&credList, n, vals, cols);
         CredSessRowFirst(&sess, n, vals, cols);
         CredSessRowAppend(&sessList, n, vals, cols);
-        if (nCol == 0) {
-            break;
-        }
     }
     KOVACredListFree(&credList);
     KOVACredSessListFree(&sessList);

@@ -47,9 +47,7 @@ TEST(FileTouch, CreatesMissingFoldersPrivately) {
     EXPECT_EQ(st.st_mode & 0777, 0700u);
 
     // An existing file keeps its contents.
-    FILE *f = fopen(path.c_str(), "w");
-    fputs("data", f);
-    fclose(f);
+    ASSERT_EQ(truncate(path.c_str(), 4), 0);
     ASSERT_EQ(VLIBCFileTouch(path.c_str()), 0);
     ASSERT_EQ(stat(path.c_str(), &st), 0);
     EXPECT_EQ(st.st_size, 4);
@@ -81,22 +79,23 @@ TEST(UrlForLog, HidesOnlyThePasswordOfTheUserInformation) {
     }
 }
 
-std::string Encode(const std::string &in) {
-    char buf[256];
-    EXPECT_NE(VLIBCBase64SzEncodeFull(reinterpret_cast<const unsigned char *>(in.data()), in.size(),
-                                      buf, sizeof(buf), 0),
-              0);
-    return buf;
+// The Base64 text of some bytes, or "<fails>" when a buffer of `room` bytes is too small.
+std::string Encode(const std::string &in, size_t room = 512) {
+    char buf[512];
+    const auto *data = reinterpret_cast<const unsigned char *>(in.data());
+    return VLIBCBase64SzEncodeFull(data, in.size(), buf, room, 0) != 0 ? buf : "<fails>";
 }
 
-std::string Decode(const std::string &in, bool *ok) {
+// The bytes of a Base64 text, or "<fails>" when it is no Base64 or does not fit `room` bytes.
+std::string Decode(const std::string &in, size_t room = 256) {
     unsigned char buf[256];
-    size_t len = sizeof(buf);
-    *ok = VLIBCBase64Decode(in.data(), in.size(), buf, &len) != 0;
-    return *ok ? std::string(reinterpret_cast<char *>(buf), len) : "";
+    size_t len = room;
+    return VLIBCBase64Decode(in.data(), in.size(), buf, &len) != 0
+               ? std::string(reinterpret_cast<char *>(buf), len)
+               : "<fails>";
 }
 
-TEST(Base64, MatchesTheStandardVectorsBothWays) {
+TEST(Base64, MatchesTheStandardVectorsBothWaysAndRejectsBadInput) {
     const std::pair<std::string, std::string> vectors[] = {
         {"", ""},
         {"f", "Zg=="},
@@ -108,38 +107,18 @@ TEST(Base64, MatchesTheStandardVectorsBothWays) {
         {std::string("\xfb\xff\x00", 3), "+/8A"}};
     for (const auto &v : vectors) {
         EXPECT_EQ(Encode(v.first), v.second);
-        bool ok = false;
-        EXPECT_EQ(Decode(v.second, &ok), v.first);
-        EXPECT_TRUE(ok) << v.second;
+        EXPECT_EQ(Decode(v.second), v.first);
     }
     // Long input is not broken into lines.
-    std::string longText(300, 'x');
-    char big[512];
-    ASSERT_NE(VLIBCBase64SzEncodeFull(reinterpret_cast<const unsigned char *>(longText.data()),
-                                      longText.size(), big, sizeof(big), 0),
-              0);
-    EXPECT_EQ(std::string(big).find('\n'), std::string::npos);
-    EXPECT_EQ(strlen(big), 400u);
-}
-
-TEST(Base64, RejectsBadInputAndSmallBuffers) {
-    bool ok = true;
-    Decode("Zm9v!A==", &ok);
-    EXPECT_FALSE(ok);
-    Decode("Z", &ok);
-    EXPECT_FALSE(ok);
-    Decode("Zm=v", &ok);
-    EXPECT_FALSE(ok);
-    EXPECT_EQ(Decode("Zm9vYg", &ok), "foob") << "padding may be left out";
-    EXPECT_TRUE(ok);
-
-    char small[4];
-    const unsigned char data[] = "abc";
-    EXPECT_EQ(VLIBCBase64SzEncodeFull(data, 3, small, sizeof(small), 0), 0)
-        << "no room for the terminating NUL";
-    unsigned char out[2];
-    size_t len = sizeof(out);
-    EXPECT_EQ(VLIBCBase64Decode("Zm9v", 4, out, &len), 0);
+    const std::string encoded = Encode(std::string(300, 'x'));
+    EXPECT_EQ(encoded.size(), 400u);
+    EXPECT_EQ(encoded.find('\n'), std::string::npos);
+    for (const char *bad : {"Zm9v!A==", "Z", "Zm=v"}) {
+        EXPECT_EQ(Decode(bad), "<fails>") << bad;
+    }
+    EXPECT_EQ(Decode("Zm9vYg"), "foob") << "padding may be left out";
+    EXPECT_EQ(Encode("abc", 4), "<fails>") << "no room for the terminating NUL";
+    EXPECT_EQ(Decode("Zm9v", 2), "<fails>");
 }
 
 TEST(PairEncoding, EncodesNamesAndValues) {
@@ -199,30 +178,23 @@ TEST(JsonText, ParsesStrictlyAndWritesCompactly) {
     EXPECT_TRUE(v.isNull());
 }
 
-int FixedProvider(char *token, size_t tokenSize, char *key, size_t keySize) {
-    snprintf(token, tokenSize, "%s", "token-0123456789-0123456789-0123456789");
-    snprintf(key, keySize, "%s", "key");
-    return 0;
-}
-
-int FailingProvider(char *, size_t, char *, size_t) {
-    return -7;
-}
-
 TEST(TokenService, NeedsAProviderAndTerminatesItsBuffers) {
     char token[36];
     char key[33];
+    auto get = [&] { return KOVACloudServiceHxtokenGetToken(token, sizeof(token), key, 33); };
     KOVACloudServiceHxtokenSetProvider(nullptr);
-    EXPECT_EQ(KOVACloudServiceHxtokenGetToken(token, sizeof(token), key, sizeof(key)), -1);
-
-    KOVACloudServiceHxtokenSetProvider(FixedProvider);
-    EXPECT_EQ(KOVACloudServiceHxtokenGetToken(token, sizeof(token), key, sizeof(key)), 0);
-    EXPECT_EQ(strlen(token), sizeof(token) - 1) << "cut to the buffer";
-    EXPECT_STREQ(key, "key");
+    EXPECT_EQ(get(), -1);
+    // A provider that fills both buffers to their ends: the service terminates them.
+    KOVACloudServiceHxtokenSetProvider([](char *t, size_t tSize, char *k, size_t kSize) {
+        memset(t, 'T', tSize);
+        memset(k, 'K', kSize);
+        return 0;
+    });
+    EXPECT_EQ(get(), 0);
+    EXPECT_EQ(std::string(token) + std::string(key), std::string(35, 'T') + std::string(32, 'K'));
     EXPECT_EQ(KOVACloudServiceHxtokenGetToken(nullptr, 0, key, sizeof(key)), -1);
-
-    KOVACloudServiceHxtokenSetProvider(FailingProvider);
-    EXPECT_EQ(KOVACloudServiceHxtokenGetToken(token, sizeof(token), key, sizeof(key)), -7);
+    KOVACloudServiceHxtokenSetProvider([](char *, size_t, char *, size_t) { return -7; });
+    EXPECT_EQ(get(), -7);
     KOVACloudServiceHxtokenSetProvider(nullptr);
 }
 

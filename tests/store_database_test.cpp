@@ -14,6 +14,7 @@
 #include <gtest/gtest.h>
 
 #include "store_fixture.h"
+#include "support/child.h"
 
 // While set, chmod renames the first file over the second right after setting the mode, as
 // another process could between the library's checks and SQLite's open.
@@ -45,19 +46,14 @@ class DatabaseTest : public StoreTest {
         EXPECT_EQ(KOVACredDBRecordAdd(db, &cred, &id), 0) << kova_test::LogDump();
         return id;
     }
+    static void Exec(sqlite3 *db, const char *sql) {
+        ASSERT_EQ(sqlite3_exec(db, sql, nullptr, nullptr, nullptr), SQLITE_OK) << sql;
+    }
 };
 
 mode_t ModeOf(const std::string &path) {
     struct stat st;
     return stat(path.c_str(), &st) == 0 ? (st.st_mode & 07777) : 0;
-}
-
-std::vector<std::string> ColumnsOf(const std::string &dbPath, const std::string &table) {
-    std::vector<std::string> names;
-    for (const auto &row : RawQuery(dbPath, "PRAGMA table_info(" + table + ");")) {
-        names.push_back(row[1] + " " + row[2] + (row[5] == "1" ? " PK" : ""));
-    }
-    return names;
 }
 
 TEST_F(DatabaseTest, CreatesFoldersFileAndTablesAndRestoresTheMode) {
@@ -72,24 +68,20 @@ TEST_F(DatabaseTest, CreatesFoldersFileAndTablesAndRestoresTheMode) {
         ASSERT_NE(db, nullptr);
         Add(db.get(), *MakeCred("a.example"));
     }
-    EXPECT_EQ(ModeOf(real + "/one"), 0700u);
-    EXPECT_EQ(ModeOf(real + "/one/two"), 0700u);
-    EXPECT_EQ(ModeOf(real + "/one/two/credentials.sqlite"), 0600u);
-    EXPECT_EQ(ColumnsOf(path, "credentials"),
-              (std::vector<std::string>{"id INTEGER PK", "ctime INTEGER", "mtime INTEGER",
-                                        "host TEXT", "owner INTEGER", "remote_account TEXT",
-                                        "remote_passwd TEXT", "port INTEGER", "protocol TEXT",
-                                        "application TEXT", "extra_info TEXT", "pid INTEGER"}));
-    EXPECT_EQ(ColumnsOf(path, "credential_sessions"),
-              (std::vector<std::string>{"id INTEGER PK", "mtime INTEGER", "access_token TEXT",
-                                        "csrf_token TEXT", "extra_info TEXT"}));
-    auto fk = RawQuery(path, "PRAGMA foreign_key_list(credential_sessions);");
-    ASSERT_EQ(fk.size(), 1u);
-    EXPECT_EQ((Row{fk[0][2], fk[0][3], fk[0][4]}), (Row{"credentials", "id", "id"}));
-    // The schema statements are stored as written, tabs included.
-    auto sql = RawQuery(path, "SELECT sql FROM sqlite_master WHERE name='credentials';");
-    ASSERT_EQ(sql.size(), 1u);
-    EXPECT_NE(sql[0][0].find("ASC, \t\t\t\t\t\t ctime"), std::string::npos) << sql[0][0];
+    EXPECT_EQ((std::vector<mode_t>{ModeOf(real + "/one"), ModeOf(real + "/one/two"), ModeOf(path)}),
+              (std::vector<mode_t>{0700, 0700, 0600}));
+    // The schema as written, tabs included.
+    EXPECT_EQ(
+        RawQuery(path, "SELECT sql FROM sqlite_master WHERE type='table' ORDER BY name;"),
+        (std::vector<Row>{
+            {"CREATE TABLE credential_sessions (id INTEGER PRIMARY KEY, \t\t\t\t\t\t mtime "
+             "INTEGER, "
+             "access_token TEXT, csrf_token TEXT, extra_info TEXT, FOREIGN KEY (id) REFERENCES "
+             "credentials (id))"},
+            {"CREATE TABLE credentials (id INTEGER PRIMARY KEY ASC, \t\t\t\t\t\t ctime INTEGER, "
+             "mtime INTEGER, host TEXT, owner INTEGER, remote_account TEXT, \t\t\t\t\t\t "
+             "remote_passwd TEXT, port INTEGER, protocol TEXT, application TEXT, extra_info TEXT, "
+             "pid INTEGER)"}}));
     EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
 
     // Opening again keeps the rows and sets the mode back, even one that allows no reading.
@@ -106,30 +98,29 @@ TEST_F(DatabaseTest, AddWritesEveryColumnAndGetReadsTheRow) {
     cred->ctime = 5;
     cred->mtime = 6;
     const long before = time(nullptr);
-    int id = Add(db.get(), *cred);
+    const int id = Add(db.get(), *cred);
     const long after = time(nullptr);
     EXPECT_EQ(id, 1);
     EXPECT_EQ(Add(db.get(), *cred), 2);
     EXPECT_EQ(KOVACredDBRecordAdd(db.get(), cred.get(), nullptr), 0);
     auto rows = Query(
-        "SELECT id, ctime, mtime, host, owner, remote_account, remote_passwd, port, protocol, "
+        "SELECT ctime, mtime, id, host, owner, remote_account, remote_passwd, port, protocol, "
         "application, extra_info, pid, typeof(port) FROM credentials WHERE id=1;");
     ASSERT_EQ(rows.size(), 1u);
-    const Row &r = rows[0];
-    EXPECT_EQ(r[0], "1");
-    EXPECT_GE(std::stol(r[1]), before);
-    EXPECT_LE(std::stol(r[1]), after);
-    EXPECT_EQ(r[1], r[2]);
-    EXPECT_EQ((Row{r[3], r[4], r[5], r[6], r[7], r[8], r[9], r[10], r[11], r[12]}),
-              (Row{"nas.example", "1024", "admin", "pw-nas.example", "5001", "https", "backup",
-                   "{\"k\":1}", std::to_string(getpid()), "integer"}));
+    Row r = rows[0];
+    const long ctime = std::stol(r[0]);
+    EXPECT_GE(ctime, before);
+    EXPECT_LE(ctime, after);
+    EXPECT_EQ(r[0], r[1]);
+    r.erase(r.begin(), r.begin() + 2);
+    EXPECT_EQ(r, (Row{"1", "nas.example", "1024", "admin", "pw-nas.example", "5001", "https",
+                      "backup", "{\"k\":1}", std::to_string(getpid()), "integer"}));
 
     CredPtr loaded = NewCred();
     EXPECT_EQ(KOVACredDBRecordGet(db.get(), id, loaded.get()), 1);
     EXPECT_EQ((std::vector<long>{loaded->id, loaded->owner, loaded->ctime}),
-              (std::vector<long>{id, 1024, std::stol(r[1])}));
+              (std::vector<long>{id, 1024, ctime}));
     EXPECT_EQ(loaded->remote_passwd, "pw-nas.example");
-
     CredPtr missing = NewCred();
     missing->host = "untouched";
     EXPECT_EQ(KOVACredDBRecordGet(db.get(), 42, missing.get()), 0);
@@ -150,24 +141,22 @@ TEST_F(DatabaseTest, GetListOrderAndCondition) {
     for (int port : {3, 1, 2}) {
         Add(db.get(), *MakeCred("h" + std::to_string(port), "app", port));
     }
-    auto ids = [](KOVA_CRED *head) {
-        std::vector<int> out = Ids(head);
+    // Rows come in id order and every node is linked in front: newest first. Ascending port
+    // 1,2,3 is ids 2,3,1, reversed by the list.
+    const struct {
+        const char *where;
+        const char *order;
+        int ascending;
+        std::vector<int> ids;
+    } cases[] = {{nullptr, nullptr, 0, {3, 2, 1}}, {"", "", 1, {3, 2, 1}},
+                 {"port > 1", nullptr, 0, {3, 1}}, {nullptr, "port", 1, {1, 3, 2}},
+                 {"id >= 2", "port", 0, {2, 3}},   {"id > 100", nullptr, 0, {}}};
+    for (const auto &c : cases) {
+        KOVA_CRED *head = KOVACredDBRecordGetList(db.get(), c.where, c.order, c.ascending);
+        EXPECT_EQ(Ids(head), c.ids)
+            << (c.where ? c.where : "-") << " " << (c.order ? c.order : "-");
         KOVACredListFree(&head);
-        return out;
-    };
-    // Rows come in id order and every node is linked in front: newest first.
-    EXPECT_EQ(ids(KOVACredDBRecordGetList(db.get(), nullptr, nullptr, 0)),
-              (std::vector<int>{3, 2, 1}));
-    EXPECT_EQ(ids(KOVACredDBRecordGetList(db.get(), "", "", 1)), (std::vector<int>{3, 2, 1}));
-    EXPECT_EQ(ids(KOVACredDBRecordGetList(db.get(), "port > 1", nullptr, 0)),
-              (std::vector<int>{3, 1}));
-    // Ascending port 1,2,3 is ids 2,3,1, reversed by the list.
-    EXPECT_EQ(ids(KOVACredDBRecordGetList(db.get(), nullptr, "port", 1)),
-              (std::vector<int>{1, 3, 2}));
-    // Descending port among ids 2 and 3 delivers 3 then 2.
-    EXPECT_EQ(ids(KOVACredDBRecordGetList(db.get(), "id >= 2", "port", 0)),
-              (std::vector<int>{2, 3}));
-    EXPECT_EQ(KOVACredDBRecordGetList(db.get(), "id > 100", nullptr, 0), nullptr);
+    }
     EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
 
     // Both texts go through %q, so a condition cannot hold a quoted literal.
@@ -185,35 +174,28 @@ TEST_F(DatabaseTest, GetListOrderAndCondition) {
 
 TEST_F(DatabaseTest, UpdateRewritesTheRowAndVerifiesIt) {
     DbPtr db = Open();
-    int id = Add(db.get(), *MakeCred("old"));
-    ASSERT_EQ(sqlite3_exec(db.get(), "UPDATE credentials SET ctime=10, mtime=10, pid=1;", nullptr,
-                           nullptr, nullptr),
-              SQLITE_OK);
+    const int id = Add(db.get(), *MakeCred("old"));
+    Exec(db.get(), "UPDATE credentials SET ctime=10, mtime=10, pid=1;");
     CredPtr cred = MakeCred("new", "app2", 6001);
     cred->id = 555;  // the argument names the row, not the record
     cred->owner = -1;
     const long before = time(nullptr);
     EXPECT_EQ(KOVACredDBRecordUpdate(db.get(), id, cred.get()), 0) << kova_test::LogDump();
-    auto rows = Query(
-        "SELECT id, ctime, mtime, host, owner, port, application, pid "
-        "FROM credentials;");
+    auto rows =
+        Query("SELECT mtime, id, ctime, host, owner, port, application, pid FROM credentials;");
     ASSERT_EQ(rows.size(), 1u);
-    EXPECT_EQ(rows[0][0], std::to_string(id));
-    EXPECT_EQ(rows[0][1], "10");  // ctime and pid stay
-    EXPECT_GE(std::stol(rows[0][2]), before);
-    EXPECT_EQ((Row{rows[0][3], rows[0][4], rows[0][5], rows[0][6], rows[0][7]}),
-              (Row{"new", "-1", "6001", "app2", "1"}));
+    EXPECT_GE(std::stol(rows[0][0]), before);
+    // ctime and pid stay
+    EXPECT_EQ(Row(rows[0].begin() + 1, rows[0].end()),
+              (Row{std::to_string(id), "10", "new", "-1", "6001", "app2", "1"}));
 
     // Writes not found on the read-back fail with 2816: a missing row, and a session token that
     // a trigger rewrites behind the writer's back.
     EXPECT_EQ(KOVACredDBRecordUpdate(db.get(), 42, cred.get()), -1);
     EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_READBACK, "cred_db", 377));
-    ASSERT_EQ(sqlite3_exec(db.get(),
-                           "CREATE TRIGGER mangle AFTER INSERT ON credential_sessions BEGIN "
-                           "UPDATE credential_sessions SET csrf_token='changed' WHERE id=NEW.id; "
-                           "END;",
-                           nullptr, nullptr, nullptr),
-              SQLITE_OK);
+    Exec(db.get(),
+         "CREATE TRIGGER mangle AFTER INSERT ON credential_sessions BEGIN UPDATE "
+         "credential_sessions SET csrf_token='changed' WHERE id=NEW.id; END;");
     EXPECT_EQ(KOVACredSessDBRecordUpdate(db.get(), id, MakeSess(id, "s", "t").get()), -1);
     EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_READBACK, "cred_db", 563));
     EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
@@ -221,7 +203,7 @@ TEST_F(DatabaseTest, UpdateRewritesTheRowAndVerifiesIt) {
 
 TEST_F(DatabaseTest, RemoveDeletesTheSessionFirst) {
     DbPtr db = Open();
-    int id = Add(db.get(), *MakeCred("h"));
+    const int id = Add(db.get(), *MakeCred("h"));
     Add(db.get(), *MakeCred("other"));
     ASSERT_EQ(KOVACredSessDBRecordUpdate(db.get(), id, MakeSess(id, "s", "t").get()), 0);
     // A plain DELETE of a credential that has a session breaks the foreign key.
@@ -234,61 +216,57 @@ TEST_F(DatabaseTest, RemoveDeletesTheSessionFirst) {
     EXPECT_EQ(KOVACredDBRecordRemove(db.get(), 77), 0);
 
     // A session row left under an id without a credential is removed too.
-    ASSERT_EQ(sqlite3_exec(db.get(),
-                           "PRAGMA foreign_keys = OFF; INSERT INTO credential_sessions (id, "
-                           "access_token) VALUES (90, 'orphan'); PRAGMA foreign_keys = ON;",
-                           nullptr, nullptr, nullptr),
-              SQLITE_OK);
+    Exec(db.get(),
+         "PRAGMA foreign_keys = OFF; INSERT INTO credential_sessions (id, access_token) VALUES "
+         "(90, 'orphan'); PRAGMA foreign_keys = ON;");
     EXPECT_EQ(KOVACredDBRecordRemove(db.get(), 90), 0);
     EXPECT_TRUE(Query("SELECT * FROM credential_sessions;").empty());
 }
 
 TEST_F(DatabaseTest, ArgumentErrorsCarryTheirLines) {
-    DbPtr db = Open();
-    CredPtr cred = NewCred();
-    SessPtr sess = NewSess();
+    const DbPtr db = Open();
+    sqlite3 *d = db.get();
+    const CredPtr cred = NewCred();
+    KOVA_CRED *c = cred.get();
+    const SessPtr sess = NewSess();
+    KOVA_CRED_SESS *s = sess.get();
+    auto arg = [](std::function<long()> call, int line, const char *check) {
+        return ArgCase{std::move(call), "cred_db", line, check};
+    };
     ExpectArgErrors({
-        {[&] { return KOVACredDBRecordAdd(nullptr, cred.get(), nullptr); }, "cred_db", 193,
-         "__null != db"},
-        {[&] { return KOVACredDBRecordAdd(db.get(), nullptr, nullptr); }, "cred_db", 193,
-         "NULL != pCred"},
-        {[&] { return KOVACredDBRecordGet(nullptr, 1, cred.get()); }, "cred_db", 235,
-         "__null != db"},
-        {[&] { return KOVACredDBRecordGet(db.get(), 1, nullptr); }, "cred_db", 235,
-         "NULL != pCred"},
-        {[&] { return KOVACredDBRecordGetList(nullptr, nullptr, nullptr, 0) ? 0L : -1L; },
-         "cred_db", 265, "__null != db"},
-        {[&] { return KOVACredDBRecordRemove(nullptr, 1); }, "cred_db", 312, "__null != db"},
-        {[&] { return KOVACredDBRecordUpdate(nullptr, 1, cred.get()); }, "cred_db", 337,
-         "__null != db"},
-        {[&] { return KOVACredDBRecordUpdate(db.get(), 1, nullptr); }, "cred_db", 337,
-         "NULL != pCred"},
-        {[&] { return KOVACredSessDBRecordAdd(nullptr, sess.get(), nullptr); }, "cred_db", 401,
-         "__null != db"},
-        {[&] { return KOVACredSessDBRecordAdd(db.get(), nullptr, nullptr); }, "cred_db", 401,
-         "NULL != pSess"},
-        {[&] { return KOVACredSessDBRecordGet(nullptr, 1, sess.get()); }, "cred_db", 436,
-         "__null != db"},
-        {[&] { return KOVACredSessDBRecordGet(db.get(), 1, nullptr); }, "cred_db", 436,
-         "NULL != pSess"},
-        {[&] { return KOVACredSessDBRecordGetList(nullptr, "x", "y", 1) ? 0L : -1L; }, "cred_db",
-         467, "__null != db"},
-        {[&] { return KOVACredSessDBRecordRemove(nullptr, 1); }, "cred_db", 513, "__null != db"},
-        {[&] { return KOVACredSessDBRecordUpdate(nullptr, 1, sess.get()); }, "cred_db", 539,
-         "__null != db"},
-        {[&] { return KOVACredSessDBRecordUpdate(db.get(), 1, nullptr); }, "cred_db", 539,
-         "NULL != pSess"},
+        arg([&] { return KOVACredDBRecordAdd(nullptr, c, nullptr); }, 193, "__null != db"),
+        arg([&] { return KOVACredDBRecordAdd(d, nullptr, nullptr); }, 193, "NULL != pCred"),
+        arg([&] { return KOVACredDBRecordGet(nullptr, 1, c); }, 235, "__null != db"),
+        arg([&] { return KOVACredDBRecordGet(d, 1, nullptr); }, 235, "NULL != pCred"),
+        arg([] { return KOVACredDBRecordGetList(nullptr, nullptr, nullptr, 0) ? 0L : -1L; }, 265,
+            "__null != db"),
+        arg([] { return KOVACredDBRecordRemove(nullptr, 1); }, 312, "__null != db"),
+        arg([&] { return KOVACredDBRecordUpdate(nullptr, 1, c); }, 337, "__null != db"),
+        arg([&] { return KOVACredDBRecordUpdate(d, 1, nullptr); }, 337, "NULL != pCred"),
+        arg([&] { return KOVACredSessDBRecordAdd(nullptr, s, nullptr); }, 401, "__null != db"),
+        arg([&] { return KOVACredSessDBRecordAdd(d, nullptr, nullptr); }, 401, "NULL != pSess"),
+        arg([&] { return KOVACredSessDBRecordGet(nullptr, 1, s); }, 436, "__null != db"),
+        arg([&] { return KOVACredSessDBRecordGet(d, 1, nullptr); }, 436, "NULL != pSess"),
+        arg([] { return KOVACredSessDBRecordGetList(nullptr, "x", "y", 1) ? 0L : -1L; }, 467,
+            "__null != db"),
+        arg([] { return KOVACredSessDBRecordRemove(nullptr, 1); }, 513, "__null != db"),
+        arg([&] { return KOVACredSessDBRecordUpdate(nullptr, 1, s); }, 539, "__null != db"),
+        arg([&] { return KOVACredSessDBRecordUpdate(d, 1, nullptr); }, 539, "NULL != pSess"),
     });
+}
+
+// `pattern` with every `key` replaced by `value`.
+std::string Fill(std::string pattern, const std::string &key, const std::string &value) {
+    for (size_t at; (at = pattern.find(key)) != std::string::npos;) {
+        pattern.replace(at, key.size(), value);
+    }
+    return pattern;
 }
 
 // The record logged at some second between `before` and `after`, "{now}" standing for it.
 ::testing::AssertionResult LoggedAtSomeTime(const std::string &pattern, long before, long after) {
     for (long now = before; now <= after; ++now) {
-        std::string record = pattern;
-        for (size_t at; (at = record.find("{now}")) != std::string::npos;) {
-            record.replace(at, 5, std::to_string(now));
-        }
-        if (kova_test::LogCount(record) == 1) {
+        if (kova_test::LogCount(Fill(pattern, "{now}", std::to_string(now))) == 1) {
             return ::testing::AssertionSuccess();
         }
     }
@@ -331,18 +309,9 @@ TEST_F(DatabaseTest, StatementFailuresAreLoggedWithoutSecrets) {
               1u);
 
     // Without the tables every statement fails with SQLite's message.
-    ASSERT_EQ(sqlite3_exec(db.get(), "DROP TABLE credential_sessions; DROP TABLE credentials;",
-                           nullptr, nullptr, nullptr),
-              SQLITE_OK);
-    // Statement failures record no code.
-    ASSERT_EQ(VLIBCErrGet(), 0);
+    Exec(db.get(), "DROP TABLE credential_sessions; DROP TABLE credentials;");
+    ASSERT_EQ(VLIBCErrGet(), 0);  // statement failures record no code
     ExpectFailuresLogged({
-        {[&] { return KOVACredDBRecordGet(db.get(), 3, cred.get()); },
-         "cred_db:242 Exec sql:[SELECT * FROM credentials WHERE id=3;] error: no such table: "
-         "credentials\n"},
-        {[&] { return KOVACredDBRecordGetList(db.get(), nullptr, nullptr, 0) ? 0L : -1L; },
-         "cred_db:297 Exec sql:[SELECT * FROM credentials;] error: no such table: "
-         "credentials\n"},
         {[&] { return KOVACredSessDBRecordGet(db.get(), 4, sess.get()); },
          "cred_db:443 Exec sql:[SELECT * FROM credential_sessions WHERE id=4;] error: no such "
          "table: credential_sessions\n"},
@@ -403,24 +372,22 @@ const std::string kHostile[] = {
 TEST_F(DatabaseTest, HostileTextRoundTripsAndInjectsNothing) {
     DbPtr db = Open();
     Add(db.get(), *MakeCred("bystander"));
+    std::string KOVA_CRED::*const members[] = {
+        &KOVA_CRED::host,     &KOVA_CRED::remote_account, &KOVA_CRED::remote_passwd,
+        &KOVA_CRED::protocol, &KOVA_CRED::application,    &KOVA_CRED::extra_info};
     for (const auto &text : kHostile) {
         SCOPED_TRACE(text);
         CredPtr cred = NewCred();
-        int n = 0;
-        for (auto member :
-             {&KOVA_CRED::host, &KOVA_CRED::remote_account, &KOVA_CRED::remote_passwd,
-              &KOVA_CRED::protocol, &KOVA_CRED::application, &KOVA_CRED::extra_info}) {
-            cred.get()->*member = text + "|" + std::to_string(n++);
+        for (size_t n = 0; n < std::size(members); ++n) {
+            cred.get()->*members[n] = text + "|" + std::to_string(n);
         }
-        int id = Add(db.get(), *cred);
+        const int id = Add(db.get(), *cred);
         CredPtr loaded = NewCred();
         ASSERT_EQ(KOVACredDBRecordGet(db.get(), id, loaded.get()), 1);
-        for (auto member :
-             {&KOVA_CRED::host, &KOVA_CRED::remote_account, &KOVA_CRED::remote_passwd,
-              &KOVA_CRED::protocol, &KOVA_CRED::application, &KOVA_CRED::extra_info}) {
+        for (auto member : members) {
             EXPECT_EQ(loaded.get()->*member, cred.get()->*member);
         }
-        // The update and its read-back match the same bytes.
+        // The updates and their read-back match the same bytes.
         cred->host = text + " updated";
         EXPECT_EQ(KOVACredDBRecordUpdate(db.get(), id, cred.get()), 0) << kova_test::LogDump();
         SessPtr sess = MakeSess(id, text, text + "t");
@@ -428,12 +395,10 @@ TEST_F(DatabaseTest, HostileTextRoundTripsAndInjectsNothing) {
         EXPECT_EQ(KOVACredSessDBRecordUpdate(db.get(), id, sess.get()), 0);
         SessPtr back = NewSess();
         ASSERT_EQ(KOVACredSessDBRecordGet(db.get(), id, back.get()), 1);
-        EXPECT_EQ(back->access_token, text);
-        EXPECT_EQ(back->csrf_token, text + "t");
-        EXPECT_EQ(back->extra_info, text + "e");
         CredPtr updated = NewCred();
         ASSERT_EQ(KOVACredDBRecordGet(db.get(), id, updated.get()), 1);
-        EXPECT_EQ(updated->host, text + " updated");
+        EXPECT_EQ((Texts{back->access_token, back->csrf_token, back->extra_info, updated->host}),
+                  (Texts{text, text + "t", text + "e", text + " updated"}));
     }
     EXPECT_EQ(Query("SELECT count(*) FROM credentials;"), (std::vector<Row>{{"6"}}));
     EXPECT_EQ(Query("SELECT count(*) FROM credential_sessions;"), (std::vector<Row>{{"5"}}));
@@ -462,48 +427,38 @@ std::string ReadFile(const std::string &path) {
 
 struct PathCase {
     const char *name;
-    std::function<std::string(const std::string &base)> make;  // the path, empty on failure
-    std::vector<std::string> records;                          // "{path}" stands for the path
     int code;                                                  // left in the error slot
+    Texts records;                                             // "{path}" stands for the path
+    std::function<std::string(const std::string &base)> make;  // the path, empty on failure
 };
 
 TEST_F(DatabaseTest, PathsThatAreNotOpened) {
     const std::string victim = db_.dir().File("victim");
     const std::string missing = db_.dir().File("missing");
     ASSERT_TRUE(WriteFile(victim, "victim data", 0644));
-    const std::string refusedLink = "cred_db:167 {path} is a symbolic link, not opened.\n";
-    const std::string refusedKind = "cred_db:167 {path} is not a regular file, not opened.\n";
+    const std::string link = "cred_db:167 {path} is a symbolic link, not opened.\n";
+    const std::string kind = "cred_db:167 {path} is not a regular file, not opened.\n";
+    const int open = KOVA_ERR_DB_OPEN;
+    auto linkTo = [](const std::string &target) {
+        return [target](auto &p) { return symlink(target.c_str(), p.c_str()) ? "" : p; };
+    };
+    // Opening a FIFO could block: every case runs in a child bounded in time. SQLite reads a
+    // file only at the first statement that needs the schema.
     const std::vector<PathCase> cases = {
-        {"link to a file",
-         [&](const std::string &p) { return symlink(victim.c_str(), p.c_str()) == 0 ? p : ""; },
-         {refusedLink},
-         KOVA_ERR_DB_OPEN},
-        {"dangling link",
-         [&](const std::string &p) { return symlink(missing.c_str(), p.c_str()) == 0 ? p : ""; },
-         {refusedLink},
-         KOVA_ERR_DB_OPEN},
-        {"folder",
-         [](const std::string &p) { return mkdir(p.c_str(), 0700) == 0 ? p : ""; },
-         {refusedKind},
-         KOVA_ERR_DB_OPEN},
-        // Opening a FIFO could block; every case runs in a child bounded in time.
-        {"FIFO",
-         [](const std::string &p) { return mkfifo(p.c_str(), 0600) == 0 ? p : ""; },
-         {refusedKind},
-         KOVA_ERR_DB_OPEN},
+        {"link to a file", open, {link}, linkTo(victim)},
+        {"dangling link", open, {link}, linkTo(missing)},
+        {"folder", open, {kind}, [](auto &p) { return mkdir(p.c_str(), 0700) ? "" : p; }},
+        {"FIFO", open, {kind}, [](auto &p) { return mkfifo(p.c_str(), 0600) ? "" : p; }},
         {"folder that cannot be made",
-         [](const std::string &p) { return WriteFile(p, "", 0600) ? p + "/sub/db.sqlite" : ""; },
+         open,
          {"cred_db:165 {path} chmod failed. errno=[0x0014]",  // ENOTDIR
           "cred_db:170 Can't open database: unable to open database file\n"},
-         KOVA_ERR_DB_OPEN},
-        // SQLite reads the file only at the first statement that needs the schema.
+         [](auto &p) { return WriteFile(p, "", 0600) ? p + "/sub/db.sqlite" : ""; }},
         {"file that is not a database",
-         [](const std::string &p) { return WriteFile(p, std::string(8192, 'J'), 0600) ? p : ""; },
-         {"cred_db:175 Exec sql:[CREATE TABLE if not exists credentials (id INTEGER PRIMARY KEY "
-          "ASC, \t\t\t\t\t\t ctime INTEGER, mtime INTEGER, host TEXT, owner INTEGER, "
-          "remote_account TEXT, \t\t\t\t\t\t remote_passwd TEXT, port INTEGER, protocol TEXT, "
-          "application TEXT, extra_info TEXT, pid INTEGER);] error: file is not a database\n"},
-         0},
+         0,
+         {"cred_db:175 Exec sql:[" + std::string(kCredSchema) +
+          "] error: file is not a database\n"},
+         [](auto &p) { return WriteFile(p, std::string(8192, 'J'), 0600) ? p : ""; }},
     };
     for (size_t i = 0; i < cases.size(); ++i) {
         const PathCase &c = cases[i];
@@ -511,14 +466,12 @@ TEST_F(DatabaseTest, PathsThatAreNotOpened) {
         const std::string path = c.make(db_.dir().File("case" + std::to_string(i)));
         ASSERT_FALSE(path.empty());
         setenv("kovacredential_db", path.c_str(), 1);
-        std::vector<std::string> records = c.records;
-        for (auto &r : records) {
-            const size_t at = r.find("{path}");
-            if (at != std::string::npos) {
-                r.replace(at, 6, path);
-            }
+        Texts records;
+        for (const auto &r : c.records) {
+            records.push_back(Fill(r, "{path}", path));
         }
-        const int status = RunInChild([&] {
+        const std::string inner = c.code != 0 ? "[0x0900 cred_db:169]" : "[0x0000 :0]";
+        auto refused = [&] {
             EXPECT_EQ(KOVACredDBInit(), nullptr);
             EXPECT_EQ(kova_test::LogRecords(), records);
             EXPECT_EQ(VLIBCErrGet(), c.code);
@@ -526,14 +479,11 @@ TEST_F(DatabaseTest, PathsThatAreNotOpened) {
             CredPtr cred = MakeCred("h");
             EXPECT_EQ(KOVACredAdd(cred.get()), -1);
             EXPECT_EQ(cred->id, -1);
-            char inner[64];
-            snprintf(inner, sizeof(inner), "[0x%04X %s]", c.code,
-                     c.code != 0 ? "cred_db:169" : ":0");
-            EXPECT_EQ(kova_test::LogCount("cred_add:16 Init sqlite failed. " + std::string(inner)),
-                      1u)
+            EXPECT_EQ(LogCountPrefix("cred_add:16 Init sqlite failed. " + inner), 1u)
                 << kova_test::LogDump();
-        });
-        EXPECT_EQ(status, 0);
+            return ::testing::Test::HasFailure() ? 1 : 0;
+        };
+        EXPECT_EQ(kova_test::RunInChild(60, refused), "exit 0");
     }
     EXPECT_EQ(ModeOf(victim), 0644u);
     EXPECT_EQ(ReadFile(victim), "victim data");
@@ -549,9 +499,8 @@ TEST_F(DatabaseTest, FileSwappedInBeforeSQLiteOpensIsRefused) {
     EXPECT_EQ(KOVACredDBInit(), nullptr);
     EXPECT_TRUE(gSwapAfterChmod.first.empty()) << "the library set no mode";
     EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_OPEN, "cred_db", 169));
-    EXPECT_EQ(kova_test::LogRecords(),
-              (std::vector<std::string>{"cred_db:167 " + DbPath() +
-                                        " was replaced while being opened, not opened.\n"}));
+    EXPECT_EQ(kova_test::LogRecords(), (Texts{"cred_db:167 " + DbPath() +
+                                              " was replaced while being opened, not opened.\n"}));
     // The impostor got neither the mode nor the tables.
     EXPECT_EQ(ModeOf(DbPath()), 0644u);
     EXPECT_EQ(ReadFile(DbPath()), "");

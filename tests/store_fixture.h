@@ -1,15 +1,12 @@
 // Helpers shared by the credential store tests: a fixture with a fresh database per test,
 // record builders, raw SQLite access to look at what the library wrote, and checks of the
-// error slot.
+// error slot and the log.
 #ifndef KOVA_TESTS_STORE_FIXTURE_H
 #define KOVA_TESTS_STORE_FIXTURE_H
 
 #include <sqlite3.h>
 
-#include <stdio.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
+#include <algorithm>
 #include <functional>
 #include <memory>
 #include <string>
@@ -23,18 +20,16 @@
 
 namespace store_test {
 
-struct CredDeleter {
-    void operator()(KOVA_CRED *p) const { KOVACredFree(p); }
+template <auto Free>
+struct Deleter {
+    template <typename T>
+    void operator()(T *p) const {
+        Free(p);
+    }
 };
-struct SessDeleter {
-    void operator()(KOVA_CRED_SESS *p) const { KOVACredSessFree(p); }
-};
-struct DbCloser {
-    void operator()(sqlite3 *db) const { sqlite3_close(db); }
-};
-using CredPtr = std::unique_ptr<KOVA_CRED, CredDeleter>;
-using SessPtr = std::unique_ptr<KOVA_CRED_SESS, SessDeleter>;
-using DbPtr = std::unique_ptr<sqlite3, DbCloser>;
+using CredPtr = std::unique_ptr<KOVA_CRED, Deleter<KOVACredFree>>;
+using SessPtr = std::unique_ptr<KOVA_CRED_SESS, Deleter<KOVACredSessFree>>;
+using DbPtr = std::unique_ptr<sqlite3, Deleter<sqlite3_close>>;
 
 inline CredPtr NewCred() {
     return CredPtr(KOVACredAlloc());
@@ -66,32 +61,34 @@ inline SessPtr MakeSess(int id, const std::string &sid, const std::string &token
     return sess;
 }
 
-using Row = std::vector<std::string>;  // column texts; NULL reads as "<NULL>"
+// The credential table's schema statement.
+constexpr const char kCredSchema[] =
+    "CREATE TABLE if not exists credentials (id INTEGER PRIMARY KEY ASC, \t\t\t\t\t\t ctime "
+    "INTEGER, mtime INTEGER, host TEXT, owner INTEGER, remote_account TEXT, \t\t\t\t\t\t "
+    "remote_passwd TEXT, port INTEGER, protocol TEXT, application TEXT, extra_info TEXT, pid "
+    "INTEGER);";
+
+using Ints = std::vector<int32_t>;
+using Texts = std::vector<std::string>;
+using Row = Texts;  // column texts; NULL reads as "<NULL>"
 
 // Runs `sql` on its own connection and returns every row.
 inline std::vector<Row> RawQuery(const std::string &dbPath, const std::string &sql) {
     std::vector<Row> rows;
-    sqlite3 *db = nullptr;
-    if (sqlite3_open(dbPath.c_str(), &db) != SQLITE_OK) {
-        sqlite3_close(db);
-        ADD_FAILURE() << "cannot open " << dbPath;
-        return rows;
-    }
-    char *err = nullptr;
-    auto collect = [](void *arg, int n, char **vals, char **) -> int {
-        auto *out = static_cast<std::vector<Row> *>(arg);
+    sqlite3 *raw = nullptr;
+    const int rc = sqlite3_open(dbPath.c_str(), &raw);
+    const DbPtr db(raw);
+    auto collect = [](void *out, int n, char **vals, char **) -> int {
         Row row;
         for (int i = 0; i < n; ++i) {
             row.emplace_back(vals[i] ? vals[i] : "<NULL>");
         }
-        out->push_back(row);
+        static_cast<std::vector<Row> *>(out)->push_back(row);
         return 0;
     };
-    if (sqlite3_exec(db, sql.c_str(), collect, &rows, &err) != SQLITE_OK) {
-        ADD_FAILURE() << sql << ": " << (err ? err : "?");
+    if (rc != SQLITE_OK || sqlite3_exec(raw, sql.c_str(), collect, &rows, nullptr) != SQLITE_OK) {
+        ADD_FAILURE() << dbPath << ": " << sql << ": " << sqlite3_errmsg(raw);
     }
-    sqlite3_free(err);
-    sqlite3_close(db);
     return rows;
 }
 
@@ -115,14 +112,8 @@ inline ::testing::AssertionResult ArgErrorReported(const std::string &file, int 
                                                    const std::string &check) {
     const std::string record =
         file + ":" + std::to_string(line) + " Invaild Argument (" + check + ")=[0]\n";
-    auto records = kova_test::LogRecords();
-    size_t matches = 0;
-    for (const auto &r : records) {
-        if (r == record) {
-            ++matches;
-        }
-    }
-    if (matches != 1) {
+    const auto records = kova_test::LogRecords();
+    if (std::count(records.begin(), records.end(), record) != 1) {
         return ::testing::AssertionFailure() << "expected one record \"" << record << "\", log:\n"
                                              << kova_test::LogDump();
     }
@@ -157,21 +148,19 @@ inline void ExpectArgErrors(const std::vector<ArgCase> &cases) {
     }
 }
 
-// One call that must fail with -1 and leave exactly one log record beginning with `record`.
+inline size_t LogCountPrefix(const std::string &prefix) {
+    const auto records = kova_test::LogRecords();
+    return std::count_if(records.begin(), records.end(),
+                         [&](const std::string &r) { return r.rfind(prefix, 0) == 0; });
+}
+
+// Calls that must fail with -1 and leave exactly one log record beginning with `record` and
+// `suffix` (such as the inner error's "[0x0900 cred_db:169]").
 struct FailureCase {
     std::function<long()> call;
     std::string record;
 };
 
-inline size_t LogCountPrefix(const std::string &prefix) {
-    size_t found = 0;
-    for (const auto &r : kova_test::LogRecords()) {
-        found += r.rfind(prefix, 0) == 0 ? 1 : 0;
-    }
-    return found;
-}
-
-// `suffix` is appended to every case's record (such as the inner error's "[0x0900 cred_db:169]").
 inline void ExpectFailuresLogged(const std::vector<FailureCase> &cases,
                                  const std::string &suffix = "") {
     for (const auto &c : cases) {
@@ -180,28 +169,6 @@ inline void ExpectFailuresLogged(const std::vector<FailureCase> &cases,
         EXPECT_EQ(c.call(), -1);
         EXPECT_EQ(LogCountPrefix(c.record + suffix), 1u) << kova_test::LogDump();
     }
-}
-
-// Runs `body` in a forked child that an alarm ends after `seconds`, so that a crash or a hang
-// fails one test. The child's expectations print as usual; returns 0 when none failed, else
-// its exit status or 128 + the signal that ended it.
-template <typename Body>
-int RunInChild(Body body, unsigned seconds = 60) {
-    fflush(nullptr);
-    const pid_t pid = fork();
-    if (pid == 0) {
-        alarm(seconds);
-        kova_test::ClearLog();
-        VLIBCErrSetEx(0, "", 0);
-        body();
-        fflush(nullptr);
-        _exit(::testing::Test::HasFailure() ? 1 : 0);
-    }
-    int status = 0;
-    if (pid < 0 || waitpid(pid, &status, 0) != pid) {
-        return -1;
-    }
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
 // A clean log and error slot for every test.
@@ -224,20 +191,6 @@ class StoreTest : public LogTest {
         CredPtr cred = MakeCred(host, application);
         EXPECT_EQ(KOVACredAdd(cred.get()), 0) << kova_test::LogDump();
         return cred->id;
-    }
-
-    // Points the database below a regular file, where neither a folder nor the file can be
-    // made; returns that database path.
-    std::string BlockDatabase() {
-        const std::string blocker = db_.dir().File("plainfile");
-        FILE *f = fopen(blocker.c_str(), "w");
-        EXPECT_NE(f, nullptr);
-        if (f != nullptr) {
-            fclose(f);
-        }
-        const std::string path = blocker + "/sub/credentials.sqlite";
-        setenv("kovacredential_db", path.c_str(), 1);
-        return path;
     }
 
     kova_test::TempDatabase db_;

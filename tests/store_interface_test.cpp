@@ -1,4 +1,5 @@
-// The credential interface: every operation opens the database, does one thing and closes it.
+// The credential and session interface: every operation opens the database, does one thing and
+// closes it; a session is kept under its credential's id.
 #include <unistd.h>
 
 #include <string>
@@ -13,223 +14,68 @@ namespace {
 using namespace store_test;
 
 using InterfaceTest = StoreTest;
+using SessionTest = StoreTest;
 
-TEST_F(InterfaceTest, AddStoresTheRowAndTheNewId) {
-    CredPtr cred = MakeCred("nas.example", "backup");
-    EXPECT_EQ(KOVACredAdd(cred.get()), 0);
-    EXPECT_EQ(cred->id, 1);
-    EXPECT_EQ(cred->ctime, 0);  // the row holds the time, the record does not
-    EXPECT_EQ(cred->mtime, 0);
-
-    CredPtr loaded = NewCred();
-    EXPECT_EQ(KOVACredGetByID(1, loaded.get()), 0);
-    EXPECT_EQ(loaded->id, 1);
-    EXPECT_EQ(loaded->filled, 1);
-    EXPECT_EQ(loaded->host, "nas.example");
-    EXPECT_EQ(loaded->remote_passwd, "pw-nas.example");
-    EXPECT_EQ(loaded->application, "backup");
-    EXPECT_GT(loaded->ctime, 0);
-    EXPECT_EQ(loaded->ctime, loaded->mtime);
-    // A missing row is no failure: the record stays unfilled.
-    CredPtr missing = NewCred();
-    EXPECT_EQ(KOVACredGetByID(5, missing.get()), 0);
-    EXPECT_EQ(missing->id, -1);
-    EXPECT_EQ(missing->filled, 0);
-    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
-}
-
-TEST_F(InterfaceTest, SaveInsertsThenUpdatesAndSetFailsOnAMissingRow) {
-    CredPtr cred = MakeCred("first");
-    EXPECT_EQ(KOVACredSave(cred.get()), 0);
-    ASSERT_EQ(cred->id, 1);
-    // Age the row so that the update's new mtime is visible.
-    ASSERT_TRUE(Query("UPDATE credentials SET ctime=100, mtime=100;").empty());
-    cred->host = "second";
-    cred->port = 443;
-    const long before = time(nullptr);
-    EXPECT_EQ(KOVACredSave(cred.get()), 0) << kova_test::LogDump();
-    EXPECT_EQ(cred->id, 1);
-    auto rows = Query("SELECT id, host, port, ctime, mtime FROM credentials;");
-    ASSERT_EQ(rows.size(), 1u);
-    EXPECT_EQ(rows[0][1], "second");
-    EXPECT_EQ(rows[0][2], "443");
-    EXPECT_EQ(rows[0][3], "100");
-    EXPECT_GE(std::stol(rows[0][4]), before);
-
-    // A set of a row that is gone fails on the read-back.
-    ASSERT_TRUE(Query("DELETE FROM credentials;").empty());
-    EXPECT_EQ(KOVACredSetByID(42, cred.get()), -1);
-    EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_READBACK, "cred_db", 377));
-    kova_test::ClearLog();
-    cred->id = 42;
-    EXPECT_EQ(KOVACredSave(cred.get()), -1);
-    EXPECT_EQ(
-        kova_test::LogRecords(),
-        (std::vector<std::string>{"cred_set:19 Set Cred record failed. id:[42][0x0B00 cred_db:377]",
-                                  "cred_save:21 Set task failed. [42] [0x0B00 cred_db:377]"}));
-}
-
-TEST_F(InterfaceTest, LoadChecksClearsAndReads) {
-    int id = AddCred("loaded");
+TEST_F(InterfaceTest, ArgumentErrorsTouchNoDatabase) {
     CredPtr cred = NewCred();
-    EXPECT_EQ(KOVACredLoad(-2, cred.get()), -1);
-    EXPECT_TRUE(ArgErrorReported("cred_load", 10, "-1 <= id"));
-    kova_test::ClearLog();
-    EXPECT_EQ(KOVACredLoad(-2, nullptr), -1);  // the id is checked first
-    EXPECT_TRUE(ArgErrorReported("cred_load", 10, "-1 <= id"));
-    kova_test::ClearLog();
-    EXPECT_EQ(KOVACredLoad(1, nullptr), -1);
-    EXPECT_TRUE(ArgErrorReported("cred_load", 10, "NULL != pCred"));
-
-    EXPECT_EQ(KOVACredLoad(id, cred.get()), 0);
-    EXPECT_EQ(cred->host, "loaded");
-    int other = AddCred("other");
-
-    // id -1 clears the record and frees its chain.
-    cred->next = KOVACredAlloc();
-    cred->next->next = KOVACredAlloc();
-    EXPECT_EQ(KOVACredLoad(-1, cred.get()), 0);
-    EXPECT_EQ(cred->next, nullptr);
-    EXPECT_EQ(cred->id, -1);
-    EXPECT_EQ(cred->filled, 0);
-    EXPECT_TRUE(cred->host.empty());
-    EXPECT_EQ(KOVACredLoad(other, cred.get()), 0);
-    EXPECT_EQ(cred->host, "other");
-
-    // A load of a missing id leaves members the row would have set.
-    CredPtr partial = NewCred();
-    partial->host = "mine";
-    EXPECT_EQ(KOVACredLoad(99, partial.get()), 0);
-    EXPECT_EQ(partial->host, "mine");
-}
-
-TEST_F(InterfaceTest, ListIsNewestFirstAndFiltered) {
-    KOVA_CRED *list = nullptr;
-    EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 0);  // an empty table
-    EXPECT_EQ(list, nullptr);
-    for (int i = 1; i <= 5; ++i) {
-        AddCred("h" + std::to_string(i), i % 2 ? "odd" : "even");
-    }
-    EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 5);
-    EXPECT_EQ(Ids(list), (std::vector<int>{5, 4, 3, 2, 1}));
-    EXPECT_EQ(list->host, "h5");
-    KOVACredListFree(&list);
-    EXPECT_EQ(list, nullptr);
-
-    char odd[] = "odd";
-    EXPECT_EQ(KOVACredListGet(&list, KOVACredKeepByApplication, odd), 3);
-    EXPECT_EQ(Ids(list), (std::vector<int>{5, 3, 1}));
-    KOVACredListFree(&list);
-
-    // A filter that drops everything leaves the caller's head as it was.
-    KOVA_CRED sentinel;
-    list = &sentinel;
-    auto none = [](KOVA_CRED *, void *) -> int { return 0; };
-    EXPECT_EQ(KOVACredListGet(&list, none, nullptr), 0);
-    EXPECT_EQ(list, &sentinel);
-
-    // The filter sees each record with the caller's argument.
-    struct Seen {
-        std::vector<int> ids;
-    } seen;
-    auto record = [](KOVA_CRED *cred, void *arg) -> int {
-        static_cast<Seen *>(arg)->ids.push_back(cred->id);
-        return cred->id == 2;
-    };
-    list = nullptr;
-    EXPECT_EQ(KOVACredListGet(&list, record, &seen), 1);
-    EXPECT_EQ(seen.ids, (std::vector<int>{5, 4, 3, 2, 1}));
-    EXPECT_EQ(Ids(list), (std::vector<int>{2}));
-    EXPECT_EQ(KOVACredNext(list), nullptr);
-    KOVACredListFree(&list);
-
-    EXPECT_EQ(KOVACredListGet(nullptr, nullptr, nullptr), -1);
-    EXPECT_TRUE(ArgErrorReported("cred_list", 14, "__null != pCredList"));
-}
-
-TEST_F(InterfaceTest, LookUpByApplicationFindsTheNewest) {
-    for (int i = 1; i <= 9; ++i) {
-        AddCred("h" + std::to_string(i), (i == 4 || i == 9) ? "backup" : "app" + std::to_string(i));
-    }
-    EXPECT_EQ(KOVACredIDGetByApplication("backup"), 9);
-    KOVACredRemoveByID(9);
-    EXPECT_EQ(KOVACredIDGetByApplication("backup"), 4);
-    EXPECT_EQ(KOVACredIDGetByApplication("Backup"), -1);  // exact, case-sensitive
-    EXPECT_EQ(KOVACredIDGetByApplication("backu"), -1);
-    EXPECT_EQ(KOVACredIDGetByApplication(""), -1);
-    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
-    EXPECT_EQ(KOVACredIDGetByApplication(nullptr), -1);
-    EXPECT_TRUE(ArgErrorReported("cred_get", 44, "__null != szApplication"));
-
-    CredPtr cred = MakeCred("h", "tag");
-    char tag[] = "tag";
-    char other[] = "tag ";
-    EXPECT_EQ(KOVACredKeepByApplication(cred.get(), tag), 1);
-    EXPECT_EQ(KOVACredKeepByApplication(cred.get(), other), 0);
-
-    kova_test::ClearLog();
-    // A table made elsewhere: columns in another order and one the record lacks, ids out of
-    // the rows' order, an application left NULL. Lists find the columns by name, and the
-    // newest of an application is the head of such a list: the last matching row.
-    ASSERT_TRUE(Query("DROP TABLE credential_sessions; DROP TABLE credentials; CREATE TABLE "
-                      "credentials (application TEXT, note TEXT, extra_info TEXT, port INTEGER, "
-                      "host TEXT, id INTEGER, owner INTEGER, remote_account TEXT, remote_passwd "
-                      "TEXT, protocol TEXT, ctime INTEGER, mtime INTEGER); INSERT INTO "
-                      "credentials VALUES ('backup', 'n', 'e9', 9001, 'h9', 9, 1, 'a9', 'p9', "
-                      "'https', 1700000009, 19), ('backup', 'n', 'e4', 4001, 'h4', 4, 2, 'a4', "
-                      "'p4', 'http', 14, 1700000004), (NULL, 'n', 'e7', 7001, 'h7', 7, 3, 'a7', "
-                      "'p7', 'ftp', 17, 27);")
-                    .empty());
-    KOVA_CRED *list = nullptr;
-    ASSERT_EQ(KOVACredListGet(&list, nullptr, nullptr), 3);
-    EXPECT_EQ(Ids(list), (std::vector<int>{7, 4, 9}));
-    const KOVA_CRED &four = *list->next;
-    EXPECT_EQ((std::vector<int32_t>{four.port, four.owner, four.ctime, four.mtime}),
-              (std::vector<int32_t>{4001, 2, 14, 1700000004}));
-    EXPECT_EQ((std::vector<std::string>{four.application, four.extra_info, four.host,
-                                        four.remote_account, four.remote_passwd, four.protocol}),
-              (std::vector<std::string>{"backup", "e4", "h4", "a4", "p4", "http"}));
-    EXPECT_EQ(list->application, "");
-    KOVACredListFree(&list);
-    EXPECT_EQ(KOVACredIDGetByApplication("backup"), 4);
-    EXPECT_EQ(KOVACredIDGetByApplication(""), 7);
-    EXPECT_EQ(KOVACredIDGetByApplication("h9"), -1);
-    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
-}
-
-TEST_F(InterfaceTest, ArgumentErrorsOfTheInterface) {
+    SessPtr sess = NewSess();
     ExpectArgErrors({
         {[] { return KOVACredGetByID(1, nullptr); }, "cred_get", 10, "__null != pCred"},
         {[] { return KOVACredSetByID(1, nullptr); }, "cred_set", 10, "__null != pCred"},
         {[] { return KOVACredAdd(nullptr); }, "cred_add", 11, "__null != pCred"},
         {[] { return KOVACredSave(nullptr); }, "cred_save", 11, "__null != pCred"},
+        {[] { return KOVACredListGet(nullptr, nullptr, nullptr); }, "cred_list", 14,
+         "__null != pCredList"},
+        {[] { return KOVACredIDGetByApplication(nullptr); }, "cred_get", 44,
+         "__null != szApplication"},
+        // The id is checked before the record.
+        {[&] { return KOVACredLoad(-2, cred.get()); }, "cred_load", 10, "-1 <= id"},
+        {[] { return KOVACredLoad(-2, nullptr); }, "cred_load", 10, "-1 <= id"},
+        {[] { return KOVACredLoad(1, nullptr); }, "cred_load", 10, "NULL != pCred"},
+        {[] { return KOVACredSessGetByID(1, nullptr); }, "cred_sess_get", 10, "__null != pSess"},
+        {[] { return KOVACredSessSetByID(1, nullptr); }, "cred_sess_set", 10, "__null != pSess"},
+        {[] { return KOVACredSessAdd(nullptr); }, "cred_sess_add", 11, "__null != pSess"},
+        {[] { return KOVACredSessSave(nullptr); }, "cred_sess_save", 11, "__null != pSess"},
+        {[] { return KOVACredSessListGet(nullptr, nullptr, nullptr); }, "cred_sess_list", 14,
+         "__null != pSessList"},
+        {[&] { return KOVACredSessLoad(-2, sess.get()); }, "cred_sess_load", 10, "-1 <= id"},
+        {[] { return KOVACredSessLoad(-2, nullptr); }, "cred_sess_load", 10, "-1 <= id"},
+        {[] { return KOVACredSessLoad(1, nullptr); }, "cred_sess_load", 10, "NULL != pSess"},
     });
-    // None of them touched the database.
     EXPECT_NE(access(DbPath().c_str(), F_OK), 0);
 }
 
 TEST_F(InterfaceTest, OpenFailuresNameTheInnerError) {
-    BlockDatabase();
+    // Below a regular file neither a folder nor the database can be made.
+    const std::string blocker = db_.dir().File("plainfile");
+    ASSERT_NE(kova_test::File(fopen(blocker.c_str(), "w")), nullptr);
+    setenv("kovacredential_db", (blocker + "/sub/credentials.sqlite").c_str(), 1);
     CredPtr cred = MakeCred("h");
+    SessPtr sess = MakeSess(1, "s", "t");
+    KOVA_CRED *list = nullptr;
+    KOVA_CRED_SESS *sessList = nullptr;
     ExpectFailuresLogged(
         {
             {[&] { return KOVACredGetByID(1, cred.get()); }, "cred_get:15 Init sqlite failed. "},
             {[&] { return KOVACredSetByID(1, cred.get()); }, "cred_set:15 Init sqlite failed. "},
             {[&] { return KOVACredAdd(cred.get()); }, "cred_add:16 Init sqlite failed. "},
-            {[&] {
-                 KOVA_CRED *list = nullptr;
-                 return KOVACredListGet(&list, nullptr, nullptr);
-             },
+            {[&] { return KOVACredListGet(&list, nullptr, nullptr); },
              "cred_list:19 Init sqlite failed. "},
             {[&] { return KOVACredRemoveByID(1); }, "cred_remove:14 Init sqlite failed. "},
             {[&] { return KOVACredIDGetByApplication("app"); },
              "cred_list:19 Init sqlite failed. "},
             {[&] { return KOVACredLoad(3, cred.get()); }, "cred_load:19 get task failed. [3] "},
-            {[&] {
-                 cred->id = -1;
-                 return KOVACredSave(cred.get());
-             },
-             "cred_save:16 Add task failed. "},
+            {[&] { return KOVACredSave(cred.get()); }, "cred_save:16 Add task failed. "},
+            {[&] { return KOVACredSessGetByID(1, sess.get()); },
+             "cred_sess_get:15 Init sqlite failed. "},
+            {[&] { return KOVACredSessSetByID(1, sess.get()); },
+             "cred_sess_set:15 Init sqlite failed. "},
+            {[&] { return KOVACredSessAdd(sess.get()); }, "cred_sess_add:16 Init sqlite failed. "},
+            {[&] { return KOVACredSessListGet(&sessList, nullptr, nullptr); },
+             "cred_sess_list:19 Init sqlite failed. "},
+            {[&] { return KOVACredSessRemoveByID(1); }, "cred_sess_remove:14 Init sqlite failed. "},
+            {[&] { return KOVACredSessLoad(2, sess.get()); },
+             "cred_sess_load:19 get task failed. [2] "},
         },
         "[0x0900 cred_db:169]");
     EXPECT_EQ(cred->id, -1);
@@ -237,14 +83,15 @@ TEST_F(InterfaceTest, OpenFailuresNameTheInnerError) {
 
 TEST_F(InterfaceTest, StatementFailuresOfAnOpenDatabaseAreLogged) {
     AddCred("h");
-    // A view under the credential table's name survives the schema statements (IF NOT EXISTS)
-    // but reads a table that is gone and takes no writes, so every step fails on a database
-    // that opened.
-    ASSERT_TRUE(Query("DROP TABLE credential_sessions; DROP TABLE credentials; "
-                      "CREATE VIEW credentials AS SELECT * FROM gone;")
+    // Views under the tables' names survive the schema statements (IF NOT EXISTS) but read a
+    // table that is gone or lack the id column, and take no writes: every step fails on a
+    // database that opened. The inner steps record no code: the lines carry the empty slot.
+    ASSERT_TRUE(Query("DROP TABLE credential_sessions; DROP TABLE credentials; CREATE VIEW "
+                      "credentials AS SELECT * FROM gone; CREATE VIEW credential_sessions AS "
+                      "SELECT 1 AS x, 2 AS y;")
                     .empty());
     CredPtr cred = MakeCred("h");
-    // The inner steps record no code of their own: the lines carry the empty slot.
+    SessPtr sess = NewSess();
     ExpectFailuresLogged(
         {
             {[&] { return KOVACredGetByID(1, cred.get()); },
@@ -252,6 +99,10 @@ TEST_F(InterfaceTest, StatementFailuresOfAnOpenDatabaseAreLogged) {
             {[&] { return KOVACredAdd(cred.get()); }, "cred_add:20 Add Cred record failed. "},
             {[&] { return KOVACredRemoveByID(1); },
              "cred_remove:18 Remove Cred record failed. id:[1]"},
+            {[&] { return KOVACredSessGetByID(1, sess.get()); },
+             "cred_sess_get:20 Get Cred_sess record failed. id:[1]"},
+            {[&] { return KOVACredSessRemoveByID(1); },
+             "cred_sess_remove:18 Remove Cred record failed. id:[1]"},
         },
         "[0x0000 :0]");
     // A failed read of the table looks like an empty one, to the look-up by application too.
@@ -263,6 +114,245 @@ TEST_F(InterfaceTest, StatementFailuresOfAnOpenDatabaseAreLogged) {
     EXPECT_EQ(LogCountPrefix("cred_db:297 Exec sql:[SELECT * FROM credentials;] error: "), 2u)
         << kova_test::LogDump();
     EXPECT_EQ(kova_test::LogRecords().size(), 2u);
+}
+
+TEST_F(InterfaceTest, AddSaveGetAndSet) {
+    CredPtr cred = MakeCred("first", "backup");
+    EXPECT_EQ(KOVACredSave(cred.get()), 0);                                  // id -1: an add
+    EXPECT_EQ((Ints{cred->id, cred->ctime, cred->mtime}), (Ints{1, 0, 0}));  // the row has times
+    CredPtr second = MakeCred("second");
+    EXPECT_EQ(KOVACredAdd(second.get()), 0);
+    EXPECT_EQ(second->id, 2);
+    CredPtr loaded = NewCred();
+    EXPECT_EQ(KOVACredGetByID(1, loaded.get()), 0);
+    EXPECT_EQ((Ints{loaded->id, loaded->filled}), (Ints{1, 1}));
+    EXPECT_EQ((Texts{loaded->host, loaded->remote_passwd, loaded->application}),
+              (Texts{"first", "pw-first", "backup"}));
+    EXPECT_GT(loaded->ctime, 0);
+    EXPECT_EQ(loaded->ctime, loaded->mtime);
+    // A missing row is no failure: the record stays unfilled.
+    CredPtr missing = NewCred();
+    EXPECT_EQ(KOVACredGetByID(5, missing.get()), 0);
+    EXPECT_EQ((Ints{missing->id, missing->filled}), (Ints{-1, 0}));
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+
+    // A save with an id updates the row: ctime stays, mtime moves.
+    ASSERT_TRUE(Query("UPDATE credentials SET ctime=100, mtime=100;").empty());
+    cred->host = "changed";
+    cred->port = 443;
+    const long before = time(nullptr);
+    EXPECT_EQ(KOVACredSave(cred.get()), 0) << kova_test::LogDump();
+    EXPECT_EQ(cred->id, 1);
+    auto rows = Query("SELECT host, port, ctime, mtime FROM credentials WHERE id=1;");
+    ASSERT_EQ(rows.size(), 1u);
+    EXPECT_EQ((Row{rows[0][0], rows[0][1], rows[0][2]}), (Row{"changed", "443", "100"}));
+    EXPECT_GE(std::stol(rows[0][3]), before);
+
+    // A set of a row that is gone fails on the read-back.
+    ASSERT_TRUE(Query("DELETE FROM credentials;").empty());
+    EXPECT_EQ(KOVACredSetByID(42, cred.get()), -1);
+    EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_READBACK, "cred_db", 377));
+    kova_test::ClearLog();
+    cred->id = 42;
+    EXPECT_EQ(KOVACredSave(cred.get()), -1);
+    EXPECT_EQ(kova_test::LogRecords(),
+              (Texts{"cred_set:19 Set Cred record failed. id:[42][0x0B00 cred_db:377]",
+                     "cred_save:21 Set task failed. [42] [0x0B00 cred_db:377]"}));
+}
+
+TEST_F(InterfaceTest, LoadClearsOrReads) {
+    const int id = AddCred("loaded");
+    const int other = AddCred("other");
+    ASSERT_EQ(KOVACredSessSetByID(id, MakeSess(id, "sid", "tok").get()), 0);
+    CredPtr cred = NewCred();
+    EXPECT_EQ(KOVACredLoad(id, cred.get()), 0);
+    EXPECT_EQ(cred->host, "loaded");
+    // id -1 clears the record and frees its chain; the record then reads another row.
+    cred->next = KOVACredAlloc();
+    cred->next->next = KOVACredAlloc();
+    EXPECT_EQ(KOVACredLoad(-1, cred.get()), 0);
+    EXPECT_EQ(cred->next, nullptr);
+    EXPECT_EQ((Ints{cred->id, cred->filled}), (Ints{-1, 0}));
+    EXPECT_TRUE(cred->host.empty());
+    EXPECT_EQ(KOVACredLoad(other, cred.get()), 0);
+    EXPECT_EQ(cred->host, "other");
+    // A load of a missing id leaves members the row would have set.
+    CredPtr partial = NewCred();
+    partial->host = "mine";
+    EXPECT_EQ(KOVACredLoad(99, partial.get()), 0);
+    EXPECT_EQ(partial->host, "mine");
+
+    SessPtr sess = NewSess();
+    EXPECT_EQ(KOVACredSessLoad(id, sess.get()), 0);
+    EXPECT_EQ(sess->access_token, "sid");
+    sess->next = KOVACredSessAlloc();
+    EXPECT_EQ(KOVACredSessLoad(-1, sess.get()), 0);
+    EXPECT_EQ(sess->next, nullptr);
+    EXPECT_EQ((Ints{sess->id, sess->filled}), (Ints{-1, 0}));
+    EXPECT_TRUE(sess->access_token.empty());
+}
+
+TEST_F(InterfaceTest, ListIsNewestFirstFilteredAndLookedUpByApplication) {
+    KOVA_CRED *list = nullptr;
+    EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 0);  // an empty table
+    EXPECT_EQ(list, nullptr);
+    EXPECT_EQ(KOVACredIDGetByApplication("odd"), -1);
+    for (int i = 1; i <= 5; ++i) {
+        AddCred("h" + std::to_string(i), i % 2 ? "odd" : "even");
+    }
+    EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 5);
+    EXPECT_EQ(Ids(list), (std::vector<int>{5, 4, 3, 2, 1}));
+    EXPECT_EQ(list->host, "h5");
+    KOVACredListFree(&list);
+    EXPECT_EQ(list, nullptr);
+    char odd[] = "odd";
+    char oddSpace[] = "odd ";
+    EXPECT_EQ(KOVACredListGet(&list, KOVACredKeepByApplication, oddSpace), 0);
+    EXPECT_EQ(KOVACredListGet(&list, KOVACredKeepByApplication, odd), 3);
+    EXPECT_EQ(Ids(list), (std::vector<int>{5, 3, 1}));
+    KOVACredListFree(&list);
+    // The newest of an application, by exact and case-sensitive name.
+    EXPECT_EQ(KOVACredIDGetByApplication("odd"), 5);
+    KOVACredRemoveByID(5);
+    EXPECT_EQ(KOVACredIDGetByApplication("odd"), 3);
+    for (const char *miss : {"Odd", "od", ""}) {
+        EXPECT_EQ(KOVACredIDGetByApplication(miss), -1) << miss;
+    }
+
+    // A filter that drops everything leaves the caller's head as it was.
+    KOVA_CRED sentinel;
+    list = &sentinel;
+    auto none = [](KOVA_CRED *, void *) { return 0; };
+    EXPECT_EQ(KOVACredListGet(&list, none, nullptr), 0);
+    EXPECT_EQ(list, &sentinel);
+    // The filter sees each record with the caller's argument.
+    std::vector<int> seen;
+    auto record = [](KOVA_CRED *cred, void *arg) -> int {
+        static_cast<std::vector<int> *>(arg)->push_back(cred->id);
+        return cred->id == 2;
+    };
+    list = nullptr;
+    EXPECT_EQ(KOVACredListGet(&list, record, &seen), 1);
+    EXPECT_EQ(seen, (std::vector<int>{4, 3, 2, 1}));
+    EXPECT_EQ(Ids(list), (std::vector<int>{2}));
+    EXPECT_EQ(KOVACredNext(list), nullptr);
+    KOVACredListFree(&list);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+
+    // A table made elsewhere: columns in another order and one the record lacks, ids out of
+    // the rows' order, an application left NULL. Lists find the columns by name, and the
+    // newest of an application is the head of such a list: the last matching row.
+    ASSERT_TRUE(Query("DROP TABLE credential_sessions; DROP TABLE credentials; CREATE TABLE "
+                      "credentials (application TEXT, note TEXT, port INTEGER, host TEXT, id "
+                      "INTEGER, ctime INTEGER); INSERT INTO credentials VALUES ('backup', 'n', "
+                      "9001, 'h9', 9, 1700000009), ('backup', 'n', 4001, 'h4', 4, 14), (NULL, "
+                      "'n', 7001, 'h7', 7, 17);")
+                    .empty());
+    ASSERT_EQ(KOVACredListGet(&list, nullptr, nullptr), 3);
+    EXPECT_EQ(Ids(list), (std::vector<int>{7, 4, 9}));
+    EXPECT_EQ((Ints{list->next->port, list->next->ctime}), (Ints{4001, 14}));
+    EXPECT_EQ((Texts{list->next->application, list->next->host, list->application}),
+              (Texts{"backup", "h4", ""}));
+    KOVACredListFree(&list);
+    EXPECT_EQ(KOVACredIDGetByApplication("backup"), 4);
+    EXPECT_EQ(KOVACredIDGetByApplication(""), 7);
+    EXPECT_EQ(KOVACredIDGetByApplication("h9"), -1);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+}
+
+TEST_F(SessionTest, SaveStoresAndReplacesSetByIdTakesItsId) {
+    const int id = AddCred("h");
+    SessPtr sess = MakeSess(id, "sid-1", "tok-1");
+    EXPECT_EQ(KOVACredSessSave(sess.get()), 0) << kova_test::LogDump();
+    ASSERT_TRUE(Query("UPDATE credential_sessions SET mtime=5;").empty());
+    sess->access_token = "sid-2";
+    sess->csrf_token = "tok-2";
+    sess->extra_info = "";
+    const long before = time(nullptr);
+    EXPECT_EQ(KOVACredSessSave(sess.get()), 0);
+    auto rows = Query(
+        "SELECT id, mtime, access_token, csrf_token, extra_info FROM "
+        "credential_sessions;");
+    ASSERT_EQ(rows.size(), 1u);
+    EXPECT_GE(std::stol(rows[0][1]), before);
+    EXPECT_EQ((Row{rows[0][0], rows[0][2], rows[0][3], rows[0][4]}),
+              (Row{std::to_string(id), "sid-2", "tok-2", ""}));
+    SessPtr loaded = NewSess();
+    EXPECT_EQ(KOVACredSessGetByID(id, loaded.get()), 0);
+    EXPECT_EQ((Ints{loaded->id, loaded->filled}), (Ints{id, 1}));
+    EXPECT_EQ((Texts{loaded->access_token, loaded->csrf_token}), (Texts{"sid-2", "tok-2"}));
+
+    // SetByID writes under the id it is given, not the record's.
+    const int other = AddCred("b");
+    EXPECT_EQ(KOVACredSessSetByID(other, sess.get()), 0);
+    EXPECT_EQ(Query("SELECT id FROM credential_sessions WHERE access_token='sid-2';"),
+              (std::vector<Row>{{std::to_string(id)}, {std::to_string(other)}}));
+    EXPECT_EQ(sess->id, id);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+}
+
+TEST_F(SessionTest, WritesNeedTheirCredential) {
+    // An add takes the next row id, which must be a credential's.
+    SessPtr sess = MakeSess(-1, "s", "t");
+    EXPECT_EQ(KOVACredSessAdd(sess.get()), -1);
+    EXPECT_EQ(sess->id, -1);
+    EXPECT_EQ(kova_test::LogCount("cred_db:414 Exec sql:[INSERT INTO credential_sessions"), 1u);
+    EXPECT_EQ(kova_test::LogCount("cred_sess_add:20 Add Cred record failed. [0x"), 1u)
+        << kova_test::LogDump();
+    AddCred("one");
+    AddCred("two");
+    EXPECT_EQ(KOVACredSessSave(sess.get()), 0) << kova_test::LogDump();  // id -1: add
+    EXPECT_EQ(sess->id, 1);
+    SessPtr next = MakeSess(-1, "s2", "t2");
+    EXPECT_EQ(KOVACredSessAdd(next.get()), 0);
+    EXPECT_EQ(next->id, 2);
+    kova_test::ClearLog();
+    EXPECT_EQ(KOVACredSessSave(MakeSess(-1, "s3", "t3").get()), -1);
+    EXPECT_EQ(kova_test::LogCount("cred_sess_save:16 Add task failed. [0x"), 1u)
+        << kova_test::LogDump();
+
+    // A set under an id without a credential fails on the foreign key.
+    kova_test::ClearLog();
+    SessPtr orphan = MakeSess(7, "s", "t");
+    EXPECT_EQ(KOVACredSessSetByID(7, orphan.get()), -1);
+    EXPECT_EQ(kova_test::LogCount("cred_db:550 Exec sql:[REPLACE INTO credential_sessions"), 1u);
+    EXPECT_EQ(kova_test::LogCount("] error: FOREIGN KEY constraint failed\n"), 1u);
+    EXPECT_EQ(kova_test::LogCount("cred_sess_set:19 Set Cred record failed. id:[7][0x"), 1u)
+        << kova_test::LogDump();
+    kova_test::ClearLog();
+    EXPECT_EQ(KOVACredSessSave(orphan.get()), -1);
+    EXPECT_EQ(kova_test::LogCount("cred_sess_save:21 Set task failed. [7] [0x"), 1u)
+        << kova_test::LogDump();
+    EXPECT_EQ(Query("SELECT id FROM credential_sessions;"), (std::vector<Row>{{"1"}, {"2"}}));
+}
+
+TEST_F(SessionTest, ListRemoveAndNext) {
+    const int a = AddCred("a");
+    int b = AddCred("b");
+    const int c = AddCred("c");
+    for (int id : {a, c, b}) {
+        ASSERT_EQ(KOVACredSessSetByID(id, MakeSess(id, "s" + std::to_string(id), "t").get()), 0);
+    }
+    KOVA_CRED_SESS *list = nullptr;
+    EXPECT_EQ(KOVACredSessListGet(&list, nullptr, nullptr), 3);
+    EXPECT_EQ(Ids(list), (std::vector<int>{c, b, a}));  // newest id first
+    EXPECT_EQ(KOVACredSessNext(list->next->next), nullptr);
+    KOVACredSessListFree(&list);
+    EXPECT_EQ(list, nullptr);
+
+    auto onlyB = [](KOVA_CRED_SESS *sess, void *arg) -> int {
+        return sess->id == *static_cast<int *>(arg);
+    };
+    EXPECT_EQ(KOVACredSessListGet(&list, onlyB, &b), 1);
+    ASSERT_NE(list, nullptr);
+    EXPECT_EQ(list->access_token, "s" + std::to_string(b));
+    KOVACredSessListFree(&list);
+
+    EXPECT_EQ(KOVACredSessRemoveByID(b), 0);
+    EXPECT_EQ(KOVACredSessRemoveByID(b), 0);  // nothing left to remove: still 0
+    EXPECT_EQ(Query("SELECT count(*) FROM credentials;"), (std::vector<Row>{{"3"}}));
+    EXPECT_EQ(KOVACredSessListGet(&list, onlyB, &b), 0);
+    EXPECT_EQ(list, nullptr);
 }
 
 }  // namespace

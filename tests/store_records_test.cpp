@@ -32,15 +32,14 @@ namespace {
 using namespace store_test;
 
 struct FailNothrowNewScope {
-    FailNothrowNewScope() { gFailNothrowNew = true; }
+    explicit FailNothrowNewScope(bool fail = true) { gFailNothrowNew = fail; }
     ~FailNothrowNewScope() { gFailNothrowNew = false; }
 };
 
-// The accessors of one record type: their headers, the checks reported for a null record and
-// every accessor with its line and member.
+// The accessors of one record type: the headers their argument errors name, the checks of a
+// null record, and every accessor with its line and member.
 template <typename Record>
 struct IntAccessor {
-    const char *name;
     int line;
     int (*set)(Record *, int32_t);
     int (*get)(int32_t *, const Record *);
@@ -49,7 +48,6 @@ struct IntAccessor {
 
 template <typename Record>
 struct StringAccessor {
-    const char *name;
     int line;
     int (*set)(Record *, const char *);
     int (*get)(char *, size_t, const Record *);
@@ -63,29 +61,21 @@ struct CredAccessors {
     static constexpr const char *kGetter = "../include/kovacredential/kovacredgetter.h";
     static constexpr const char *kIntSetterCheck = "__null != pCred";
     static constexpr const char *kRecordCheck = "NULL != pCred";
-    static std::vector<IntAccessor<Record>> Ints() {
-        return {
-            {"ID", 1, KOVACredItemSetID, KOVACredItemGetID, &Record::id},
-            {"CreateTime", 2, KOVACredItemSetCreateTime, KOVACredItemGetCreateTime, &Record::ctime},
-            {"ModifyTime", 3, KOVACredItemSetModifyTime, KOVACredItemGetModifyTime, &Record::mtime},
-            {"Owner", 4, KOVACredItemSetOwner, KOVACredItemGetOwner, &Record::owner},
-            {"Port", 5, KOVACredItemSetPort, KOVACredItemGetPort, &Record::port},
-        };
-    }
-    static std::vector<StringAccessor<Record>> Strings() {
-        return {
-            {"Host", 6, KOVACredItemSetHost, KOVACredItemGetHost, &Record::host},
-            {"Application", 7, KOVACredItemSetApplication, KOVACredItemGetApplication,
-             &Record::application},
-            {"RemoteAccount", 8, KOVACredItemSetRemoteAccount, KOVACredItemGetRemoteAccount,
-             &Record::remote_account},
-            {"RemotePasswd", 9, KOVACredItemSetRemotePasswd, KOVACredItemGetRemotePasswd,
-             &Record::remote_passwd},
-            {"Protocol", 10, KOVACredItemSetProtocol, KOVACredItemGetProtocol, &Record::protocol},
-            {"ExtraInfo", 11, KOVACredItemSetExtraInfo, KOVACredItemGetExtraInfo,
-             &Record::extra_info},
-        };
-    }
+    static constexpr IntAccessor<Record> kInts[] = {
+        {1, KOVACredItemSetID, KOVACredItemGetID, &Record::id},
+        {2, KOVACredItemSetCreateTime, KOVACredItemGetCreateTime, &Record::ctime},
+        {3, KOVACredItemSetModifyTime, KOVACredItemGetModifyTime, &Record::mtime},
+        {4, KOVACredItemSetOwner, KOVACredItemGetOwner, &Record::owner},
+        {5, KOVACredItemSetPort, KOVACredItemGetPort, &Record::port},
+    };
+    static constexpr StringAccessor<Record> kStrings[] = {
+        {6, KOVACredItemSetHost, KOVACredItemGetHost, &Record::host},
+        {7, KOVACredItemSetApplication, KOVACredItemGetApplication, &Record::application},
+        {8, KOVACredItemSetRemoteAccount, KOVACredItemGetRemoteAccount, &Record::remote_account},
+        {9, KOVACredItemSetRemotePasswd, KOVACredItemGetRemotePasswd, &Record::remote_passwd},
+        {10, KOVACredItemSetProtocol, KOVACredItemGetProtocol, &Record::protocol},
+        {11, KOVACredItemSetExtraInfo, KOVACredItemGetExtraInfo, &Record::extra_info},
+    };
 };
 
 struct SessAccessors {
@@ -95,19 +85,13 @@ struct SessAccessors {
     static constexpr const char *kGetter = "../include/kovacredential/kovacredsessgetter.h";
     static constexpr const char *kIntSetterCheck = "__null != pSess";
     static constexpr const char *kRecordCheck = "NULL != pSess";
-    static std::vector<IntAccessor<Record>> Ints() {
-        return {{"ID", 1, KOVACredSessItemSetID, KOVACredSessItemGetID, &Record::id}};
-    }
-    static std::vector<StringAccessor<Record>> Strings() {
-        return {
-            {"AccessToken", 2, KOVACredSessItemSetAccessToken, KOVACredSessItemGetAccessToken,
-             &Record::access_token},
-            {"CsrfToken", 3, KOVACredSessItemSetCsrfToken, KOVACredSessItemGetCsrfToken,
-             &Record::csrf_token},
-            {"ExtraInfo", 4, KOVACredSessItemSetExtraInfo, KOVACredSessItemGetExtraInfo,
-             &Record::extra_info},
-        };
-    }
+    static constexpr IntAccessor<Record> kInts[] = {
+        {1, KOVACredSessItemSetID, KOVACredSessItemGetID, &Record::id}};
+    static constexpr StringAccessor<Record> kStrings[] = {
+        {2, KOVACredSessItemSetAccessToken, KOVACredSessItemGetAccessToken, &Record::access_token},
+        {3, KOVACredSessItemSetCsrfToken, KOVACredSessItemGetCsrfToken, &Record::csrf_token},
+        {4, KOVACredSessItemSetExtraInfo, KOVACredSessItemGetExtraInfo, &Record::extra_info},
+    };
 };
 
 template <typename Accessors>
@@ -116,18 +100,17 @@ using AccessorKinds = ::testing::Types<CredAccessors, SessAccessors>;
 TYPED_TEST_SUITE(AccessorTest, AccessorKinds);
 
 TYPED_TEST(AccessorTest, AccessorsStoreReturnAndTruncate) {
-    for (const auto &acc : TypeParam::Ints()) {
-        SCOPED_TRACE(acc.name);
+    for (const auto &acc : TypeParam::kInts) {
+        SCOPED_TRACE(acc.line);
         auto rec = TypeParam::New();
-        EXPECT_EQ(acc.set(rec.get(), -123456), 0);
-        EXPECT_EQ(rec.get()->*acc.member, -123456);
         int32_t out = 0;
+        EXPECT_EQ(acc.set(rec.get(), -123456), 0);
         EXPECT_EQ(acc.get(&out, rec.get()), 0);
-        EXPECT_EQ(out, -123456);
+        EXPECT_EQ((Ints{rec.get()->*acc.member, out}), (Ints{-123456, -123456}));
     }
     const char *value = "value with 'quotes' and \xc3\xa9";
-    for (const auto &acc : TypeParam::Strings()) {
-        SCOPED_TRACE(acc.name);
+    for (const auto &acc : TypeParam::kStrings) {
+        SCOPED_TRACE(acc.line);
         auto rec = TypeParam::New();
         EXPECT_EQ(acc.set(rec.get(), value), 0);
         EXPECT_EQ(rec.get()->*acc.member, value);
@@ -150,42 +133,39 @@ TYPED_TEST(AccessorTest, AccessorsStoreReturnAndTruncate) {
 }
 
 TYPED_TEST(AccessorTest, AccessorsReportBadArgumentsInOrder) {
-    for (const auto &acc : TypeParam::Ints()) {
-        SCOPED_TRACE(acc.name);
+    auto setter = [](int line, const char *check, std::function<long()> call) {
+        return ArgCase{std::move(call), TypeParam::kSetter, line, check};
+    };
+    auto getter = [](int line, const char *check, std::function<long()> call) {
+        return ArgCase{std::move(call), TypeParam::kGetter, line, check};
+    };
+    for (const auto &acc : TypeParam::kInts) {
+        SCOPED_TRACE(acc.line);
         auto rec = TypeParam::New();
         int32_t out = 77;
         ExpectArgErrors({
-            {[&] { return acc.set(nullptr, 1); }, TypeParam::kSetter, acc.line,
-             TypeParam::kIntSetterCheck},
-            {[&] { return acc.get(nullptr, rec.get()); }, TypeParam::kGetter, acc.line,
-             "__null != pVal"},
-            {[&] { return acc.get(&out, nullptr); }, TypeParam::kGetter, acc.line,
-             TypeParam::kRecordCheck},
+            setter(acc.line, TypeParam::kIntSetterCheck, [&] { return acc.set(nullptr, 1); }),
+            getter(acc.line, "__null != pVal", [&] { return acc.get(nullptr, rec.get()); }),
+            getter(acc.line, TypeParam::kRecordCheck, [&] { return acc.get(&out, nullptr); }),
             // Both null: the value pointer is checked first.
-            {[&] { return acc.get(nullptr, nullptr); }, TypeParam::kGetter, acc.line,
-             "__null != pVal"},
+            getter(acc.line, "__null != pVal", [&] { return acc.get(nullptr, nullptr); }),
         });
         EXPECT_EQ(out, 77);
     }
-    for (const auto &acc : TypeParam::Strings()) {
-        SCOPED_TRACE(acc.name);
+    for (const auto &acc : TypeParam::kStrings) {
+        SCOPED_TRACE(acc.line);
         auto rec = TypeParam::New();
         rec.get()->*acc.member = "kept";
         char buf[16] = "untouched";
         ExpectArgErrors({
             // The text is checked before the record.
-            {[&] { return acc.set(nullptr, nullptr); }, TypeParam::kSetter, acc.line,
-             "__null != szVal"},
-            {[&] { return acc.set(rec.get(), nullptr); }, TypeParam::kSetter, acc.line,
-             "__null != szVal"},
-            {[&] { return acc.set(nullptr, "v"); }, TypeParam::kSetter, acc.line,
-             TypeParam::kRecordCheck},
+            setter(acc.line, "__null != szVal", [&] { return acc.set(nullptr, nullptr); }),
+            setter(acc.line, "__null != szVal", [&] { return acc.set(rec.get(), nullptr); }),
+            setter(acc.line, TypeParam::kRecordCheck, [&] { return acc.set(nullptr, "v"); }),
             // The buffer, then its size, then the record.
-            {[&] { return acc.get(nullptr, 0, nullptr); }, TypeParam::kGetter, acc.line,
-             "__null != szBuf"},
-            {[&] { return acc.get(buf, 0, nullptr); }, TypeParam::kGetter, acc.line, "0 < cbBuf"},
-            {[&] { return acc.get(buf, sizeof(buf), nullptr); }, TypeParam::kGetter, acc.line,
-             TypeParam::kRecordCheck},
+            getter(acc.line, "__null != szBuf", [&] { return acc.get(nullptr, 0, nullptr); }),
+            getter(acc.line, "0 < cbBuf", [&] { return acc.get(buf, 0, nullptr); }),
+            getter(acc.line, TypeParam::kRecordCheck, [&] { return acc.get(buf, 16, nullptr); }),
         });
         EXPECT_EQ(rec.get()->*acc.member, "kept");
         EXPECT_STREQ(buf, "untouched");
@@ -194,175 +174,125 @@ TYPED_TEST(AccessorTest, AccessorsReportBadArgumentsInOrder) {
 
 using RecordTest = LogTest;
 
-// Column names and texts as sqlite3_exec hands them to a callback.
-struct FakeRow {
-    std::vector<std::string> names;
-    std::vector<const char *> values;
-    std::vector<char *> nameArgs;
-    std::vector<char *> valueArgs;
-    FakeRow(std::vector<std::string> n, std::vector<const char *> v)
-        : names(std::move(n)), values(std::move(v)) {
-        for (auto &name : names) {
-            nameArgs.push_back(name.data());
-        }
-        for (auto *value : values) {
-            valueArgs.push_back(const_cast<char *>(value));
-        }
-    }
-    int Feed(int (*callback)(void *, int, char **, char **), void *arg) {
-        return callback(arg, static_cast<int>(names.size()), valueArgs.data(), nameArgs.data());
-    }
-};
-
-FakeRow CredRow(const char *id, const char *host) {
-    return FakeRow(
-        {"id", "ctime", "mtime", "host", "owner", "remote_account", "remote_passwd", "port",
-         "protocol", "application", "extra_info", "pid"},
-        {id, "100", "200", host, "1026", "acct", "pw", " +5001x", "https", "app", "extra", "9999"});
+// Feeds one row to a callback as sqlite3_exec does.
+int Feed(int (*callback)(void *, int, char **, char **), void *arg, std::vector<const char *> names,
+         std::vector<const char *> values) {
+    return callback(arg, static_cast<int>(names.size()), const_cast<char **>(values.data()),
+                    const_cast<char **>(names.data()));
 }
 
-TEST_F(RecordTest, CredRowFirstCopiesColumnsByExactNameOnce) {
-    CredPtr cred = NewCred();
-    FakeRow row = CredRow("7", nullptr);
-    EXPECT_EQ(row.Feed(CredRowFirst, cred.get()), 0);
-    EXPECT_EQ(cred->filled, 1);
-    EXPECT_EQ((std::vector<int32_t>{cred->id, cred->ctime, cred->mtime, cred->owner, cred->port}),
-              (std::vector<int32_t>{7, 100, 200, 1026, 5001}));  // strtol: " +5001x" is 5001
-    // A NULL column becomes "".
-    EXPECT_EQ((std::vector<std::string>{cred->host, cred->remote_account, cred->remote_passwd,
-                                        cred->protocol, cred->application, cred->extra_info}),
-              (std::vector<std::string>{"", "acct", "pw", "https", "app", "extra"}));
+const std::vector<const char *> kCredColumns = {
+    "id",   "ctime",    "mtime",       "host",       "owner", "remote_account", "remote_passwd",
+    "port", "protocol", "application", "extra_info", "pid"};
 
-    // A filled record keeps its first row, every member of it.
-    FakeRow second({"id", "ctime", "mtime", "host", "owner", "remote_account", "remote_passwd",
-                    "port", "protocol", "application", "extra_info"},
-                   {"8", "1", "2", "other", "3", "a2", "p2", "4", "http", "app2", "e2"});
-    EXPECT_EQ(second.Feed(CredRowFirst, cred.get()), 0);
-    EXPECT_EQ((std::vector<int32_t>{cred->id, cred->ctime, cred->owner, cred->port}),
-              (std::vector<int32_t>{7, 100, 1026, 5001}));
-    EXPECT_EQ((std::vector<std::string>{cred->host, cred->remote_account, cred->extra_info}),
-              (std::vector<std::string>{"", "acct", "extra"}));
-
-    // Names match exactly.
-    CredPtr other = NewCred();
-    FakeRow odd({"ID", "Host", "hostname", "host"}, {"5", "upper", "longer", "exact"});
-    odd.Feed(CredRowFirst, other.get());
-    EXPECT_EQ(other->host, "exact");
-    EXPECT_EQ(other->id, -1);
-    // Integers convert as strtol does; out of range they saturate instead of wrapping.
-    const std::pair<const char *, int32_t> kIntegers[] = {{"1700000000", 1700000000},
-                                                          {"-2147483648", INT32_MIN},
-                                                          {"2147483648", INT32_MAX},
-                                                          {"-4294967297", INT32_MIN},
-                                                          {"99999999999999999999", INT32_MAX},
-                                                          {"000000000000000000042", 42},
-                                                          {"12abc", 12},
-                                                          {" \t+42", 42},
-                                                          {"-", 0},
-                                                          {"", 0}};
-    for (const auto &[text, value] : kIntegers) {
-        CredPtr converted = NewCred();
-        FakeRow({"port"}, {text}).Feed(CredRowFirst, converted.get());
-        EXPECT_EQ(converted->port, value) << text;
-    }
-    CredPtr empty = NewCred();
-    FakeRow none({}, {});
-    none.Feed(CredRowFirst, empty.get());
-    EXPECT_EQ(empty->filled, 1);
-}
-
-TEST_F(RecordTest, CredRowAppendLinksRowsInFrontAndDropsOneItCannotAllocate) {
-    KOVA_CRED *head = nullptr;
-    for (const char *id : {"1", "2", "3"}) {
-        FakeRow row = CredRow(id, "h");
-        if (*id == '2') {
-            FailNothrowNewScope noMemory;
-            EXPECT_EQ(row.Feed(CredRowAppend, &head), 0);  // the query goes on
-        } else {
-            EXPECT_EQ(row.Feed(CredRowAppend, &head), 0);
-        }
-    }
-    EXPECT_EQ(Ids(head), (std::vector<int>{3, 1}));
-    for (KOVA_CRED *p = head; p != nullptr; p = p->next) {
-        EXPECT_EQ(p->filled, 1);
-        EXPECT_EQ(p->host, "h");
-    }
-    KOVACredListFree(&head);
-    EXPECT_EQ(head, nullptr);
-    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
-}
-
-TEST_F(RecordTest, SessionRowCallbacksSkipMtime) {
-    KOVA_CRED_SESS *head = nullptr;
-    FakeRow a({"id", "mtime", "access_token", "csrf_token", "extra_info"},
-              {"4", "123", "sid", nullptr, "e"});
-    FakeRow b({"id", "mtime", "access_token", "csrf_token", "extra_info"},
-              {"6", "124", "sid6", "tok6", "e6"});
-    a.Feed(CredSessRowAppend, &head);
-    b.Feed(CredSessRowAppend, &head);
-    ASSERT_EQ(Ids(head), (std::vector<int>{6, 4}));
-    EXPECT_EQ(head->csrf_token, "tok6");
-    EXPECT_EQ(head->next->csrf_token, "");  // NULL column
-    KOVACredSessListFree(&head);
-
-    SessPtr sess = NewSess();
-    a.Feed(CredSessRowFirst, sess.get());
-    b.Feed(CredSessRowFirst, sess.get());
-    EXPECT_EQ(sess->filled, 1);
-    EXPECT_EQ(sess->id, 4);
-    EXPECT_EQ(sess->access_token, "sid");
-    EXPECT_EQ(sess->extra_info, "e");
+std::vector<const char *> CredValues(const char *id, const char *host) {
+    return {id,   "100",     "200",   host,  "1026",  "acct",
+            "pw", " +5001x", "https", "app", "extra", "9999"};
 }
 
 // Every member but `next`, so that two records compare whole.
-std::vector<std::string> Members(const KOVA_CRED &c) {
-    std::vector<std::string> out{c.host,     c.remote_account, c.remote_passwd,
-                                 c.protocol, c.application,    c.extra_info};
+Texts Members(const KOVA_CRED &c) {
+    Texts out{c.host, c.remote_account, c.remote_passwd, c.protocol, c.application, c.extra_info};
     for (int32_t value : {c.filled, c.id, c.ctime, c.mtime, c.owner, c.port}) {
         out.push_back(std::to_string(value));
     }
     return out;
 }
 
-TEST_F(RecordTest, AllocationDefaultsAndClearingBackToThem) {
+Texts Members(const KOVA_CRED_SESS &s) {
+    return {s.access_token, s.csrf_token, s.extra_info, std::to_string(s.filled),
+            std::to_string(s.id)};
+}
+
+TEST_F(RecordTest, CredRowFirstCopiesColumnsByExactNameOnce) {
+    CredPtr cred = NewCred();
+    EXPECT_EQ(Feed(CredRowFirst, cred.get(), kCredColumns, CredValues("7", nullptr)), 0);
+    // A NULL column becomes "", and strtol reads " +5001x" as 5001.
+    const Texts first{"",  "acct", "pw",  "https", "app",  "extra",
+                      "1", "7",    "100", "200",   "1026", "5001"};
+    EXPECT_EQ(Members(*cred), first);
+    // A filled record keeps its first row, every member of it.
+    EXPECT_EQ(Feed(CredRowFirst, cred.get(), kCredColumns,
+                   {"8", "1", "2", "other", "3", "a2", "p2", "4", "http", "app2", "e2", "1"}),
+              0);
+    EXPECT_EQ(Members(*cred), first);
+
+    // Names match exactly.
+    CredPtr other = NewCred();
+    Feed(CredRowFirst, other.get(), {"ID", "Host", "hostname", "host"},
+         {"5", "upper", "longer", "exact"});
+    EXPECT_EQ(other->host, "exact");
+    EXPECT_EQ(other->id, -1);
+    // Integers convert as strtol does; out of range they saturate instead of wrapping.
+    const char *texts[] = {"1700000000",
+                           "-2147483648",
+                           "2147483648",
+                           "-4294967297",
+                           "99999999999999999999",
+                           "000000000000000000042",
+                           "12abc",
+                           " \t+42",
+                           "-",
+                           ""};
+    const int32_t values[] = {1700000000, INT32_MIN, INT32_MAX, INT32_MIN, INT32_MAX,
+                              42,         12,        42,        0,         0};
+    for (size_t i = 0; i < std::size(texts); ++i) {
+        CredPtr converted = NewCred();
+        Feed(CredRowFirst, converted.get(), {"port"}, {texts[i]});
+        EXPECT_EQ(converted->port, values[i]) << texts[i];
+    }
+    CredPtr empty = NewCred();
+    Feed(CredRowFirst, empty.get(), {}, {});
+    EXPECT_EQ(empty->filled, 1);
+}
+
+TEST_F(RecordTest, SessionRowCallbacksSkipMtimeAndClearingFreesTheChain) {
+    const std::vector<const char *> columns = {"id", "mtime", "access_token", "csrf_token",
+                                               "extra_info"};
+    const std::vector<const char *> a = {"4", "123", "sid", nullptr, "e"};
+    const std::vector<const char *> b = {"6", "124", "sid6", "tok6", "e6"};
+    SessPtr sess = NewSess();
+    const Texts fresh = Members(*sess);
+    EXPECT_EQ(fresh, (Texts{"", "", "", "0", "-1"}));
+    EXPECT_EQ(sess->next, nullptr);
+    Feed(CredSessRowFirst, sess.get(), columns, a);
+    Feed(CredSessRowFirst, sess.get(), columns, b);
+    EXPECT_EQ(Members(*sess), (Texts{"sid", "", "e", "1", "4"}));  // a NULL column becomes ""
+
+    KOVA_CRED_SESS *head = nullptr;
+    Feed(CredSessRowAppend, &head, columns, a);
+    Feed(CredSessRowAppend, &head, columns, b);
+    ASSERT_EQ(Ids(head), (std::vector<int>{6, 4}));
+    EXPECT_EQ(Members(*head), (Texts{"sid6", "tok6", "e6", "1", "6"}));
+    EXPECT_EQ(Members(*head->next), (Texts{"sid", "", "e", "1", "4"}));
+    EXPECT_EQ(KOVACredSessClear(head), 0);  // ASan reports a leak if the chain is not freed
+    EXPECT_EQ(head->next, nullptr);
+    EXPECT_EQ(Members(*head), fresh);
+    EXPECT_EQ(KOVACredSessFree(head), 0);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+}
+
+TEST_F(RecordTest, CredAllocationAppendAndClearing) {
     CredPtr fresh = NewCred();
     ASSERT_NE(fresh, nullptr);
     EXPECT_EQ(KOVACredNext(fresh.get()), nullptr);
-    EXPECT_EQ(Members(*fresh),
-              (std::vector<std::string>{"", "", "", "", "", "", "0", "-1", "0", "0", "-1", "0"}));
-    SessPtr freshSess = NewSess();
-    ASSERT_NE(freshSess, nullptr);
-    EXPECT_EQ(freshSess->next, nullptr);
-    EXPECT_EQ((std::vector<int32_t>{freshSess->filled, freshSess->id}),
-              (std::vector<int32_t>{0, -1}));
-    EXPECT_TRUE(freshSess->access_token.empty() && freshSess->csrf_token.empty() &&
-                freshSess->extra_info.empty());
-
+    EXPECT_EQ(Members(*fresh), (Texts{"", "", "", "", "", "", "0", "-1", "0", "0", "-1", "0"}));
+    // Rows link in front; one that cannot be allocated is dropped and the query goes on.
     KOVA_CRED *head = nullptr;
     for (const char *id : {"1", "2", "3"}) {
-        FakeRow row = CredRow(id, "h");
-        row.Feed(CredRowAppend, &head);
+        FailNothrowNewScope noMemory(*id == '2');
+        EXPECT_EQ(Feed(CredRowAppend, &head, kCredColumns, CredValues(id, "h")), 0);
+    }
+    EXPECT_EQ(Ids(head), (std::vector<int>{3, 1}));
+    for (KOVA_CRED *p = head; p != nullptr; p = p->next) {
+        EXPECT_EQ(Members(*p), (Texts{"h", "acct", "pw", "https", "app", "extra", "1",
+                                      std::to_string(p->id), "100", "200", "1026", "5001"}));
     }
     EXPECT_EQ(KOVACredClear(head), 0);  // ASan reports a leak if the chain is not freed
     EXPECT_EQ(head->next, nullptr);
     EXPECT_EQ(Members(*head), Members(*fresh));
     EXPECT_EQ(KOVACredFree(head), 0);
-
-    KOVA_CRED_SESS *sessHead = nullptr;
-    FakeRow s1({"id", "access_token"}, {"1", "a"});
-    FakeRow s2({"id", "access_token"}, {"2", "b"});
-    s1.Feed(CredSessRowAppend, &sessHead);
-    s2.Feed(CredSessRowAppend, &sessHead);
-    EXPECT_EQ(KOVACredSessClear(sessHead), 0);
-    EXPECT_EQ(sessHead->next, nullptr);
-    EXPECT_EQ(sessHead->id, -1);
-    EXPECT_TRUE(sessHead->access_token.empty());
-    EXPECT_EQ(KOVACredSessFree(sessHead), 0);
-
-    EXPECT_EQ(KOVACredClear(nullptr), -1);
-    EXPECT_EQ(KOVACredSessClear(nullptr), -1);
     EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
-    EXPECT_EQ(VLIBCErrGet(), 0);
 }
 
 TEST_F(RecordTest, FailedAllocationsAndNullRecords) {
@@ -377,11 +307,10 @@ TEST_F(RecordTest, FailedAllocationsAndNullRecords) {
     }
     EXPECT_EQ(cred, nullptr);
     EXPECT_EQ(sess, nullptr);
-    EXPECT_EQ(
-        kova_test::LogRecords(),
-        (std::vector<std::string>{
-            std::string("cred_alloc:9 Allocate KOVA_CRED failed. ") + strerror(ENOMEM),
-            std::string("cred_sess_alloc:9 Allocate KOVA_CRED_SESS failed. ") + strerror(ENOMEM)}));
+    EXPECT_EQ(kova_test::LogRecords(),
+              (Texts{std::string("cred_alloc:9 Allocate KOVA_CRED failed. ") + strerror(ENOMEM),
+                     std::string("cred_sess_alloc:9 Allocate KOVA_CRED_SESS failed. ") +
+                         strerror(ENOMEM)}));
 
     kova_test::ClearLog();
     EXPECT_EQ(KOVACredFree(nullptr), -1);
@@ -389,6 +318,13 @@ TEST_F(RecordTest, FailedAllocationsAndNullRecords) {
     kova_test::ClearLog();
     EXPECT_EQ(KOVACredSessFree(nullptr), -1);
     EXPECT_TRUE(ArgErrorReported("cred_sess_alloc", 19, "__null != pSess"));
+    // Clearing nothing fails without a record or a code; the next of nothing is nothing.
+    kova_test::ClearLog();
+    ResetErrorSlot();
+    EXPECT_EQ(KOVACredClear(nullptr), -1);
+    EXPECT_EQ(KOVACredSessClear(nullptr), -1);
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
+    EXPECT_EQ(VLIBCErrGet(), 0);
     EXPECT_EQ(KOVACredNext(nullptr), nullptr);
     EXPECT_EQ(KOVACredSessNext(nullptr), nullptr);
 }

@@ -28,20 +28,14 @@ TempDir::~TempDir() {
 }
 
 TempDatabase::TempDatabase() : db_(dir_.File("credentials.sqlite")) {
-    const char *old = getenv("kovacredential_db");
-    hadOld_ = old != nullptr;
-    if (hadOld_) {
+    if (const char *old = getenv("kovacredential_db")) {
         old_ = old;
     }
     setenv("kovacredential_db", db_.c_str(), 1);
 }
 
 TempDatabase::~TempDatabase() {
-    if (hadOld_) {
-        setenv("kovacredential_db", old_.c_str(), 1);
-    } else {
-        unsetenv("kovacredential_db");
-    }
+    old_ ? setenv("kovacredential_db", old_->c_str(), 1) : unsetenv("kovacredential_db");
 }
 
 int RunCommand(const std::string &command, std::string *out) {

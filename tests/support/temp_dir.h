@@ -5,6 +5,7 @@
 #include <stdio.h>
 
 #include <memory>
+#include <optional>
 #include <string>
 
 namespace kova_test {
@@ -35,8 +36,7 @@ class TempDatabase {
   private:
     TempDir dir_;
     std::string db_;
-    bool hadOld_ = false;
-    std::string old_;
+    std::optional<std::string> old_;
 };
 
 // An owned stdio stream, closed when it goes.
