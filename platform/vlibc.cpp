@@ -30,7 +30,7 @@ int MakeParents(const std::string &path) {
     return 0;
 }
 
-const char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+constexpr char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
 
 // The two characters of every 12-bit value, so that three input bytes take two look-ups.
 struct CharPairs {

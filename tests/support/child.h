@@ -11,8 +11,8 @@ namespace kova_test {
 // Forks; the child runs `body`, whose result becomes its exit status, and is ended by SIGALRM
 // after `seconds`. Returns how the child ended: "exit 0" for success, "exit N", or
 // "signal N (name)". The child's standard error stays the test's, for diagnostics. Under
-// ThreadSanitizer and AddressSanitizer the body runs in the calling process instead, under the
-// same alarm (see child.cpp).
+// ThreadSanitizer and AddressSanitizer, while other threads run, the body runs in the calling
+// process instead, under the same alarm (see child.cpp).
 std::string RunInChild(unsigned seconds, const std::function<int()> &body);
 
 }  // namespace kova_test
