@@ -127,8 +127,20 @@ double RunManager(const Batch &batch, int *good, bool *ok) {
     return seconds;
 }
 
-// The loop libcurl's own documentation suggests, over handles set up exactly as Run sets them
-// up.
+// The loop libcurl's own documentation suggests: perform, then poll, until no transfer runs.
+void DriveToTheEnd(CURLM *multi) {
+    int running = 0;
+    do {
+        if (curl_multi_perform(multi, &running) != CURLM_OK) {
+            break;
+        }
+        if (running > 0 && curl_multi_poll(multi, nullptr, 0, 1000, nullptr) != CURLM_OK) {
+            break;
+        }
+    } while (running > 0);
+}
+
+// That loop over handles set up exactly as Run sets them up.
 double RunReference(const Batch &batch, int *good) {
     Requests requests = batch.make();
     std::unique_ptr<CURLM, CURLMcode (*)(CURLM *)> multi(curl_multi_init(), curl_multi_cleanup);
@@ -139,15 +151,7 @@ double RunReference(const Batch &batch, int *good) {
         }
     }
     const auto start = Clock::now();
-    int running = 0;
-    do {
-        if (curl_multi_perform(multi.get(), &running) != CURLM_OK) {
-            break;
-        }
-        if (running > 0 && curl_multi_poll(multi.get(), nullptr, 0, 1000, nullptr) != CURLM_OK) {
-            break;
-        }
-    } while (running > 0);
+    DriveToTheEnd(multi.get());
     const double seconds = Since(start);
     *good = 0;
     for (int i = 0; i < batch.size; ++i) {
@@ -266,15 +270,7 @@ int RawTransfers(const std::string &base) {
         curl_easy_setopt(t.easy, CURLOPT_WRITEDATA, &t.answer);
         curl_multi_add_handle(multi.get(), t.easy);
     }
-    int running = 0;
-    do {
-        if (curl_multi_perform(multi.get(), &running) != CURLM_OK) {
-            break;
-        }
-        if (running > 0 && curl_multi_poll(multi.get(), nullptr, 0, 1000, nullptr) != CURLM_OK) {
-            break;
-        }
-    } while (running > 0);
+    DriveToTheEnd(multi.get());
     int good = 0;
     for (int i = 0; i < kConcurrentCalls; ++i) {
         good += GoodEcho(i, transfers[i].answer) ? 1 : 0;
