@@ -23,9 +23,10 @@ class KovacredStoreTest : public StoreTest {
         fwrite(input.data(), 1, input.size(), f);
         fclose(f);
         out_.clear();
-        int status = kova_test::RunCommand(std::string(KOVACRED_BIN) + " --db '" + DbPath() + "' " +
-                                               args + " <'" + in + "' 2>'" + err + "'",
-                                           &out_);
+        int status =
+            kova_test::RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --db '" + DbPath() +
+                                      "' " + args + " <'" + in + "' 2>'" + err + "'",
+                                  &out_);
         err_.clear();
         if (FILE *e = fopen(err.c_str(), "r")) {
             char buf[4096];
@@ -153,7 +154,8 @@ TEST_F(KovacredStoreTest, FailuresPrintOneLineAndExitNonZero) {
 }
 
 TEST_F(KovacredStoreTest, UnusableDatabaseIsReportedWithTheLibraryCode) {
-    const std::string cmd = std::string(KOVACRED_BIN) + " --db '" + BlockDatabase() + "' list";
+    const std::string cmd =
+        kova_test::ToolCommand(KOVACRED_BIN) + " --db '" + BlockDatabase() + "' list";
     std::string out;
     EXPECT_EQ(kova_test::RunCommand(cmd + " 2>&1", &out), 1);
     EXPECT_EQ(out, "kovacred: list credentials failed (error 2304)\n");

@@ -36,8 +36,8 @@ class BatchCommandTest : public ::testing::Test {
         std::string errFile = dir_.File("stderr.txt");
         out_.clear();
         int status =
-            kova_test::RunCommand(std::string(KOVACRED_BIN) + " --db " + dir_.File("db.sqlite") +
-                                      " batch " + file + " 2>" + errFile,
+            kova_test::RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --db " +
+                                      dir_.File("db.sqlite") + " batch " + file + " 2>" + errFile,
                                   &out_);
         std::ifstream in(errFile);
         std::stringstream text;

@@ -190,9 +190,9 @@ TEST_F(ManagerWebApiTest, BatchCommandRunsCredentialAndUrlCalls) {
 
     std::string out;
     std::string errFile = db_->dir().File("stderr.txt");
-    int status = kova_test::RunCommand(
-        std::string(KOVACRED_BIN) + " --db " + db_->path() + " batch " + file + " 2>" + errFile,
-        &out);
+    int status = kova_test::RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --db " +
+                                           db_->path() + " batch " + file + " 2>" + errFile,
+                                       &out);
     std::ifstream errIn(errFile);
     std::string err((std::istreambuf_iterator<char>(errIn)), std::istreambuf_iterator<char>());
     EXPECT_NE(0, status);

@@ -51,8 +51,9 @@ class KovasimRelayTest : public ::testing::Test {
     // Runs kovacred resolve with the directory hosts pointed at the simulator.
     int Resolve(const std::string &args, std::string *out) {
         std::string command = "kovacredential_farlink_global=" + global_ +
-                              " kovacredential_farlink_server=" + site_ + " " + KOVACRED_BIN +
-                              " --db " + dir_.File("unused.sqlite") + " resolve " + args + " 2>&1";
+                              " kovacredential_farlink_server=" + site_ + " " +
+                              ToolCommand(KOVACRED_BIN) + " --db " + dir_.File("unused.sqlite") +
+                              " resolve " + args + " 2>&1";
         return RunCommand(command, out);
     }
 
@@ -90,7 +91,7 @@ TEST(KovasimRelayConfig, RejectsARelayRoleWithoutHosts) {
     std::ofstream(dir.File("bad.json")) << "{\"relay\": {\"hosts\": []}}";
     std::string out;
     int status = RunCommand(
-        std::string(KOVASIM_BIN) + " --config " + dir.File("bad.json") + " --duration 1 2>&1",
+        ToolCommand(KOVASIM_BIN) + " --config " + dir.File("bad.json") + " --duration 1 2>&1",
         &out);
     EXPECT_EQ(status, 2);
     EXPECT_NE(out.find("relay: \"relay\" needs a non-empty array \"hosts\""), std::string::npos)

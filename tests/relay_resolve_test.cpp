@@ -44,8 +44,9 @@ class RelayResolveTest : public kova_test::RelayDirectoryTest {
     // status and its standard output.
     int Resolve(const std::string &arguments, std::string *out) {
         std::string command = "kovacredential_farlink_global=" + directory_.Host(0) +
-                              " kovacredential_farlink_server=" + directory_.Host(1) + " '" +
-                              KOVACRED_BIN + "' resolve " + arguments + " 2>/dev/null";
+                              " kovacredential_farlink_server=" + directory_.Host(1) + " " +
+                              kova_test::ToolCommand(KOVACRED_BIN) + " resolve " + arguments +
+                              " 2>/dev/null";
         out->clear();
         return kova_test::RunCommand(command, out);
     }

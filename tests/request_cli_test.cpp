@@ -21,7 +21,8 @@ class CliTest : public ::testing::Test {
         ASSERT_TRUE(server_.Start());
     }
     int Run(const std::string &args, std::string *out) {
-        return kova_test::RunCommand(std::string(KOVACRED_BIN) + " " + args + " 2>&1", out);
+        return kova_test::RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " " + args + " 2>&1",
+                                     out);
     }
     kovasim::LoopbackServer server_;
     kova_test::TempDir dir_;

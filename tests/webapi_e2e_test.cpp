@@ -32,7 +32,7 @@ class WebApiE2eTest : public ::testing::Test {
                  const std::string &input = "") {
         std::string errFile = dir_.File("stderr");
         std::string command = (input.empty() ? "" : "printf '%s\\n' '" + input + "' | ") +
-                              std::string(KOVACRED_BIN) + " --db " + dir_.File("db.sqlite") + " " +
+                              ToolCommand(KOVACRED_BIN) + " --db " + dir_.File("db.sqlite") + " " +
                               args + " 2>" + errFile;
         int status = RunCommand(command, out);
         if (err != nullptr) {

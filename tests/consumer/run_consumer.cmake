@@ -1,5 +1,6 @@
 # Installs the built library into a scratch prefix, builds the consumer against the CMake
 # package and the pkg-config file, and runs both.
+include(${CMAKE_CURRENT_LIST_DIR}/../support/subproject.cmake)
 set(prefix ${BINARY_DIR}/consumer-prefix)
 set(build ${BINARY_DIR}/consumer-build)
 file(REMOVE_RECURSE ${prefix} ${build})
@@ -16,20 +17,15 @@ foreach(f include/kovacredential/kovacredential.h lib/libkovacredential.so.6
   endif()
 endforeach()
 set(ENV{PKG_CONFIG_PATH} ${prefix}/lib/pkgconfig)
-execute_process(COMMAND ${CMAKE_COMMAND} -S ${SOURCE_DIR}/tests/consumer -B ${build}
-                -DCMAKE_PREFIX_PATH=${prefix} -DCMAKE_INSTALL_LIBDIR=lib RESULT_VARIABLE rc)
-if(rc)
-  message(FATAL_ERROR "consumer configure failed")
-endif()
+# A cross build searches only below its find roots, so the prefix becomes one.
+kova_configure_subproject(${SOURCE_DIR}/tests/consumer ${build} -DCMAKE_PREFIX_PATH=${prefix}
+                          -DCMAKE_FIND_ROOT_PATH=${prefix} -DCMAKE_INSTALL_LIBDIR=lib)
 execute_process(COMMAND ${CMAKE_COMMAND} --build ${build} RESULT_VARIABLE rc)
 if(rc)
   message(FATAL_ERROR "consumer build failed")
 endif()
+set(ENV{LD_LIBRARY_PATH} ${prefix}/lib)
 foreach(exe consumer consumer_pc)
   file(REMOVE ${build}/${exe}.sqlite)
-  set(ENV{LD_LIBRARY_PATH} ${prefix}/lib)
-  execute_process(COMMAND ${build}/${exe} ${build}/${exe}.sqlite RESULT_VARIABLE rc)
-  if(rc)
-    message(FATAL_ERROR "${exe} failed: ${rc}")
-  endif()
+  kova_run_target_program(${build}/${exe} ${build}/${exe}.sqlite)
 endforeach()
