@@ -16,6 +16,7 @@
 // In "directory", the texts "$http_port" and "$https_port" stand for the ports the WebAPI
 // listeners got, so a configuration can point the directory at them before they are known.
 // Each directory host prints "relay HOST:PORT".
+#include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
 #include <time.h>
@@ -36,6 +37,8 @@
 #include "simlib/webapi_sim.h"
 
 namespace {
+
+constexpr size_t kWorkerStackSize = 512 * 1024;
 
 struct Settings {
     std::string configPath;
@@ -201,6 +204,14 @@ int main(int argc, char **argv) {
         fprintf(stderr, "kovasim: relay: %s\n", error.c_str());
         return 2;
     }
+
+    // A worker needs far less than the default stack of 8 MiB; two pools of 256 workers with
+    // that stack would not even fit a 32-bit address space.
+    pthread_attr_t workerAttr;
+    pthread_attr_init(&workerAttr);
+    pthread_attr_setstacksize(&workerAttr, kWorkerStackSize);
+    pthread_setattr_default_np(&workerAttr);
+    pthread_attr_destroy(&workerAttr);
 
     // Worker threads inherit this mask, so the stop signals reach only WaitForStop.
     sigset_t stopSignals;
