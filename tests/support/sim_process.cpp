@@ -20,7 +20,7 @@ SimProcess::SimProcess(const TempDir &dir, const std::string &args, int relayHos
         execl("/bin/sh", "sh", "-c", command.c_str(), static_cast<char *>(nullptr));
         _exit(127);
     }
-    for (int i = 0; i < 300; ++i) {
+    for (int i = 0; i < 1200; ++i) {
         std::this_thread::sleep_for(std::chrono::milliseconds(50));
         std::ifstream in(portsFile_);
         std::string kind;
