@@ -4,8 +4,11 @@
 # The sysroot is KOVA_SYSROOT (a cache variable or the environment variable of that name),
 # by default ~/.cache/kovacredential/sysroot-<arch>. Its libraries are installed under
 # <sysroot>/usr with absolute paths, so that programs find them at run time through their
-# RUNPATH; the C library comes from the cross compiler's own folder /usr/<triple>, which qemu
-# is given with -L.
+# RUNPATH. qemu runs programs with the sysroot as their root (-L): scripts/cross-test links
+# <sysroot>/lib to the cross compiler's C library in /usr/<triple>/lib and gives the sysroot an
+# empty etc/ld.so.cache. Without that file the emulated loader reads the build machine's cache,
+# which names the build machine's own 32-bit x86 C library (/lib32); an i386 program then
+# loads that one, of another release than its loader, and hangs in its first pthread_create.
 set(CMAKE_SYSTEM_NAME Linux)
 set(CMAKE_SYSTEM_PROCESSOR ${KOVA_CROSS_PROCESSOR})
 set(CMAKE_C_COMPILER ${KOVA_CROSS_TRIPLE}-gcc)
@@ -35,4 +38,4 @@ set(CMAKE_INSTALL_RPATH_USE_LINK_PATH ON)
 # pkg-config sees the sysroot's .pc files only, never the build machine's.
 set(ENV{PKG_CONFIG_LIBDIR} ${KOVA_SYSROOT}/usr/lib/pkgconfig)
 
-set(CMAKE_CROSSCOMPILING_EMULATOR ${KOVA_CROSS_QEMU} -L /usr/${KOVA_CROSS_TRIPLE})
+set(CMAKE_CROSSCOMPILING_EMULATOR ${KOVA_CROSS_QEMU} -L ${KOVA_SYSROOT})
