@@ -8,6 +8,9 @@
 
 #include "kovacredential/kovaplatform.h"
 
+// C functions of the host's core library, as the error slot is.
+extern "C" {
+
 // Creates `path` as an empty regular file (mode 0600 before the caller's chmod) when it does
 // not exist, creating missing parent folders with mode 0700 first. An existing file is left
 // as it is. A symbolic link as the last component is never followed: the call fails with
@@ -24,5 +27,7 @@ int VLIBCBase64SzEncodeFull(const unsigned char *in, size_t inLen, char *out, si
 // *outLen holds the buffer's size on entry and the decoded size on return. Returns non-zero on
 // success, 0 on a character outside the alphabet, bad padding or a buffer too small.
 int VLIBCBase64Decode(const char *text, size_t textLen, unsigned char *out, size_t *outLen);
+
+}  // extern "C"
 
 #endif  // KOVA_PLATFORM_VLIBC_H

@@ -3,6 +3,8 @@
 #include <stdlib.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <limits>
 #include <stdexcept>
 
 #include "platform/json_text.h"
@@ -22,6 +24,11 @@ const Json::Value kNull;
 // CURLOPT_SSL_VERIFYHOST value that checks the certificate's name against the host. 2 means
 // that on every libcurl; 1 is refused by some versions and would fail every verified transfer.
 constexpr long kVerifyHostName = 2L;
+
+// The longest low-speed time libcurl can take: it counts the time in milliseconds held in a
+// long, so a longer one overflows (beyond 24 days where long has 32 bits) and ends a transfer
+// at its first stall.
+constexpr long kMaxLowSpeedTime = std::numeric_limits<long>::max() / 1000;
 
 // The text a JSON value is sent as: a string as it stands, anything else in compact JSON.
 std::string ValueText(const Json::Value &value) {
@@ -132,12 +139,12 @@ bool CredRequestPrivate::InitCurlHandler() {
     }
 
     const Json::Value &respTime = GetData("RespTime", "", kNull);
-    const long lowSpeedTime =
-        respTime.isInt64() ? static_cast<long>(respTime.asInt64()) : defaultTimeout;
+    const Json::Int64 lowSpeedTime = respTime.isInt64() ? respTime.asInt64() : defaultTimeout;
     if (!SetOption(CURLOPT_TCP_KEEPALIVE, 1L) || !SetOption(CURLOPT_TCP_KEEPIDLE, defaultTimeout) ||
         !SetOption(CURLOPT_TCP_KEEPINTVL, defaultTimeout) ||
         !SetOption(CURLOPT_LOW_SPEED_LIMIT, 1L) ||
-        !SetOption(CURLOPT_LOW_SPEED_TIME, lowSpeedTime) ||
+        !SetOption(CURLOPT_LOW_SPEED_TIME,
+                   static_cast<long>(std::min<Json::Int64>(lowSpeedTime, kMaxLowSpeedTime))) ||
         !SetOption(CURLOPT_CONNECTTIMEOUT, defaultTimeout) || !SetOption(CURLOPT_NOSIGNAL, 1L)) {
         return false;
     }

@@ -74,8 +74,8 @@ class KovacredTest : public ::testing::Test {
         const std::string err = db_.dir().File("stderr");
         std::ofstream(in, std::ios::binary) << input;
         Result result;
-        result.status = RunCommand(std::string(KOVACRED_BIN) + " --db " + db_.path() + " " + args +
-                                       " <" + in + " 2>" + err,
+        result.status = RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --db " + db_.path() +
+                                       " " + args + " <" + in + " 2>" + err,
                                    &result.out);
         result.err = ReadFile(err);
         return result;
@@ -104,10 +104,10 @@ TEST_F(KovacredTest, VersionNamesTheLibrariesTheToolsRunWith) {
                                   OpenSSL_version(OPENSSL_VERSION_STRING) + "\nSQLite " +
                                   sqlite3_libversion() + "\njsoncpp " JSONCPP_VERSION_STRING "\n";
     std::string out;
-    EXPECT_EQ(RunCommand(std::string(KOVACRED_BIN) + " --version", &out), 0);
+    EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --version", &out), 0);
     EXPECT_EQ(out, "kovacred " KOVA_VERSION "\nlibkovacredential " KOVA_VERSION "\n" + libraries);
     out.clear();
-    EXPECT_EQ(RunCommand(std::string(KOVASIM_BIN) + " --version", &out), 0);
+    EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVASIM_BIN) + " --version", &out), 0);
     EXPECT_EQ(out, "kovasim " KOVA_VERSION "\nlibkovacredential " KOVA_VERSION "\n" + libraries);
 }
 
@@ -206,8 +206,8 @@ TEST_F(KovacredTest, FailuresPrintOneLineWithTheCodesNameAndExitNonZero) {
 
     // A store code above 255 is named but exits 1; a file that is no database has no code.
     std::string out;
-    EXPECT_EQ(RunCommand(std::string(KOVACRED_BIN) + " --db " + db_.path() + "/sub/db.sqlite list" +
-                             " 2>&1",
+    EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --db " + db_.path() +
+                             "/sub/db.sqlite list" + " 2>&1",
                          &out),
               1);
     EXPECT_EQ(out,
@@ -371,8 +371,8 @@ TEST_F(KovacredTest, BatchShowsProgressOnATerminal) {
     const std::string out = db_.dir().File("stdout");
     std::string terminal;
     EXPECT_EQ(RunCommand("script -qec " +
-                             Quote("timeout 60 " KOVACRED_BIN " --db " + db_.path() + " batch " +
-                                   file + " >" + out) +
+                             Quote("timeout 60 " + kova_test::ToolCommand(KOVACRED_BIN) + " --db " +
+                                   db_.path() + " batch " + file + " >" + out) +
                              " /dev/null </dev/null",
                          &terminal),
               1);
@@ -485,7 +485,9 @@ TEST(KovacredManualTest, PageAndCompletionNameEveryCommandAndOption) {
     size_t checked = 0;
     for (size_t i = 0; i < commands.size(); ++i) {
         std::string help;
-        ASSERT_EQ(RunCommand(std::string(KOVACRED_BIN) + " " + commands[i] + " --help", &help), 0);
+        ASSERT_EQ(
+            RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " " + commands[i] + " --help", &help),
+            0);
         std::istringstream lines(help);
         bool inSubcommands = false;
         for (std::string line; std::getline(lines, line);) {

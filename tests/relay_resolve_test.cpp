@@ -22,10 +22,11 @@ using kova_test::ParseJson;
 int Resolve(const std::string &global, const std::string &site, const std::string &arguments,
             std::string *out, bool withErrors = false) {
     out->clear();
-    return kova_test::RunCommand(
-        "kovacredential_farlink_global=" + global + " kovacredential_farlink_server=" + site +
-            " '" KOVACRED_BIN "' resolve " + arguments + (withErrors ? " 2>&1" : " 2>/dev/null"),
-        out);
+    return kova_test::RunCommand("kovacredential_farlink_global=" + global +
+                                     " kovacredential_farlink_server=" + site + " " +
+                                     kova_test::ToolCommand(KOVACRED_BIN) + " resolve " +
+                                     arguments + (withErrors ? " 2>&1" : " 2>/dev/null"),
+                                 out);
 }
 
 class RelayResolveTest : public kova_test::RelayDirectoryTest {
@@ -118,8 +119,8 @@ TEST(KovasimRelayTest, RejectsARelayRoleWithoutHosts) {
     kova_test::TempDir dir;
     std::ofstream(dir.File("bad.json")) << "{\"relay\": {\"hosts\": []}}";
     std::string out;
-    EXPECT_EQ(kova_test::RunCommand(std::string(KOVASIM_BIN) + " --config " + dir.File("bad.json") +
-                                        " --duration 1 2>&1",
+    EXPECT_EQ(kova_test::RunCommand(kova_test::ToolCommand(KOVASIM_BIN) + " --config " +
+                                        dir.File("bad.json") + " --duration 1 2>&1",
                                     &out),
               2);
     EXPECT_NE(out.find("relay: \"relay\" needs a non-empty array \"hosts\""), std::string::npos)

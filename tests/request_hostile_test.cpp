@@ -238,14 +238,17 @@ TEST(HostilePeerTest, KovasimServesEveryFaultByName) {
         const std::string name = kovasim::FaultName(fault);
         SCOPED_TRACE(name);
         std::string out;
-        EXPECT_EQ(kova_test::RunCommand(
-                      std::string(KOVASIM_BIN) + " --fault " + name + " --duration 0.2 2>&1", &out),
+        EXPECT_EQ(kova_test::RunCommand(kova_test::ToolCommand(KOVASIM_BIN) + " --fault " + name +
+                                            " --duration 0.2 2>&1",
+                                        &out),
                   0);
         const std::string scheme = fault == Fault::kPlainOnTls ? "https" : "http";
         EXPECT_EQ(out.rfind(scheme + " 127.0.0.1:", 0), 0u) << out;
     }
     std::string out;
-    EXPECT_NE(kova_test::RunCommand(std::string(KOVASIM_BIN) + " --fault nonsense 2>&1", &out), 0);
+    EXPECT_NE(
+        kova_test::RunCommand(kova_test::ToolCommand(KOVASIM_BIN) + " --fault nonsense 2>&1", &out),
+        0);
 }
 
 }  // namespace

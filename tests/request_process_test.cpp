@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <limits>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -393,11 +394,15 @@ TEST_F(ProcessTest, RequestStreamIsSentWholeAfterResetsAndRedirects) {
 // is cut off the response stream, which keeps what it held before Process. The first two
 // connections stall; the third sends the whole body.
 TEST_F(ProcessTest, StallTimesOutAndCutsTheResponseStreamBackBeforeTheNextAttempt) {
-    // libcurl averages the speed over several seconds, so one byte is all the stall sends.
+    // libcurl averages the speed over several seconds, so one byte is all the stall sends. The
+    // first two connections stall, the third sends the whole body, later ones send the rest of
+    // the body after a stall of 5 s.
     kovasim::RawServer raw([](kovasim::RawServer::Connection &c) {
-        if (c.Index() < 2) {
-            c.Send("HTTP/1.1 200 OK\r\nContent-Length: 8\r\n\r\ns");
-            c.WaitForClose(5000);
+        if (c.Index() != 2) {
+            c.Send("HTTP/1.1 200 OK\r\nContent-Length: 8\r\n\r\nc");
+            if (!c.WaitForClose(5000) && c.Index() > 2) {
+                c.Send("omplete");
+            }
         } else {
             c.Send("HTTP/1.1 200 OK\r\nContent-Length: 8\r\n\r\ncomplete");
         }
@@ -422,6 +427,17 @@ TEST_F(ProcessTest, StallTimesOutAndCutsTheResponseStreamBackBeforeTheNextAttemp
     EXPECT_EQ(kova_test::SleepCalls(), std::vector<unsigned>{1u});
     EXPECT_EQ(ReadAll(out.get()), "stale content from beforecomplete");
     EXPECT_EQ(req.GetResponse(), "");
+
+    // libcurl counts the stall in milliseconds held in a long: time-outs beyond that range (30
+    // days where long has 32 bits, the longest long anywhere) must still let a stall pass.
+    for (long seconds : {30L * 24 * 3600, std::numeric_limits<long>::max()}) {
+        SCOPED_TRACE(seconds);
+        KOVA::CredRequest slow;
+        ASSERT_TRUE(slow.SetURL(raw.BaseUrl() + "/"));
+        ASSERT_TRUE(slow.SetResponseTimeout(seconds));
+        EXPECT_TRUE(slow.Process(true, 0)) << slow.GetError();
+        EXPECT_EQ(slow.GetResponse(), "complete");
+    }
     raw.Stop();
 }
 

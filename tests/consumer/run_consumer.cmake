@@ -2,6 +2,7 @@
 # pkg-config file, and runs both. Without PREFIX the build tree is first installed into a
 # scratch prefix; with PREFIX (and LIBDIR, relative to it) the files already there are used,
 # such as an unpacked -dev package. WORK names the scratch folder (default: in BINARY_DIR).
+include(${CMAKE_CURRENT_LIST_DIR}/../support/subproject.cmake)
 if(NOT WORK)
   set(WORK ${BINARY_DIR})
 endif()
@@ -29,20 +30,15 @@ foreach(f include/kovacredential/kovacredential.h ${libdir}/libkovacredential.so
   endif()
 endforeach()
 set(ENV{PKG_CONFIG_PATH} ${prefix}/${libdir}/pkgconfig)
-execute_process(COMMAND ${CMAKE_COMMAND} -S ${SOURCE_DIR}/tests/consumer -B ${build}
-                -DCMAKE_PREFIX_PATH=${prefix} -DCMAKE_INSTALL_LIBDIR=${libdir} RESULT_VARIABLE rc)
-if(rc)
-  message(FATAL_ERROR "consumer configure failed")
-endif()
+# A cross build searches only below its find roots, so the prefix becomes one.
+kova_configure_subproject(${SOURCE_DIR}/tests/consumer ${build} -DCMAKE_PREFIX_PATH=${prefix}
+                          -DCMAKE_FIND_ROOT_PATH=${prefix} -DCMAKE_INSTALL_LIBDIR=${libdir})
 execute_process(COMMAND ${CMAKE_COMMAND} --build ${build} RESULT_VARIABLE rc)
 if(rc)
   message(FATAL_ERROR "consumer build failed")
 endif()
+set(ENV{LD_LIBRARY_PATH} ${prefix}/${libdir})
 foreach(exe consumer consumer_pc)
   file(REMOVE ${build}/${exe}.sqlite)
-  set(ENV{LD_LIBRARY_PATH} ${prefix}/${libdir})
-  execute_process(COMMAND ${build}/${exe} ${build}/${exe}.sqlite RESULT_VARIABLE rc)
-  if(rc)
-    message(FATAL_ERROR "${exe} failed: ${rc}")
-  endif()
+  kova_run_target_program(${build}/${exe} ${build}/${exe}.sqlite)
 endforeach()

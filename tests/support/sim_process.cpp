@@ -21,12 +21,12 @@ SimProcess::SimProcess(const TempDir &dir, const std::string &args, int relayHos
     : portsFile_(dir.File("kovasim.ports")), errorFile_(dir.File("kovasim.err")) {
     pid_ = fork();
     if (pid_ == 0) {
-        std::string command = std::string("exec ") + KOVASIM_BIN + " " + args + " > " + portsFile_ +
+        std::string command = "exec " + ToolCommand(KOVASIM_BIN) + " " + args + " > " + portsFile_ +
                               " 2> " + errorFile_;
         execl("/bin/sh", "sh", "-c", command.c_str(), static_cast<char *>(nullptr));
         _exit(127);
     }
-    for (int i = 0; i < 300 && pid_ > 0; ++i) {
+    for (int i = 0; i < 1200 && pid_ > 0; ++i) {
         std::this_thread::sleep_for(std::chrono::milliseconds(50));
         std::istringstream lines(ReadFile(portsFile_));
         int http = 0;

@@ -17,8 +17,9 @@ std::string ReadFile(const std::string &path);
 
 class SimProcess {
   public:
-    // Runs `kovasim ARGS` and waits (at most 15 s) until it has printed its listeners; the
-    // relay hosts are awaited too when `relayHosts` is above 0.
+    // Runs `kovasim ARGS` and waits (at most 60 s, for an emulated kovasim making its key)
+    // until it has printed its listeners; the relay hosts are awaited too when `relayHosts` is
+    // above 0.
     SimProcess(const TempDir &dir, const std::string &args = "", int relayHosts = 0);
     ~SimProcess();
     SimProcess(const SimProcess &) = delete;

@@ -54,4 +54,11 @@ int RunCommand(const std::string &command, std::string *out) {
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
+std::string ToolCommand(const std::string &path) {
+    const char *launcher = getenv("KOVA_TEST_LAUNCHER");
+    std::string command =
+        launcher != nullptr && *launcher != '\0' ? launcher + std::string(" ") : "";
+    return command + "'" + path + "'";
+}
+
 }  // namespace kova_test

@@ -52,6 +52,11 @@ using File = std::unique_ptr<FILE, FileCloser>;
 // Runs a shell command, returning its exit status and (optionally) its standard output.
 int RunCommand(const std::string &command, std::string *out = nullptr);
 
+// The shell words that start the program at `path`: its quoted path, behind the launcher named
+// by the environment variable KOVA_TEST_LAUNCHER when that is set. A cross build sets it for
+// ctest to the emulator that runs its programs ("qemu-ppc-static -L SYSROOT").
+std::string ToolCommand(const std::string &path);
+
 }  // namespace kova_test
 
 #endif  // KOVA_TESTS_SUPPORT_TEMP_DIR_H

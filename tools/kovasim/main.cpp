@@ -22,6 +22,7 @@
 // plain-on-tls, tls-on-plain, huge-body. It prints "https 127.0.0.1:PORT" for plain-on-tls
 // (clients are to use TLS there; --https-port picks the port) and "http 127.0.0.1:PORT" for
 // the others (--http-port).
+#include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
 #include <time.h>
@@ -44,6 +45,8 @@
 #include "simlib/webapi_sim.h"
 
 namespace {
+
+constexpr size_t kWorkerStackSize = 512 * 1024;
 
 struct Settings {
     std::string configPath;
@@ -219,6 +222,14 @@ int main(int argc, char **argv) {
         fprintf(stderr, "kovasim: relay: %s\n", error.c_str());
         return 2;
     }
+
+    // A worker needs far less than the default stack of 8 MiB; two pools of 256 workers with
+    // that stack would not even fit a 32-bit address space.
+    pthread_attr_t workerAttr;
+    pthread_attr_init(&workerAttr);
+    pthread_attr_setstacksize(&workerAttr, kWorkerStackSize);
+    pthread_setattr_default_np(&workerAttr);
+    pthread_attr_destroy(&workerAttr);
 
     // Worker threads inherit this mask, so the stop signals reach only WaitForStop.
     sigset_t stopSignals;

@@ -11,6 +11,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <limits>
 
 #include <openssl/bn.h>
 #include <openssl/evp.h>
@@ -111,7 +112,8 @@ LoopbackServer::LoopbackServer(const Options &options) : options_(options) {
     // Without TCP_NODELAY a TLS response waits on delayed ACKs (about 40 ms per request).
     server_->set_tcp_nodelay(true);
     server_->set_keep_alive_max_count(options_.keepAlive ? 1000 : 1);
-    server_->set_payload_max_length(1ULL << 32);
+    // No limit on request bodies, whatever the width of size_t.
+    server_->set_payload_max_length(std::numeric_limits<size_t>::max());
     // The body is read after pre-routing, so requests are recorded by the route wrappers and,
     // for unmatched requests, by the error handler.
     server_->set_pre_routing_handler([](const httplib::Request &, httplib::Response &) {
