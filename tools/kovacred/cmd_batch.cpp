@@ -70,19 +70,19 @@ bool ReadCalls(const std::string &path, Json::Value &calls, std::string &problem
 }
 
 // Adds one call to the manager; on failure leaves the reason and the error code in `call`.
-void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &spec, Call &call) {
+void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call) {
     call.code = KOVA::CRED_REQ_ERR_BAD_PARAM;
-    if (!spec.isObject()) {
+    if (!item.isObject()) {
         call.problem = "not an object";
         return;
     }
     mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
-    if (spec.isMember("url")) {
-        if (!spec["url"].isString() || spec["url"].asString().empty()) {
+    if (item.isMember("url")) {
+        if (!item["url"].isString() || item["url"].asString().empty()) {
             call.problem = "\"url\" is not a non-empty string";
             return;
         }
-        call.target = spec["url"].asString();
+        call.target = item["url"].asString();
         std::unique_ptr<KOVA::CredRequest> request(new KOVA::CredRequest());
         if (!request->SetURL(call.target)) {
             call.problem = "bad url";
@@ -99,22 +99,22 @@ void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &spec, Call &call) {
         }
         return;
     }
-    if (!spec["cred"].isIntegral() || !spec["api"].isString() || !spec["method"].isString() ||
-        !spec["version"].isIntegral()) {
+    if (!item["cred"].isIntegral() || !item["api"].isString() || !item["method"].isString() ||
+        !item["version"].isIntegral()) {
         call.problem = "needs \"url\", or \"cred\", \"api\", \"version\" and \"method\"";
         return;
     }
-    const Json::Value params = spec.get("params", Json::Value());
+    const Json::Value params = item.get("params", Json::Value());
     if (!params.isNull() && !params.isObject()) {
         call.problem = "\"params\" is not an object";
         return;
     }
-    call.credId = static_cast<long>(spec["cred"].asInt64());
-    call.target = "cred " + std::to_string(call.credId) + " " + spec["api"].asString() + " " +
-                  std::to_string(spec["version"].asInt()) + " " + spec["method"].asString();
+    call.credId = static_cast<long>(item["cred"].asInt64());
+    call.target = "cred " + std::to_string(call.credId) + " " + item["api"].asString() + " " +
+                  std::to_string(item["version"].asInt()) + " " + item["method"].asString();
     KOVA::CredRequestUtil::m_errCode = 0;
-    call.index = mgr.AddWebAPIRequest(call.credId, spec["api"].asString(), spec["version"].asInt(),
-                                      spec["method"].asString(), params);
+    call.index = mgr.AddWebAPIRequest(call.credId, item["api"].asString(), item["version"].asInt(),
+                                      item["method"].asString(), params);
     if (call.index >= 0) {
         call.code = 0;
         return;
