@@ -28,11 +28,32 @@ if(KOVA_BUILD_TOOLS)
   list(APPEND CPACK_COMPONENTS_ALL tools)
 endif()
 
+# The Debian architecture the packages are for: the build machine's, or a cross build's
+# (the toolchain files name it as Debian does).
+if(CMAKE_CROSSCOMPILING)
+  set(KOVA_DEB_ARCHITECTURE ${KOVA_CROSS_ARCH})
+else()
+  execute_process(COMMAND dpkg --print-architecture OUTPUT_VARIABLE KOVA_DEB_ARCHITECTURE
+                  OUTPUT_STRIP_TRAILING_WHITESPACE)
+endif()
+set(CPACK_DEBIAN_PACKAGE_ARCHITECTURE ${KOVA_DEB_ARCHITECTURE})
+
 # Run-time dependencies come from dpkg-shlibdeps; it finds libkovacredential.so.6, which the
 # tools need, in the build tree, and the packages' own dependency on it comes from the
 # component dependencies below, pinned to this version.
-set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
-set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS_PRIVATE_DIRS ${PROJECT_BINARY_DIR})
+if(NOT CMAKE_CROSSCOMPILING)
+  set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
+  set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS_PRIVATE_DIRS ${PROJECT_BINARY_DIR})
+else()
+  # dpkg-shlibdeps looks the libraries up in the installed packages of the target
+  # architecture, and a cross build has none: these are the dependencies it computes for the
+  # native Debian 12 build. Package names and symbol versions are the same on every Debian
+  # architecture; the tools use cpp-httplib only through its header here.
+  set(KOVA_DEB_LIBRARY_DEPENDS "libc6 (>= 2.34), libcurl4 (>= 7.66.0), libgcc-s1 (>= 3.0), \
+libjsoncpp25 (>= 1.9.5), libsqlite3-0 (>= 3.6.5), libssl3 (>= 3.0.0), libstdc++6 (>= 12)")
+  set(CPACK_DEBIAN_RUNTIME_PACKAGE_DEPENDS ${KOVA_DEB_LIBRARY_DEPENDS})
+  set(CPACK_DEBIAN_TOOLS_PACKAGE_DEPENDS "${KOVA_DEB_LIBRARY_DEPENDS}, zlib1g (>= 1:1.1.4)")
+endif()
 set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS ON)
 set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS_POLICY ">=")
 set(CPACK_DEBIAN_ENABLE_COMPONENT_DEPENDS ON)

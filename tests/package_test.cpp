@@ -39,7 +39,7 @@ class PackageTest : public ::testing::Test {
     void SetUp() override { ASSERT_TRUE(built_) << ReadFile(dir_->File("cpack.log")); }
 
     static std::string Deb(const std::string &package) {
-        return dir_->File(package + "_" + kVersion + "_amd64.deb");
+        return dir_->File(package + "_" + kVersion + "_" KOVA_DEB_ARCHITECTURE ".deb");
     }
     static std::string Root() { return dir_->File("root"); }
     static std::string Output(const std::string &command) {
@@ -148,7 +148,7 @@ TEST_F(PackageTest, LintianReportsNoError) {
 // and manual pages work.
 TEST_F(PackageTest, UnpackedPackagesWork) {
     std::string log;
-    EXPECT_EQ(RunCommand("cmake -DSOURCE_DIR=" KOVA_SOURCE_DIR " -DPREFIX=" + Root() +
+    EXPECT_EQ(RunCommand("cmake " KOVA_SUBPROJECT_DEFINES " -DPREFIX=" + Root() +
                              "/usr -DLIBDIR=" + KOVA_INSTALL_LIBDIR " -DWORK=" + dir_->path() +
                              " -P " KOVA_SOURCE_DIR "/tests/consumer/run_consumer.cmake 2>&1",
                          &log),
@@ -157,7 +157,8 @@ TEST_F(PackageTest, UnpackedPackagesWork) {
     const std::string env = "LD_LIBRARY_PATH=" + Root() + "/" + kLibDir + " ";
     for (const std::string tool : {"kovacred", "kovasim"}) {
         std::string out;
-        EXPECT_EQ(RunCommand(env + Root() + "/usr/bin/" + tool + " --version", &out), 0);
+        EXPECT_EQ(RunCommand(env + ToolCommand(Root() + "/usr/bin/" + tool) + " --version", &out),
+                  0);
         EXPECT_EQ(out.rfind(tool + " " + kVersion + "\nlibkovacredential " + kVersion + "\n", 0),
                   0u)
             << out;

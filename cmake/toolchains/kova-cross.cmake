@@ -33,8 +33,8 @@ set(CMAKE_FIND_ROOT_PATH_MODE_PACKAGE ONLY)
 # Header-only dependencies are found the way a native build finds /usr/include.
 set(CMAKE_C_STANDARD_INCLUDE_DIRECTORIES ${KOVA_SYSROOT}/usr/include)
 set(CMAKE_CXX_STANDARD_INCLUDE_DIRECTORIES ${KOVA_SYSROOT}/usr/include)
-# Installed libraries and programs keep their RUNPATH to the sysroot, as built ones have it.
-set(CMAKE_INSTALL_RPATH_USE_LINK_PATH ON)
+# Installed libraries and programs get no RUNPATH: on the target the libraries are in the
+# system's folders, and qemu's -L finds them in the sysroot's.
 # pkg-config sees the sysroot's .pc files only, never the build machine's.
 set(ENV{PKG_CONFIG_LIBDIR} ${KOVA_SYSROOT}/usr/lib/pkgconfig)
 

@@ -108,7 +108,11 @@ LoopbackServer::LoopbackServer(const Options &options) : options_(options) {
         return;
     }
     int threads = options_.threads > 0 ? options_.threads : 1;
-    server_->new_task_queue = [threads] { return new httplib::ThreadPool(threads); };
+    server_->new_task_queue = [this, threads] {
+        auto *pool = new httplib::ThreadPool(threads);
+        workersStarted_ = true;
+        return pool;
+    };
     // Without TCP_NODELAY a TLS response waits on delayed ACKs (about 40 ms per request).
     server_->set_tcp_nodelay(true);
     server_->set_keep_alive_max_count(options_.keepAlive ? 1000 : 1);
@@ -215,12 +219,15 @@ bool LoopbackServer::Start() {
     }
     WidenBacklog(port_);
     running_ = true;
+    workersStarted_ = false;
     // The socket is bound and listening already, so clients may connect at once; the accept
     // loop picks their connections up from the backlog.
     thread_ = std::thread([this] { server_->listen_after_bind(); });
     // A stop issued before the accept loop runs would be lost (and Stop would wait forever), so
-    // Start returns only once the loop is up.
-    for (int i = 0; i < 500 && !server_->is_running(); ++i) {
+    // Start returns only once the loop is up, and only once every worker thread exists: a test
+    // that forks while threads are still being created can leave its child without a working
+    // pthread_create under qemu-user.
+    for (int i = 0; i < 6000 && !(server_->is_running() && workersStarted_); ++i) {
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
     return true;

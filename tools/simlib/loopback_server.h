@@ -98,6 +98,7 @@ class LoopbackServer {
     std::unique_ptr<httplib::Server> server_;
     std::thread thread_;
     std::atomic<bool> running_{false};
+    std::atomic<bool> workersStarted_{false};
     int port_ = 0;
     std::string error_;
     std::string certPem_;
