@@ -275,8 +275,8 @@ TEST_F(ManagerTest, DescriptorsBeyondTheSelectLimit) {
 void IgnoreSignal(int) {}
 
 // A signal that interrupts the wait does not end the run. A process of its own sends them, so
-// that the runner stays the only thread (qemu-user on i386 garbles a thread's state when
-// another thread's signals land on it).
+// that the runner stays the only thread (under qemu-user on i386 a thread that signalled
+// another can no longer be joined).
 TEST_F(ManagerTest, SignalsDuringTheWaitAreRidden) {
     const std::string slow = Url("/slow?n=1");
     const auto body = [&] {
