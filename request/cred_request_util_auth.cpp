@@ -62,7 +62,7 @@ bool CredRequestUtil::SetWebAPIURL(const KOVA_CRED *cred, const std::string &api
         }
         const std::string path = GetWebAPIPath(cred, api);
         if (path.empty()) {
-            request->SetError(static_cast<CRED_REQ_ERR>(m_errCode));
+            request->SetError(static_cast<CRED_REQ_ERR>(UtilError()));
             kova::Log("%s:%d GetWebAPIPath fail![%s]", kUnit, kLineUrlNoPath, api.c_str());
             return false;
         }

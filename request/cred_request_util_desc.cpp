@@ -134,7 +134,7 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
             kova::Log("%s:%d Cred Error:[%s][%d]", kUnit, kLineDescCredError,
                       kova::UrlForLog(request.GetURL()).c_str(),
                       static_cast<int>(request.GetError()));
-            m_errCode = CRED_REQ_ERR_QUERY_FAIL;
+            SetUtilError(CRED_REQ_ERR_QUERY_FAIL);
             return false;
         }
         return StoreWebAPIDescAnswer(key, request.GetResponse());
@@ -193,7 +193,7 @@ std::string CredRequestUtil::GetWebAPIPath(const KOVA_CRED *cred, const std::str
         Json::Value desc = LockedApiEntry(key, api);
         if (desc.empty()) {
             kova::Log("%s:%d No such api: %s", kUnit, kLinePathNoApi, api.c_str());
-            m_errCode = CRED_REQ_ERR_NO_SUCH_API;
+            SetUtilError(CRED_REQ_ERR_NO_SUCH_API);
             return "";
         }
         return TextMember(desc, "path");

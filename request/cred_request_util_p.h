@@ -14,6 +14,11 @@
 
 namespace KOVA {
 
+// The process-wide last error of the utilities (CredRequestUtil::m_errCode), stored and loaded
+// atomically so that threads of the library never race on the plain exported int.
+void SetUtilError(int code);
+int UtilError();
+
 // The first of -1, -2, -3, ... that has no entry in the description cache, reserved there with
 // an empty entry in the same locked step, so that no other thread hands it out too. The entry
 // is filled by the first look-up under that id and freed by RemoveWebAPIDesc.

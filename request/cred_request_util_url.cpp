@@ -4,6 +4,7 @@
 #include "kovacredential/cred_request_util.h"
 #include "kovacredential/kovaplatform.h"
 #include "platform/kova_log.h"
+#include "request/cred_request_util_p.h"
 
 namespace KOVA {
 
@@ -109,10 +110,10 @@ bool CredRequestUtil::TestURL(const std::string &url) {
         }
         kova::Log("%s:%d Cred Error:[%s][%d]", kUnit, kLineTestFailed,
                   kova::UrlForLog(request.GetURL()).c_str(), static_cast<int>(request.GetError()));
-        m_errCode = CRED_REQ_ERR_QUERY_FAIL;
+        SetUtilError(CRED_REQ_ERR_QUERY_FAIL);
         return false;
     } catch (...) {
-        m_errCode = CRED_REQ_ERR_QUERY_FAIL;
+        SetUtilError(CRED_REQ_ERR_QUERY_FAIL);
         return false;
     }
 }

@@ -131,6 +131,27 @@ class KOVA_EXPORT CredRequest {
     void SetFollowLocation(bool follow);
     // Asks for any content encoding libcurl supports.
     void SetEncoding(bool encoding);
+    // A deadline for Process as a whole, in milliseconds: every attempt, the pauses between
+    // retries and name resolution included. A transfer it cuts short ends with
+    // CRED_REQ_ERR_TIMEOUT. 0 (the default) sets none; negative values set
+    // CRED_REQ_ERR_BAD_PARAM.
+    bool SetTotalTimeout(long milliseconds);
+    long GetTotalTimeout() const;
+    // The most a response held in memory (GetResponse) may grow to, in bytes: 64 MiB unless
+    // set; 0 lifts the cap. A larger answer ends the transfer with CRED_REQ_ERR_CURL_OTHER.
+    // Response streams and writers are never capped.
+    void SetMaxResponseSize(size_t bytes);
+    size_t GetMaxResponseSize() const;
+    // A file of trusted CA certificates (PEM) used instead of the system's bundle when
+    // certificates are checked (SetHTTPSVerify(true) or SetSSLVerify). False with
+    // CRED_REQ_ERR_BAD_PARAM for an empty path.
+    bool SetCAFile(const std::string &path);
+    // Accepts the server only when its public key matches `pin`, in libcurl's pinned-key form
+    // ("sha256//<Base64 of the SHA-256 of the DER public key>", several joined with ';'),
+    // whether or not certificates are checked. A mismatch fails the transfer
+    // (CRED_REQ_ERR_CURL_OTHER, GetCurlCode() 90). False with CRED_REQ_ERR_BAD_PARAM for an
+    // empty pin.
+    bool SetPinnedPublicKey(const std::string &pin);
 
     // ---- Results.
     KOVA::_tag_CRED_REQ_ERR GetError();
@@ -139,6 +160,17 @@ class KOVA_EXPORT CredRequest {
     CURL *GetCurlHandler();
     std::string GetResponse();
     const Json::Value &GetResponseHeader();
+    // The libcurl result of this request's last transfer attempt (CURLE_OK before any) and
+    // libcurl's own text for it (the detailed message when libcurl gave one, else
+    // curl_easy_strerror), so that a caller can name the cause behind a code such as
+    // CRED_REQ_ERR_CURL_OTHER. Per request, like GetError.
+    int GetCurlCode();
+    std::string GetCurlErrorText();
+    // Timing and connection facts of the last transfer, in seconds from its start:
+    // {"namelookup", "connect", "tls", "firstByte", "total" (numbers), "reused" (true when it
+    // rode a connection made earlier), "httpVersion" ("1.1", "2", ...), "remoteIp",
+    // "remotePort", "connects" (new connections it opened)}. Null before any transfer.
+    Json::Value GetTransferInfo();
 
     // ---- Execution.
     // Sets the transfer up and, when `perform`, runs it with up to `retries` further attempts.

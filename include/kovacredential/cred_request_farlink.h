@@ -45,6 +45,11 @@ class KOVA_EXPORT CredRequestFarlink {
     void SetServerName(const std::string &name);
     // Response time-out of each directory request; 0 or less leaves the request's default.
     void SetTimeout(long seconds);
+    // A deadline for each whole operation of this client (a command, GetAvailableServerInfo,
+    // GetAvailableConnInfo with all its probes and the tunnel), in milliseconds: what is left
+    // of it bounds every request the operation makes, and an operation that runs out fails
+    // with CRED_REQ_ERR_TIMEOUT. 0 (the default) sets none.
+    void SetTotalTimeout(long milliseconds);
     // The server to look up; its MD5 (what the server's probe answer must carry) is kept with
     // it. An empty id sets 401.
     void SetServerId(const std::string &serverId);
@@ -92,6 +97,12 @@ class KOVA_EXPORT CredRequestFarlink {
                             Json::Value *errors);
     static bool GetConnInfoPortal(const std::string &serverId, Json::Value &candidate,
                                   Json::Value *errors);
+    // The same look-ups ending within `timeoutMilliseconds` (0: no deadline); one that runs out
+    // fails with CRED_REQ_ERR_TIMEOUT in `errors`.
+    static bool GetConnInfo(const std::string &serverId, Json::Value &candidate,
+                            Json::Value *errors, long timeoutMilliseconds);
+    static bool GetConnInfoPortal(const std::string &serverId, Json::Value &candidate,
+                                  Json::Value *errors, long timeoutMilliseconds);
 
   private:
     friend class CredRequestFarlinkPrivate;

@@ -65,6 +65,15 @@ class KOVA_EXPORT CredRequestMgr {
     // Requests whose set-up fails are left out and keep their own error. Each request's outcome
     // is read from the request (GetResponse, GetError of the request).
     bool Run();
+    // Run with a deadline for the whole run, in milliseconds (0: none, as Run()). When it
+    // passes, every unfinished request is stopped with CRED_REQ_ERR_TIMEOUT, the manager's
+    // error becomes CRED_REQ_ERR_TIMEOUT and the result is false.
+    bool Run(long timeoutMilliseconds);
+    // Makes a Run of this manager in progress return false at its next wake-up with
+    // CRED_REQ_ERR_SELECT, its unfinished requests stopped. Async-signal-safe: may be called
+    // from a signal handler or from another thread while Run waits. Does nothing when no Run
+    // of this manager is in progress.
+    void Cancel();
     // A copy of the response body of the request at `index`; "" and CRED_REQ_ERR_BAD_PARAM for
     // a bad index.
     std::string GetResponse(int index);

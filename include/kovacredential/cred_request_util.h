@@ -5,7 +5,7 @@
 // Concurrency: every operation may run on several threads at once. The description cache
 // (m_jsData) is process-wide; the library's own reads and writes of it take a lock, while a
 // caller that touches m_jsData directly must serialise that access itself. The last error
-// (m_errCode) is kept per thread, like errno.
+// (m_errCode) is process-wide.
 #ifndef KOVACREDENTIAL_CRED_REQUEST_UTIL_H
 #define KOVACREDENTIAL_CRED_REQUEST_UTIL_H
 
@@ -23,9 +23,11 @@ class KOVA_EXPORT CredRequestUtil {
   public:
     // {"webapiDesc": {"<credential id>": <the server's "data" answer to KOVA.API.Info>}}
     static Json::Value m_jsData;
-    // Last error of these operations on the calling thread (CRED_REQ_ERR_QUERY_FAIL,
-    // CRED_REQ_ERR_NO_SUCH_API); never reset by them.
-    static thread_local int m_errCode;
+    // Last error of these operations in the process (CRED_REQ_ERR_QUERY_FAIL,
+    // CRED_REQ_ERR_NO_SUCH_API); never reset by them. A plain process-wide int: the library
+    // stores and loads it atomically, so threads do not race on it, but with several threads
+    // the value is the last one any of them left.
+    static int m_errCode;
 
     // ---- URLs.
     // Splits url into scheme ("http"/"https"), host (IPv6 brackets kept) and port (defaults
