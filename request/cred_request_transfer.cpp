@@ -10,6 +10,7 @@
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
 #include "request/cred_request_p.h"
+#include "request/cred_request_pool.h"
 
 namespace KOVA {
 
@@ -73,12 +74,20 @@ bool CredRequestPrivate::InitCurlHandler() {
     if (curl != nullptr) {
         return true;
     }
-    curl = curl_easy_init();
+    // The handle comes from the pool of the server and TLS settings; a request with a TLS
+    // context callback gets one of its own.
+    const Json::Value &urlValue = GetData("URL", "", kNull);
+    CredRequestPool::Tls tls;
+    const Json::Value &verifySetting = GetData("VerifySSL", "", kNull);
+    tls.verify = verifySetting.isBool() && verifySetting.asBool();
+    poolKey = urlValue.isString() && sslCtxFn == nullptr
+                  ? CredRequestPool::KeyOf(urlValue.asString(), tls)
+                  : std::string();
+    curl = CredRequestPool::Acquire(poolKey, &poolGeneration);
     if (curl == nullptr) {
         error = CRED_REQ_ERR_CURL_INTERNAL;
         return false;
     }
-    const Json::Value &urlValue = GetData("URL", "", kNull);
     if (!urlValue.isString()) {
         error = CRED_REQ_ERR_NO_URL;
         return false;
@@ -118,13 +127,17 @@ bool CredRequestPrivate::InitCurlHandler() {
         return false;
     }
 
-    // Certificate and host checks are off unless asked for; a TLS context callback forces them.
+    // Certificate and host checks are off unless asked for; a TLS context callback forces them
+    // and its own handshake on every transfer (a fresh connection, closed after it, no TLS
+    // session resumed), so that the callback sees each one.
     const Json::Value &verify = GetData("VerifySSL", "", kNull);
     if (sslCtxFn != nullptr) {
         if (!SetOption(CURLOPT_SSL_VERIFYPEER, 1L) ||
             !SetOption(CURLOPT_SSL_VERIFYHOST, kVerifyHostName) ||
             !SetOption(CURLOPT_SSL_CTX_FUNCTION, &SslCtxAdapter) ||
-            !SetOption(CURLOPT_SSL_CTX_DATA, static_cast<void *>(this))) {
+            !SetOption(CURLOPT_SSL_CTX_DATA, static_cast<void *>(this)) ||
+            !SetOption(CURLOPT_FRESH_CONNECT, 1L) || !SetOption(CURLOPT_FORBID_REUSE, 1L) ||
+            !SetOption(CURLOPT_SSL_SESSIONID_CACHE, 0L)) {
             return false;
         }
     } else if (verify.isBool() && verify.asBool()) {
