@@ -74,22 +74,27 @@ bool CredRequestPrivate::InitCurlHandler() {
     if (curl != nullptr) {
         return true;
     }
-    // The handle comes from the pool of the server and TLS settings; a request with a TLS
-    // context callback gets one of its own.
     const Json::Value &urlValue = GetData("URL", "", kNull);
-    CredRequestPool::Tls tls;
-    const Json::Value &verifySetting = GetData("VerifySSL", "", kNull);
-    tls.verify = verifySetting.isBool() && verifySetting.asBool();
-    poolKey = urlValue.isString() && sslCtxFn == nullptr
-                  ? CredRequestPool::KeyOf(urlValue.asString(), tls)
-                  : std::string();
-    curl = CredRequestPool::Acquire(poolKey, &poolGeneration);
-    if (curl == nullptr) {
-        error = CRED_REQ_ERR_CURL_INTERNAL;
-        return false;
-    }
+    // The handle comes from the pool of the server and TLS settings; a request with a TLS
+    // context callback, or without a URL, gets one of its own.
+    auto takeHandle = [&] {
+        CredRequestPool::Tls tls;
+        const Json::Value &verifySetting = GetData("VerifySSL", "", kNull);
+        tls.verify = verifySetting.isBool() && verifySetting.asBool();
+        poolKey = urlValue.isString() && sslCtxFn == nullptr
+                      ? CredRequestPool::KeyOf(urlValue.asString(), tls)
+                      : std::string();
+        curl = CredRequestPool::Acquire(poolKey, &poolGeneration);
+        if (curl == nullptr) {
+            error = CRED_REQ_ERR_CURL_INTERNAL;
+            return false;
+        }
+        return true;
+    };
     if (!urlValue.isString()) {
-        error = CRED_REQ_ERR_NO_URL;
+        if (takeHandle()) {
+            error = CRED_REQ_ERR_NO_URL;
+        }
         return false;
     }
     std::string url = urlValue.asString();
@@ -98,6 +103,7 @@ bool CredRequestPrivate::InitCurlHandler() {
     if (HasData("File") && HasData("PostParam", "_sid")) {
         std::string sid = ValueText(settings["PostParam"]["_sid"]);
         if (!SetData("GetParam", "_sid", sid)) {
+            takeHandle();
             return false;
         }
         settings["PostParam"].removeMember("_sid");
@@ -105,6 +111,22 @@ bool CredRequestPrivate::InitCurlHandler() {
     if (HasData("GetParam")) {
         url += url.find('?') == std::string::npos ? "?" : "&";
         url += GetParamString(settings["GetParam"]);
+    }
+    // Parameters are encoded before the handle is taken: encoding may fetch the server's
+    // encryption information with a request of its own, which then finds the kept connection
+    // to the server free.
+    const Json::Value &fileObj = GetData("File", "", kNull);
+    const bool rawBody = HasData("RawParam");
+    const Json::Value formFields =
+        !rawBody && fileObj.isObject()
+            ? GetParamJsonObj(HasData("PostParam") ? settings["PostParam"] : kNull)
+            : Json::Value();
+    const std::string postBody =
+        !rawBody && !fileObj.isObject() && reqStream == nullptr && HasData("PostParam")
+            ? GetParamString(settings["PostParam"])
+            : std::string();
+    if (!takeHandle()) {
+        return false;
     }
 
     if (!SetOption(CURLOPT_URL, url.c_str())) {
@@ -195,8 +217,7 @@ bool CredRequestPrivate::InitCurlHandler() {
 
     // Request body: raw text, else a multipart upload, else the request stream, else the form
     // parameters; without any of them the request is a GET.
-    const Json::Value &fileObj = GetData("File", "", kNull);
-    if (HasData("RawParam")) {
+    if (rawBody) {
         const std::string body = ValueText(settings["RawParam"]);
         if (!SetOption(CURLOPT_POST, 1L) || !SetOption(CURLOPT_COPYPOSTFIELDS, body.c_str())) {
             return false;
@@ -207,10 +228,8 @@ bool CredRequestPrivate::InitCurlHandler() {
 #pragma GCC diagnostic ignored "-Wdeprecated-declarations"
         // The multipart form is built with the form API, which the servers' upload handling
         // was written against.
-        const Json::Value fields =
-            GetParamJsonObj(HasData("PostParam") ? settings["PostParam"] : kNull);
-        if (fields.isObject()) {
-            for (auto it = fields.begin(); it != fields.end(); ++it) {
+        if (formFields.isObject()) {
+            for (auto it = formFields.begin(); it != formFields.end(); ++it) {
                 const std::string name = it.name();
                 const std::string value = ValueText(*it);
                 CURLFORMcode rc = curl_formadd(&form, &last, CURLFORM_COPYNAME, name.c_str(),
@@ -249,8 +268,7 @@ bool CredRequestPrivate::InitCurlHandler() {
             return false;
         }
     } else if (HasData("PostParam")) {
-        const std::string body = GetParamString(settings["PostParam"]);
-        if (!SetOption(CURLOPT_POST, 1L) || !SetOption(CURLOPT_COPYPOSTFIELDS, body.c_str())) {
+        if (!SetOption(CURLOPT_POST, 1L) || !SetOption(CURLOPT_COPYPOSTFIELDS, postBody.c_str())) {
             return false;
         }
     }
