@@ -80,8 +80,8 @@ class KOVA_EXPORT CredRequestMgr {
     // CRED_REQ_ERR_SELECT (logged as an interrupted wait), its unfinished requests stopped with
     // CRED_REQ_ERR_SELECT too. Async-signal-safe (errno is kept): may be called from a signal
     // handler or from another thread while Run waits; it wakes the wait itself. Does nothing
-    // when no Run of this manager is in progress, and reaches a run only while fewer than 256
-    // runs are in progress in the process at once.
+    // when no Run of this manager is in progress. It reaches a run that began while fewer than
+    // 256 runs were in progress in the process; a run beyond those cannot be cancelled.
     void Cancel();
     // A copy of the response body of the request at `index`; "" and CRED_REQ_ERR_BAD_PARAM for
     // a bad index.
