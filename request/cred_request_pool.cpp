@@ -160,6 +160,24 @@ std::string UrlPart(CURLU *url, CURLUPart part, unsigned flags) {
     return value;
 }
 
+// The manager's multi handle of this thread (see ThreadMulti), cleaned up when the thread
+// ends unless it was inherited across fork.
+struct ThreadMultiHolder {
+    CURLM *multi = nullptr;
+    unsigned generation = 0;
+    void Close() {
+        if (multi != nullptr && generation == gGeneration) {
+            curl_multi_cleanup(multi);
+        }
+        multi = nullptr;
+    }
+    ~ThreadMultiHolder() { Close(); }
+};
+thread_local ThreadMultiHolder tThreadMulti;
+
+// Idle connections the manager's multi handle of a thread keeps between runs.
+constexpr long kMaxIdleConnectionsPerThread = 64;
+
 }  // namespace
 
 bool CredRequestPool::ReuseEnabled() {
@@ -172,9 +190,17 @@ unsigned CredRequestPool::Generation() {
 
 std::string CredRequestPool::KeyOf(const std::string &url, const Tls &tls) {
     (void)gForkHandlers;
-    if (!ReuseEnabled()) {
+    const std::string server = ReuseEnabled() ? ServerOf(url) : std::string();
+    if (server.empty()) {
         return std::string();
     }
+    // Lengths keep the free-form parts from running into each other.
+    return server + (tls.verify ? " verify" : " noverify") + " ca" +
+           std::to_string(tls.caFile.size()) + ":" + tls.caFile + " pin" +
+           std::to_string(tls.pinnedKey.size()) + ":" + tls.pinnedKey;
+}
+
+std::string CredRequestPool::ServerOf(const std::string &url) {
     std::unique_ptr<CURLU, UrlDeleter> parsed(curl_url());
     if (!parsed ||
         curl_url_set(parsed.get(), CURLUPART_URL, url.c_str(), CURLU_GUESS_SCHEME) != CURLUE_OK) {
@@ -191,10 +217,26 @@ std::string CredRequestPool::KeyOf(const std::string &url, const Tls &tls) {
             c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
         }
     }
-    // Lengths keep the free-form parts from running into each other.
-    return scheme + "://" + host + ":" + port + (tls.verify ? " verify" : " noverify") + " ca" +
-           std::to_string(tls.caFile.size()) + ":" + tls.caFile + " pin" +
-           std::to_string(tls.pinnedKey.size()) + ":" + tls.pinnedKey;
+    return scheme + "://" + host + ":" + port;
+}
+
+CURLM *CredRequestPool::ThreadMulti(bool *owned) {
+    *owned = !ReuseEnabled();
+    if (*owned) {
+        return curl_multi_init();
+    }
+    ThreadMultiHolder &holder = tThreadMulti;
+    if (holder.multi != nullptr && holder.generation != gGeneration) {
+        holder.multi = nullptr;  // the parent's, with the parent's connections: abandoned
+    }
+    if (holder.multi == nullptr) {
+        holder.multi = curl_multi_init();
+        holder.generation = gGeneration;
+        if (holder.multi != nullptr) {
+            curl_multi_setopt(holder.multi, CURLMOPT_MAXCONNECTS, kMaxIdleConnectionsPerThread);
+        }
+    }
+    return holder.multi;
 }
 
 CURL *CredRequestPool::Acquire(const std::string &key, unsigned *generation) {
@@ -293,6 +335,7 @@ void CredRequestPool::CloseIdle() {
         state->idle.clear();
     }
     CleanUp(handles);
+    tThreadMulti.Close();
 }
 
 }  // namespace KOVA

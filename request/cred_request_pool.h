@@ -33,6 +33,9 @@
 //   and send TLS close_notify on them. A handle that a request in the child inherited is
 //   replaced by a copy of its options before the child uses it (FreshIfInherited) and
 //   abandoned when given back. The generation of the pool tells inherited handles apart.
+// - The request manager runs transfers in a multi handle per thread, kept between runs (see
+//   ThreadMulti); the handles in it keep their share, so its new connections resume TLS
+//   sessions too.
 // - Exit: the first handle registers an exit handler that closes the idle handles and the
 //   share. Registered after libcurl's first initialisation (and OpenSSL's own exit handler),
 //   it runs before them. Handles given back after it ran are cleaned up at once.
@@ -76,7 +79,20 @@ class CredRequestPool {
     // the state (abandoning the inherited one), not pooled (`*key` cleared); otherwise `curl`.
     // Null when the copy cannot be made.
     static CURL *FreshIfInherited(CURL *curl, std::string *key, unsigned *generation);
-    // Cleans up every idle handle, closing their connections.
+    // "scheme://host:port" of `url` (scheme and host in lower case, the scheme's port when the
+    // URL names none); empty when libcurl cannot parse it.
+    static std::string ServerOf(const std::string &url);
+
+    // The multi handle the request manager runs its transfers on, on this thread. While a
+    // handle is in a multi handle it uses that multi handle's connection cache, so one per run
+    // would close every connection at the end of the run; this one is kept between runs, one
+    // per thread because a multi handle serves one thread at a time. It goes with the thread,
+    // with CloseIdle on the thread, and in a child after fork (abandoned there like the
+    // pool). While reuse is off it is a new one for each run, which `*owned` then tells the
+    // caller to clean up. Null when libcurl cannot make one.
+    static CURLM *ThreadMulti(bool *owned);
+    // Cleans up every idle handle, closing their connections, and the calling thread's multi
+    // handle (which must hold no transfer).
     static void CloseIdle();
     // Whether reuse is on (kovacredential_no_reuse unset).
     static bool ReuseEnabled();

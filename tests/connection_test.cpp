@@ -11,9 +11,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
+#include <chrono>
+#include <condition_variable>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <set>
 #include <string>
 #include <thread>
@@ -24,9 +28,11 @@
 #include <openssl/ssl.h>
 
 #include "kovacredential/cred_request.h"
+#include "kovacredential/cred_request_mgr.h"
 #include "simlib/loopback_server.h"
 #include "support/child.h"
 #include "support/interpose.h"
+#include "support/nginx_server.h"
 #include "support/temp_dir.h"
 #include "webapi_fixture.h"
 
@@ -77,6 +83,18 @@ class ConnectionTest : public ::testing::Test {
             server->Route("*", "/hello", [](const httplib::Request &, httplib::Response &res) {
                 res.set_content("hello", "text/plain");
             });
+            // Answers once `gathered_` requests are waiting here at once (at most after five
+            // seconds), and notes the most that waited at once.
+            server->Route("GET", "/gather", [](const httplib::Request &, httplib::Response &res) {
+                std::unique_lock<std::mutex> lock(gatherMutex_);
+                ++waiting_;
+                mostWaiting_ = std::max(mostWaiting_, waiting_);
+                gatherCv_.notify_all();
+                gatherCv_.wait_for(lock, std::chrono::seconds(5),
+                                   [] { return mostWaiting_ >= gathered_; });
+                --waiting_;
+                res.set_content("gathered", "text/plain");
+            });
             server->Route("GET", "/cookie", [](const httplib::Request &, httplib::Response &res) {
                 res.set_header("Set-Cookie", "id=from-server; Path=/");
                 res.set_content("cookie", "text/plain");
@@ -107,12 +125,33 @@ class ConnectionTest : public ::testing::Test {
                (byName ? "localhost" : "127.0.0.1") + ":" + std::to_string(server.Port()) + path;
     }
 
+    // Expects `count` requests to "/gather" at once from now on.
+    static void Gather(int count) {
+        std::lock_guard<std::mutex> lock(gatherMutex_);
+        gathered_ = count;
+        mostWaiting_ = 0;
+    }
+    static int MostWaiting() {
+        std::lock_guard<std::mutex> lock(gatherMutex_);
+        return mostWaiting_;
+    }
+
     static kovasim::LoopbackServer *http_;
     static kovasim::LoopbackServer *https_;
+    static std::mutex gatherMutex_;
+    static std::condition_variable gatherCv_;
+    static int gathered_;
+    static int waiting_;
+    static int mostWaiting_;
 };
 
 kovasim::LoopbackServer *ConnectionTest::http_ = nullptr;
 kovasim::LoopbackServer *ConnectionTest::https_ = nullptr;
+std::mutex ConnectionTest::gatherMutex_;
+std::condition_variable ConnectionTest::gatherCv_;
+int ConnectionTest::gathered_ = 0;
+int ConnectionTest::waiting_ = 0;
+int ConnectionTest::mostWaiting_ = 0;
 
 // Fresh request objects one after another ride one connection, over plain HTTP and over TLS.
 TEST_F(ConnectionTest, SequentialRequestsShareOneConnection) {
@@ -266,6 +305,32 @@ TEST_F(ConnectionTest, IdleHandlesAreBounded) {
     }
     EXPECT_EQ(http_->RequestCount(), 2 * kHeld);
     EXPECT_EQ(http_->ConnectionCount(), kHeld + (kHeld - kKept));
+}
+
+// The manager runs every transfer to an HTTP/1.1 server at once, over plain HTTP and over TLS
+// (where it first learns the protocol from one transfer), and a later run on the same thread
+// rides the connections of the first.
+TEST_F(ConnectionTest, ManagerKeepsHttp1ParallelAndReusesConnectionsBetweenRuns) {
+    constexpr int kAtOnce = 12;
+    for (kovasim::LoopbackServer *server : {http_, https_}) {
+        SCOPED_TRACE(server->BaseUrl());
+        for (int run = 0; run < 2; ++run) {
+            Gather(kAtOnce);
+            KOVA::CredRequestMgr mgr;
+            for (int i = 0; i < kAtOnce; ++i) {
+                auto *req = new CredRequest();
+                ASSERT_TRUE(req->SetURL(Url(*server, "/gather")));
+                ASSERT_EQ(mgr.AddCredRequest(req), i);
+            }
+            EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+            for (int i = 0; i < kAtOnce; ++i) {
+                EXPECT_EQ(mgr.GetResponse(i), "gathered") << i;
+            }
+            EXPECT_EQ(MostWaiting(), kAtOnce);
+        }
+        EXPECT_EQ(server->RequestCount(), 2u * kAtOnce);
+        EXPECT_EQ(server->ConnectionCount(), static_cast<size_t>(kAtOnce));
+    }
 }
 
 // kovacredential_no_reuse makes every request open its own connection.
@@ -452,6 +517,32 @@ TEST(ForkTest, ChildStartsWithAnEmptyPoolAndParentKeepsItsOwn) {
               "exit 0");
     EXPECT_EQ(PortOf(held), heldPort) << kova_test::LogDump();
     EXPECT_EQ(FreshPort(server.Url()), pooledPort) << kova_test::LogDump();
+    CredRequest::CloseIdleConnections();
+}
+
+// Against a server that speaks HTTP/2 the manager multiplexes: hundreds of transfers started
+// at once share one connection, in one run and the next, as nginx's access log shows.
+TEST(Http2Test, ManagerMultiplexesOverOneConnection) {
+    kova_test::NginxServer nginx;
+    ASSERT_TRUE(nginx.Start()) << nginx.Error();
+    size_t total = 0;
+    for (int count : {300, 50}) {
+        KOVA::CredRequestMgr mgr;
+        for (int i = 0; i < count; ++i) {
+            auto *req = new CredRequest();
+            ASSERT_TRUE(req->SetURL(nginx.BaseUrl() + "/small"));
+            ASSERT_EQ(mgr.AddCredRequest(req), i);
+        }
+        EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+        for (int i = 0; i < count; ++i) {
+            ASSERT_EQ(mgr.GetResponse(i), "hello from nginx\n") << i;
+        }
+        total += static_cast<size_t>(count);
+    }
+    ASSERT_TRUE(nginx.WaitForRequests(total));
+    const auto log = nginx.AccessLog();
+    EXPECT_EQ(log.front().protocol, "HTTP/2.0");
+    EXPECT_EQ(nginx.ConnectionCount(), 1u);
     CredRequest::CloseIdleConnections();
 }
 
