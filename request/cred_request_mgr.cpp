@@ -633,13 +633,20 @@ void CollectFinished(CredRequestMgr &mgr, CURLM *multi, RunControl *control) {
 
 // After libcurl advanced: reads the finished transfers, then starts those their servers now
 // admit (a run's transfers to an HTTPS server, see ServerAdmission) and lets libcurl take them
-// up.
+// up, until no more start.
 CURLMcode Advance(CURLM *multi, int *running, CredRequestMgr &mgr, RunControl *control) {
-    CollectFinished(mgr, multi, control);
-    if (control == nullptr || Admit(multi, *control) == 0) {
-        return CURLM_OK;
+    // Transfers started here may finish at once, leaving none running: their servers may then
+    // admit more, so the run is over only once nothing more starts.
+    for (;;) {
+        CollectFinished(mgr, multi, control);
+        if (control == nullptr || Admit(multi, *control) == 0) {
+            return CURLM_OK;
+        }
+        const CURLMcode code = curl_multi_perform(multi, running);
+        if (code != CURLM_OK) {
+            return code;
+        }
     }
-    return curl_multi_perform(multi, running);
 }
 
 // Ends a run before its transfers finished: every unfinished transfer is taken off the multi

@@ -535,7 +535,11 @@ TEST(Http2Test, ManagerMultiplexesOverOneConnection) {
         }
         EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
         for (int i = 0; i < count; ++i) {
-            ASSERT_EQ(mgr.GetResponse(i), "hello from nginx\n") << i;
+            ASSERT_EQ(mgr.GetResponse(i), "hello from nginx\n")
+                << i << " error " << mgr.GetRequest(i)->GetError() << " curl "
+                << mgr.GetRequest(i)->GetCurlCode() << " " << mgr.GetRequest(i)->GetCurlErrorText()
+                << "\n"
+                << kova_test::LogDump();
         }
         total += static_cast<size_t>(count);
     }
