@@ -119,8 +119,8 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
         CredRequest request;
         if (!request.SetURL(cred->protocol, cred->host, cred->port, path)) {
             kova::Log("%s:%d SetURL failed. %s %s %ld %s", kUnit, kLineDescSetUrl,
-                      cred->protocol.c_str(), cred->host.c_str(), static_cast<long>(cred->port),
-                      path.c_str());
+                      cred->protocol.c_str(), kova::UrlForLog(cred->host).c_str(),
+                      static_cast<long>(cred->port), path.c_str());
             return false;
         }
         Json::Value params(Json::objectValue);
