@@ -2,12 +2,15 @@
 // concurrent runs, set-up failures, silent and refusing servers, and the socket callback.
 
 #include <arpa/inet.h>
+#include <dlfcn.h>
 #include <fcntl.h>
+#include <netdb.h>
 #include <netinet/in.h>
 #include <signal.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
+#include <string.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -28,6 +31,33 @@
 #include "simlib/relay_sim.h"
 #include "support/child.h"
 #include "support/interpose.h"
+
+// Name resolution of kStalledHost hangs (up to 30 s, or until released), as with a DNS server
+// that never answers; every other name resolves as usual. The test program's definition takes
+// the place of libc's for libcurl's resolver thread too.
+namespace {
+
+constexpr char kStalledHost[] = "stalled.invalid";
+std::atomic<bool> gResolverStalled{false};
+std::atomic<bool> gReleaseResolver{false};
+
+}  // namespace
+
+extern "C" int getaddrinfo(const char *node, const char *service, const struct addrinfo *hints,
+                           struct addrinfo **res) {
+    using Real = int (*)(const char *, const char *, const struct addrinfo *, struct addrinfo **);
+    if (node != nullptr && strcmp(node, kStalledHost) == 0) {
+        gResolverStalled = true;
+        const struct timespec step = {0, 10 * 1000 * 1000};
+        for (int i = 0; i < 3000 && !gReleaseResolver; ++i) {
+            nanosleep(&step, nullptr);
+        }
+        gResolverStalled = false;
+        return EAI_AGAIN;
+    }
+    static const Real real = reinterpret_cast<Real>(dlsym(RTLD_NEXT, "getaddrinfo"));
+    return real(node, service, hints, res);
+}
 
 namespace {
 
@@ -322,8 +352,8 @@ TEST_F(ManagerTest, ResponsesPastTheInMemoryCapFailTheirRequest) {
 }
 
 // A deadline for the whole run stops a transfer that trickles on (a byte a second keeps it
-// inside every quiet wait, and the manager lifts the low-speed limit) with the time-out, while
-// a request that answered in time keeps its answer.
+// inside every quiet wait, and the manager lifts the low-speed limit) and one whose host name
+// never resolves with the time-out, while a request that answered in time keeps its answer.
 TEST_F(ManagerTest, DeadlineStopsTheRunAndItsUnfinishedRequests) {
     constexpr int kDripBytes = 60;
     kovasim::RawServer drip([](kovasim::RawServer::Connection &c) {
@@ -339,6 +369,7 @@ TEST_F(ManagerTest, DeadlineStopsTheRunAndItsUnfinishedRequests) {
     CredRequestMgr mgr;
     ASSERT_EQ(0, mgr.AddCredRequest(NewRequest(drip.BaseUrl() + "/drip")));
     ASSERT_EQ(1, mgr.AddCredRequest(NewRequest(Url("/hello"))));
+    ASSERT_EQ(2, mgr.AddCredRequest(NewRequest(std::string("http://") + kStalledHost + "/")));
     EXPECT_FALSE(mgr.Run(-1));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
     EXPECT_EQ(0u, server_->RequestCount());
@@ -350,6 +381,10 @@ TEST_F(ManagerTest, DeadlineStopsTheRunAndItsUnfinishedRequests) {
     EXPECT_LT(mgr.GetResponse(0).size(), static_cast<size_t>(kDripBytes));
     EXPECT_EQ("hello", mgr.GetResponse(1));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetRequest(1)->GetError());
+    // The run did not wait for the resolver that never answers.
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, mgr.GetRequest(2)->GetError());
+    EXPECT_TRUE(gResolverStalled);
+    gReleaseResolver = true;
 }
 
 // A large raw body makes libcurl ask for "100 Continue"; a server that never sends it is waited
