@@ -11,10 +11,22 @@
 #include <CLI/CLI.hpp>
 #include <json/value.h>
 
+#include <kovacredential/kovacred.h>
+
+namespace KOVA {
+class CredRequest;
+}
+
 namespace kovacred {
 
 // Set by a command's callback; main returns it.
 extern int gExitCode;
+
+// Exit statuses of their own; every other failure exits with the library's error code when it
+// fits 1..255, else 1 (the table is in kovacred(1)).
+constexpr int kExitUsage = 2;          // the command line could not be used
+constexpr int kExitWrite = 23;         // standard output or an output file could not be written
+constexpr int kExitInterrupted = 130;  // stopped by SIGINT
 
 using RegisterFn = std::function<void(CLI::App &app)>;
 
@@ -46,7 +58,57 @@ int FailServer(const std::string &what, long code, const std::string &text);
 // Prints "kovacred: <message>" to standard error and sets exit status 1.
 int FailText(const std::string &message);
 
+// A usage error: prints "kovacred: <message>" and sets exit status kExitUsage.
+int FailUsage(const std::string &message);
+
+// ---- The credential database.
+
+// The database the store functions open: kovacredential_db, else the system's.
+std::string DatabasePath();
+
+// Checks, before the library opens it, that the database is one a command may use, reading it
+// read-only so that nothing in it changes: a command that only reads (kExisting) needs a
+// credential database at the path; kCreate (add, session set) accepts a missing or empty file,
+// which the library then sets up. False after printing why not.
+enum class DatabaseUse { kExisting, kCreate };
+bool CheckDatabase(DatabaseUse use);
+
+// Reports a failed store call with the code it left in the error slot, naming the database.
+int FailStore(const std::string &what);
+
+// ---- Transfers.
+
+// How the tool's requests reach a server: certificate checks and time limits. The library's
+// defaults (no checks) stay unless a command line asks.
+struct Transport {
+    bool verify = false;
+};
+
+// Adds --verify to a command that makes requests.
+void AddTransportOptions(CLI::App *cmd, Transport *transport);
+
+// Applies `transport` to a request before it runs.
+void ApplyTransport(const Transport &transport, KOVA::CredRequest &request);
+
+// The failure line of a transfer that did not end with status 200: the library's code and,
+// behind it, the cause as far as it is known. Sets the exit status as Fail and returns it.
+int FailTransfer(const std::string &what, KOVA::CredRequest &request);
+
+// ---- Logging in.
+
+// Logs in with credential `cred` (the library's login, with the one-time code `otp` when not
+// empty) and stores the session; false with the failure's text ("server error 400: wrong
+// account or password", or ErrorText of the library's code) and exit status in `code`.
+bool LogIn(KOVA_CRED &cred, const std::string &otp, std::string &failure, long &code);
+
 // ---- Output.
+
+// Whether `url` is one the library can fetch: scheme http or https (none means http) and a
+// port from 1 to 65535; false after printing "<command> failed: <cause>".
+bool CheckURL(const std::string &command, const std::string &url);
+
+// Adds the required positional "id" of a command that works on one credential.
+CLI::Option *AddIdArgument(CLI::App *cmd, int *id);
 
 // Adds the --json flag of a command that prints data.
 void AddJsonFlag(CLI::App *cmd, bool *json);

@@ -2,9 +2,12 @@
 
 # Options that take a value, so that their value is not counted as an argument.
 _kovacred_value_opts='--db --host --port --protocol --account --application --extra --owner
-    --sid --token --otp --params --file -q --query -d --data -H --header -b --cookie -F --upload
+    --otp --params --file -q --query -d --data -H --header -b --cookie -F --upload
     --body-file -T --upload-file -o --output --format -r --retries --connect-timeout
     --response-timeout'
+
+# The options of every command that makes requests.
+_kovacred_transfer_opts='--verify'
 
 # The ids `kovacred list` prints for the database the command line (or kovacredential_db)
 # names. A database that does not exist yet is not created for this.
@@ -61,7 +64,7 @@ _kovacred() {
             fi
             return
             ;;
-        --host | --port | --account | --application | --extra | --owner | --sid | --token | \
+        --host | --port | --account | --application | --extra | --owner | \
             --otp | --params | -q | --query | -d | --data | -H | --header | -b | --cookie | \
             --format | -r | --retries | --connect-timeout | --response-timeout)
             return
@@ -70,17 +73,18 @@ _kovacred() {
 
     local opts=""
     case $command/$sub in
-        /) opts='--db --version --help' ;;
-        add/) opts='--host --port --protocol --account --application --extra --owner' ;;
-        list/ | show/ | probe/ | apis/ | batch/ | session/show) opts='--json' ;;
-        session/set) opts='--sid --token --extra' ;;
-        login/) opts='--otp' ;;
-        call/) opts='--params --file --json' ;;
+        /) opts='--db --verbose --version --help' ;;
+        add/) opts='--host --port --protocol --account --application --extra --owner --json' ;;
+        list/ | show/ | probe/ | batch/ | session/show) opts='--json' ;;
+        session/set) opts='--extra' ;;
+        login/) opts="--otp $_kovacred_transfer_opts" ;;
+        apis/) opts="--json $_kovacred_transfer_opts" ;;
+        call/) opts="--params --file --json $_kovacred_transfer_opts" ;;
         resolve/) opts='--portal --json' ;;
         request/)
             opts='--query --data --header --cookie --upload --body-file --upload-file --output
-                --format --retries --connect-timeout --response-timeout --headers --verify
-                --no-follow --json'
+                --format --retries --connect-timeout --response-timeout --headers --no-follow
+                --fail --json '"$_kovacred_transfer_opts"
             ;;
     esac
     if [[ $cur == -* ]]; then
@@ -90,13 +94,13 @@ _kovacred() {
 
     case $command/$sub in
         /)
-            COMPREPLY=($(compgen -W 'add list show remove session request probe login logout
-                call apis batch resolve' -- "$cur"))
+            COMPREPLY=($(compgen -W 'add passwd list show remove session request probe login
+                logout call apis batch resolve' -- "$cur"))
             ;;
         session/)
             COMPREPLY=($(compgen -W 'show set remove' -- "$cur"))
             ;;
-        show/ | remove/ | login/ | logout/ | call/ | apis/ | session/?*)
+        show/ | passwd/ | remove/ | login/ | logout/ | call/ | apis/ | session/?*)
             ((args == 0)) && COMPREPLY=($(compgen -W "$(_kovacred_ids)" -- "$cur"))
             ;;
         batch/)
