@@ -371,6 +371,54 @@ void CredRequest::SetEncoding(bool encoding) {
     });
 }
 
+bool CredRequest::SetTotalTimeout(long milliseconds) {
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        if (milliseconds < 0) {
+            p.error = CRED_REQ_ERR_BAD_PARAM;
+            return false;
+        }
+        p.totalTimeoutMs = milliseconds;
+        return true;
+    });
+}
+
+long CredRequest::GetTotalTimeout() const {
+    return d != nullptr ? d->totalTimeoutMs : 0;
+}
+
+void CredRequest::SetMaxResponseSize(size_t bytes) {
+    OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        p.maxResponseBytes = bytes;
+        return true;
+    });
+}
+
+size_t CredRequest::GetMaxResponseSize() const {
+    return d != nullptr ? d->maxResponseBytes : CredRequestPrivate::kMaxResponseBytes;
+}
+
+bool CredRequest::SetCAFile(const std::string &path) {
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        if (path.empty()) {
+            p.error = CRED_REQ_ERR_BAD_PARAM;
+            return false;
+        }
+        p.caFile = path;
+        return true;
+    });
+}
+
+bool CredRequest::SetPinnedPublicKey(const std::string &pin) {
+    return OnPrivate(d, false, [&](CredRequestPrivate &p) {
+        if (pin.empty()) {
+            p.error = CRED_REQ_ERR_BAD_PARAM;
+            return false;
+        }
+        p.pinnedPublicKey = pin;
+        return true;
+    });
+}
+
 KOVA::_tag_CRED_REQ_ERR CredRequest::GetError() {
     // A request whose construction failed reports the generic failure.
     return d != nullptr ? d->error : CRED_REQ_ERR_UNKNOWN;
@@ -392,6 +440,18 @@ std::string CredRequest::GetResponse() {
 
 const Json::Value &CredRequest::GetResponseHeader() {
     return d != nullptr ? d->GetResponseHeader() : kNull;
+}
+
+int CredRequest::GetCurlCode() {
+    return d != nullptr ? static_cast<int>(d->curlCode) : static_cast<int>(CURLE_OK);
+}
+
+std::string CredRequest::GetCurlErrorText() {
+    return OnPrivate(d, std::string(), [](CredRequestPrivate &p) { return p.curlErrorText; });
+}
+
+Json::Value CredRequest::GetTransferInfo() {
+    return OnPrivate(d, Json::Value(), [](CredRequestPrivate &p) { return p.transferInfo; });
 }
 
 }  // namespace KOVA

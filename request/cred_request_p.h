@@ -58,13 +58,17 @@ class CredRequestPrivate {
     std::string GetCookies();
 
     // ---- Transfer set-up and callbacks.
-    // The most a response held in memory (the response string) may grow to. No WebAPI or
-    // directory answer comes near it; a server that sends more gets its transfer ended with a
-    // write error, so that it cannot grow the caller without bound. Response streams and the
-    // caller's own writer are not limited.
+    // The default of the most a response held in memory (the response string) may grow to
+    // (maxResponseBytes). No WebAPI or directory answer comes near it; a server that sends more
+    // gets its transfer ended with a write error, so that it cannot grow the caller without
+    // bound. Response streams and the caller's own writer are not limited.
     static constexpr size_t kMaxResponseBytes = size_t{64} << 20;
     bool InitCurlHandler();
+    // Appends the bytes to `out`; 0 (a write error for libcurl) when memory runs out.
     static size_t WriteToStrBuf(char *data, size_t size, size_t nmemb, std::string *out);
+    // libcurl's write callback for the response string (data: this object): WriteToStrBuf
+    // within maxResponseBytes, a write error past it.
+    static size_t WriteResponse(char *data, size_t size, size_t nmemb, void *self);
     static size_t WriteToStream(char *data, size_t size, size_t nmemb, FILE *stream);
     static size_t ReadFromStream(char *buffer, size_t size, size_t nmemb, FILE *stream);
     static size_t WriteHeaderToJsonValue(char *data, size_t size, size_t nmemb,
@@ -77,16 +81,42 @@ class CredRequestPrivate {
     // (a redirect that keeps the POST), starts from where the streams stood when Process began.
     // Notes where the request and response streams stand and the shared stream limit.
     void MarkStreams();
-    // Puts the streams back to the mark, cutting off what the last attempt wrote to the
-    // response stream (with `cutResponse` even when it wrote nothing). False when that cannot
-    // be done: a request stream that is not seekable (a pipe) and was partly sent, a response
-    // stream that cannot be cut back.
-    bool RewindStreams(bool cutResponse);
+    // Puts the streams back to the mark, cutting off the response stream at the mark when the
+    // last attempt wrote to it (an attempt that wrote nothing leaves the file as it is). False
+    // when that cannot be done: a request stream that is not seekable (a pipe) and was partly
+    // sent, a response stream that cannot be cut back.
+    bool RewindStreams();
     // libcurl's read, seek and write callbacks for the streams (data: this object). They call
     // ReadFromStream and WriteToStream (or the caller's writer) and count what passed.
     static size_t ReadBody(char *buffer, size_t size, size_t nmemb, void *self);
     static int SeekBody(void *self, curl_off_t offset, int origin);
     static size_t WriteBody(char *data, size_t size, size_t nmemb, void *self);
+
+    // ---- Deadline and transfer facts.
+    // Starts the deadline of a Process from now (with a total time-out).
+    void StartDeadline();
+    // Milliseconds left until the deadline of the current Process (negative once it has
+    // passed); LONG_MAX without a total time-out.
+    long DeadlineLeftMs() const;
+    // Limits the next attempt on the handle to what is left of the deadline (no limit without
+    // a total time-out). False when the option cannot be set (CRED_REQ_ERR_CURL_INTERNAL).
+    bool ArmDeadline();
+    // Records the outcome of one transfer attempt on the handle: libcurl's result, its text
+    // and the facts of GetTransferInfo.
+    void NoteTransfer(CURLcode result);
+
+    // ---- libcurl's process-wide set-up.
+    // Whether this process gained privileges at exec (setuid, setgid, file capabilities:
+    // getauxval(AT_SECURE)); libcurl must then not take settings from the invoker's
+    // environment.
+    static bool SecureProcess();
+    // In a `secure` process, removes the variables libcurl reads at its global initialisation
+    // from the environment (SSLKEYLOGFILE, which would write the TLS session keys to a file the
+    // invoker names). Runs before that initialisation, once.
+    static void ScrubCurlEnvironment(bool secure);
+    // Initialises libcurl once per process, thread-safely, before the first handle:
+    // ScrubCurlEnvironment(secure), then curl_global_init.
+    static void InitCurlGlobal(bool secure);
 
     // Fills protocol, host and port of the request's own credential from `url`.
     bool buildCredByURL(const std::string &url);
@@ -124,6 +154,24 @@ class CredRequestPrivate {
     long defaultTimeout = 120;
     bool followLocation = true;
     bool encoding = false;
+
+    // Settings kept beside the document.
+    long totalTimeoutMs = 0;                      // deadline of Process as a whole; 0: none
+    size_t maxResponseBytes = kMaxResponseBytes;  // cap of the response string; 0: none
+    std::string caFile;                           // CURLOPT_CAINFO when not empty
+    std::string pinnedPublicKey;                  // CURLOPT_PINNEDPUBLICKEY when not empty
+    // Whether the invoker's proxy variables are overridden (see SecureProcess); a test may
+    // force it before the handle is set up.
+    bool secureProcess = SecureProcess();
+
+    // The deadline of the current Process (CLOCK_MONOTONIC, milliseconds), with a total
+    // time-out.
+    int64_t deadlineMs = 0;
+    // Outcome of the last transfer attempt.
+    CURLcode curlCode = CURLE_OK;
+    std::string curlErrorText;
+    Json::Value transferInfo;  // null before any transfer
+    char curlErrorBuffer[CURL_ERROR_SIZE] = {};
 
     // Stream positions of the current Process (see MarkStreams): -1 when a stream is not set
     // or not seekable.

@@ -1,7 +1,12 @@
 // Execution of KOVA::CredRequest: the transfer with bounded retries and the mapping of every
 // libcurl result and HTTP status to one request error.
 #include <stdio.h>
+#include <time.h>
 #include <unistd.h>
+
+#include <algorithm>
+#include <limits>
+#include <utility>
 
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
@@ -20,7 +25,89 @@ bool PausesBeforeRetry(CURLcode rc) {
            rc == CURLE_OPERATION_TIMEDOUT;
 }
 
+// The pause before a retry after a resolve failure or a time-out, in milliseconds (sleep(1)).
+constexpr long kRetryPauseMs = 1000;
+
+int64_t MonotonicMs() {
+    struct timespec now = {};
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
+}
+
+// A libcurl time (microseconds) in seconds.
+double Seconds(CURL *curl, CURLINFO what) {
+    curl_off_t us = 0;
+    return curl_easy_getinfo(curl, what, &us) == CURLE_OK ? static_cast<double>(us) / 1e6 : 0.0;
+}
+
+const char *HttpVersionText(long version) {
+    switch (version) {
+        case CURL_HTTP_VERSION_1_0:
+            return "1.0";
+        case CURL_HTTP_VERSION_1_1:
+            return "1.1";
+        case CURL_HTTP_VERSION_2_0:
+            return "2";
+        case CURL_HTTP_VERSION_3:
+            return "3";
+        default:
+            return "";  // no response
+    }
+}
+
 }  // namespace
+
+void CredRequestPrivate::StartDeadline() {
+    deadlineMs = totalTimeoutMs > 0 ? MonotonicMs() + totalTimeoutMs : 0;
+}
+
+long CredRequestPrivate::DeadlineLeftMs() const {
+    if (deadlineMs == 0) {
+        return std::numeric_limits<long>::max();
+    }
+    return static_cast<long>(deadlineMs - MonotonicMs());
+}
+
+bool CredRequestPrivate::ArmDeadline() {
+    // A deadline that has passed still leaves the attempt 1 ms, which libcurl ends with its
+    // own time-out.
+    const long limit = deadlineMs != 0 ? std::max(DeadlineLeftMs(), 1L) : 0L;
+    if (!SetOption(CURLOPT_TIMEOUT_MS, limit)) {
+        return false;
+    }
+    // libcurl waits for a resolver thread that has not answered when a transfer ends (a
+    // getaddrinfo without reply lasts the system resolver's whole time-out); under a deadline
+    // it leaves the thread to finish on its own instead. Older libcurl lacks the option and
+    // keeps waiting, hence the result is not checked.
+    curl_easy_setopt(curl, CURLOPT_QUICK_EXIT, deadlineMs != 0 ? 1L : 0L);
+    return true;
+}
+
+void CredRequestPrivate::NoteTransfer(CURLcode result) {
+    curlCode = result;
+    curlErrorText = curlErrorBuffer[0] != '\0' ? curlErrorBuffer : curl_easy_strerror(result);
+    Json::Value info(Json::objectValue);
+    info["namelookup"] = Seconds(curl, CURLINFO_NAMELOOKUP_TIME_T);
+    info["connect"] = Seconds(curl, CURLINFO_CONNECT_TIME_T);
+    info["tls"] = Seconds(curl, CURLINFO_APPCONNECT_TIME_T);
+    info["firstByte"] = Seconds(curl, CURLINFO_STARTTRANSFER_TIME_T);
+    info["total"] = Seconds(curl, CURLINFO_TOTAL_TIME_T);
+    long connects = 0;
+    curl_easy_getinfo(curl, CURLINFO_NUM_CONNECTS, &connects);
+    info["connects"] = static_cast<Json::Int64>(connects);
+    // A completed transfer that opened no connection rode one made earlier.
+    info["reused"] = result == CURLE_OK && connects == 0;
+    long version = 0;
+    curl_easy_getinfo(curl, CURLINFO_HTTP_VERSION, &version);
+    info["httpVersion"] = HttpVersionText(version);
+    char *ip = nullptr;
+    curl_easy_getinfo(curl, CURLINFO_PRIMARY_IP, &ip);
+    info["remoteIp"] = ip != nullptr ? ip : "";
+    long port = 0;
+    curl_easy_getinfo(curl, CURLINFO_PRIMARY_PORT, &port);
+    info["remotePort"] = static_cast<Json::Int64>(port);
+    transferInfo = std::move(info);
+}
 
 constexpr int kLineInitFailed = 47;
 constexpr int kLineCurlError = 98;
@@ -33,6 +120,7 @@ bool CredRequest::Process(bool perform, int retries) {
         return false;
     }
     try {
+        d->StartDeadline();
         if (!d->InitCurlHandler()) {
             kova::Log("%s:%d (pid=%d)InitCurlHandler failed", kUnit, kLineInitFailed,
                       static_cast<int>(getpid()));
@@ -43,21 +131,31 @@ bool CredRequest::Process(bool perform, int retries) {
         // streams stand now (the manager drives the transfer itself after a set-up only).
         d->MarkStreams();
         if (!perform) {
-            return true;
+            return d->ArmDeadline();
         }
 
         const int attempts = retries + 1 > 1 ? retries + 1 : 1;
         CURLcode rc = CURLE_OK;
         for (int attempt = 1; attempt <= attempts; ++attempt) {
+            if (!d->ArmDeadline()) {
+                return false;
+            }
+            d->curlErrorBuffer[0] = '\0';
             rc = curl_easy_perform(d->curl);
+            d->NoteTransfer(rc);
             if (rc == CURLE_OK || attempt == attempts) {
+                break;
+            }
+            // Retries, and the pause before one, fit within the deadline or are not made.
+            const bool pause = PausesBeforeRetry(rc);
+            if (d->DeadlineLeftMs() <= (pause ? kRetryPauseMs : 0)) {
+                rc = CURLE_OPERATION_TIMEDOUT;
                 break;
             }
             // The next attempt starts clean: an empty response string, the streams back at
             // their mark. An attempt whose streams cannot be put back is the result.
-            const bool pause = PausesBeforeRetry(rc);
             d->response.clear();
-            if (!d->RewindStreams(pause)) {
+            if (!d->RewindStreams()) {
                 break;
             }
             if (pause) {

@@ -1,10 +1,12 @@
 // Transfer set-up of KOVA::CredRequest: the settings document becomes one configured libcurl
 // easy handle, plus the body, header and trace callbacks that handle uses.
 #include <stdlib.h>
+#include <sys/auxv.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <limits>
+#include <mutex>
 #include <stdexcept>
 
 #include "platform/json_text.h"
@@ -66,6 +68,24 @@ bool CredRequestPrivate::SetOption(CURLoption option, T value) {
     return true;
 }
 
+bool CredRequestPrivate::SecureProcess() {
+    return getauxval(AT_SECURE) != 0;
+}
+
+void CredRequestPrivate::ScrubCurlEnvironment(bool secure) {
+    if (secure) {
+        unsetenv("SSLKEYLOGFILE");
+    }
+}
+
+void CredRequestPrivate::InitCurlGlobal(bool secure) {
+    static std::once_flag once;
+    std::call_once(once, [secure] {
+        ScrubCurlEnvironment(secure);
+        curl_global_init(CURL_GLOBAL_DEFAULT);
+    });
+}
+
 constexpr int kLineFormAddFail = 181;
 
 bool CredRequestPrivate::InitCurlHandler() {
@@ -73,6 +93,7 @@ bool CredRequestPrivate::InitCurlHandler() {
     if (curl != nullptr) {
         return true;
     }
+    InitCurlGlobal(secureProcess);
     curl = curl_easy_init();
     if (curl == nullptr) {
         error = CRED_REQ_ERR_CURL_INTERNAL;
@@ -98,7 +119,14 @@ bool CredRequestPrivate::InitCurlHandler() {
         url += GetParamString(settings["GetParam"]);
     }
 
-    if (!SetOption(CURLOPT_URL, url.c_str())) {
+    if (!SetOption(CURLOPT_URL, url.c_str()) ||
+        !SetOption(CURLOPT_ERRORBUFFER, static_cast<char *>(curlErrorBuffer))) {
+        return false;
+    }
+    // A process that gained privileges at exec does not let its invoker's http_proxy,
+    // https_proxy or all_proxy send the request (and its session id) elsewhere: an empty proxy
+    // makes libcurl ignore them.
+    if (secureProcess && !SetOption(CURLOPT_PROXY, "")) {
         return false;
     }
     if (followLocation && !SetOption(CURLOPT_FOLLOWLOCATION, 1L)) {
@@ -136,6 +164,12 @@ bool CredRequestPrivate::InitCurlHandler() {
         if (!SetOption(CURLOPT_SSL_VERIFYPEER, 0L) || !SetOption(CURLOPT_SSL_VERIFYHOST, 0L)) {
             return false;
         }
+    }
+    if (!caFile.empty() && !SetOption(CURLOPT_CAINFO, caFile.c_str())) {
+        return false;
+    }
+    if (!pinnedPublicKey.empty() && !SetOption(CURLOPT_PINNEDPUBLICKEY, pinnedPublicKey.c_str())) {
+        return false;
     }
 
     const Json::Value &respTime = GetData("RespTime", "", kNull);
@@ -268,19 +302,26 @@ bool CredRequestPrivate::InitCurlHandler() {
             return false;
         }
     } else {
-        if (!SetOption(CURLOPT_WRITEFUNCTION, &CredRequestPrivate::WriteToStrBuf) ||
-            !SetOption(CURLOPT_WRITEDATA, &response)) {
+        if (!SetOption(CURLOPT_WRITEFUNCTION, &CredRequestPrivate::WriteResponse) ||
+            !SetOption(CURLOPT_WRITEDATA, static_cast<void *>(this))) {
             return false;
         }
     }
     return true;
 }
 
-size_t CredRequestPrivate::WriteToStrBuf(char *data, size_t size, size_t nmemb, std::string *out) {
+size_t CredRequestPrivate::WriteResponse(char *data, size_t size, size_t nmemb, void *self) {
+    auto *p = static_cast<CredRequestPrivate *>(self);
     const size_t total = size * nmemb;
-    if (total > kMaxResponseBytes || out->size() > kMaxResponseBytes - total) {
+    const size_t cap = p->maxResponseBytes;
+    if (cap != 0 && (total > cap || p->response.size() > cap - total)) {
         return 0;  // past the cap: libcurl ends the transfer with CURLE_WRITE_ERROR
     }
+    return WriteToStrBuf(data, size, nmemb, &p->response);
+}
+
+size_t CredRequestPrivate::WriteToStrBuf(char *data, size_t size, size_t nmemb, std::string *out) {
+    const size_t total = size * nmemb;
     try {
         out->append(data, total);
     } catch (...) {
@@ -380,7 +421,7 @@ void CredRequestPrivate::MarkStreams() {
     respStreamWritten = 0;
 }
 
-bool CredRequestPrivate::RewindStreams(bool cutResponse) {
+bool CredRequestPrivate::RewindStreams() {
     if (reqStream != nullptr) {
         // A body read from a pipe cannot be sent again.
         if (reqStreamRead > 0 &&
@@ -398,7 +439,8 @@ bool CredRequestPrivate::RewindStreams(bool cutResponse) {
         if (respStreamWritten > 0) {
             return false;
         }
-    } else if (respStream != nullptr && (cutResponse || respStreamWritten > 0)) {
+    } else if (respStream != nullptr && respStreamWritten > 0) {
+        // Only what the attempt wrote is cut off; bytes of the caller's behind the mark stay.
         // Buffered bytes of the failed attempt are flushed first: written after the cut, they
         // would land behind a hole at their old offset.
         fflush(respStream);

@@ -115,6 +115,12 @@ TEST_F(SettingsTest, RejectedArgumentsSetBadParam) {
         {[](CredRequest &r) { return r.AddRawParam(""); }, true, false},
         {[](CredRequest &r) { return r.SetDefaultTimeout(0); }, false, false},
         {[](CredRequest &r) { return r.SetEncryptMode(KOVA::CRED_REQ_CRYPTO(3)); }, false, false},
+        {[](CredRequest &r) { return r.SetTotalTimeout(-1); }, false, true},
+        {[](CredRequest &r) { return r.SetTotalTimeout(0); }, true, false},
+        {[](CredRequest &r) { return r.SetCAFile(""); }, false, true},
+        {[](CredRequest &r) { return r.SetCAFile("/etc/ssl/certs/ca-certificates.crt"); }, true,
+         false},
+        {[](CredRequest &r) { return r.SetPinnedPublicKey(""); }, false, true},
     };
     for (KOVA::CRED_REQ_ERR before : {KOVA::CRED_REQ_ERR_NONE, KOVA::CRED_REQ_ERR_BAD_PARAM}) {
         for (size_t i = 0; i < sizeof(cases) / sizeof(cases[0]); ++i) {
@@ -144,6 +150,17 @@ TEST_F(SettingsTest, DefaultsTimeoutsAndEncryptionModes) {
     EXPECT_TRUE(req.SetResponseTimeout(-7));
     EXPECT_EQ(req.GetResponseTimeout(), -7);
     EXPECT_TRUE(req.SetEncryptMode(KOVA::CRED_REQ_CRYPTO_AES));
+    // No deadline, the 64 MiB cap, and no transfer yet.
+    EXPECT_EQ(req.GetTotalTimeout(), 0);
+    EXPECT_FALSE(req.SetTotalTimeout(-5));
+    EXPECT_TRUE(req.SetTotalTimeout(2500));
+    EXPECT_EQ(req.GetTotalTimeout(), 2500);
+    EXPECT_EQ(req.GetMaxResponseSize(), size_t{64} << 20);
+    req.SetMaxResponseSize(0);
+    EXPECT_EQ(req.GetMaxResponseSize(), 0u);
+    EXPECT_EQ(req.GetCurlCode(), 0);
+    EXPECT_EQ(req.GetCurlErrorText(), "");
+    EXPECT_TRUE(req.GetTransferInfo().isNull());
 }
 
 // The encoders that read the document back: parameters (plain, JSON-formatted, under an unknown

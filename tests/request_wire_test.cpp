@@ -1,6 +1,8 @@
 // What reaches the server for each request setting: query strings, bodies and their
 // precedence, headers, cookies, the user agent, uploads and the request-stream limit.
+#include <errno.h>
 #include <stdio.h>
+#include <string.h>
 
 #include <fstream>
 #include <map>
@@ -205,6 +207,36 @@ TEST_F(WireTest, RequestStreamLimitCutsTheBodyUntilTheNextRequest) {
         if (constructAnother)
             KOVA::CredRequest other;
         EXPECT_EQ(Send(req).body, constructAnother ? "0123456789abcdef" : "0123");
+    }
+}
+
+// A request stream that hands out "part-" and then fails to read.
+ssize_t FailingRead(void *cookie, char *buf, size_t size) {
+    int &calls = *static_cast<int *>(cookie);
+    if (calls++ > 0 || size < 5) {
+        errno = EIO;
+        return -1;
+    }
+    memcpy(buf, "part-", 5);
+    return 5;
+}
+
+// A read error of the request stream aborts the transfer: the server never takes the part
+// that was sent for a whole body.
+TEST_F(WireTest, RequestStreamReadErrorAbortsTheTransfer) {
+    int calls = 0;
+    cookie_io_functions_t io = {FailingRead, nullptr, nullptr, nullptr};
+    File stream(fopencookie(&calls, "r", io));
+    ASSERT_TRUE(stream);
+    KOVA::CredRequest req;
+    ASSERT_TRUE(req.SetURL(Url("/echo")));
+    ASSERT_TRUE(req.SetReqStream(stream.get()));
+    EXPECT_FALSE(req.Process(true, 2));
+    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_CURL_OTHER);
+    EXPECT_EQ(req.GetCurlCode(), CURLE_ABORTED_BY_CALLBACK);
+    EXPECT_TRUE(kova_test::LogHas("CURL Error(42)")) << kova_test::LogDump();
+    for (const auto &r : server_.Requests()) {
+        EXPECT_EQ(r.body, "");  // the server saw no body it could take as whole
     }
 }
 

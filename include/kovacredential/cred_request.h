@@ -131,26 +131,33 @@ class KOVA_EXPORT CredRequest {
     void SetFollowLocation(bool follow);
     // Asks for any content encoding libcurl supports.
     void SetEncoding(bool encoding);
-    // A deadline for Process as a whole, in milliseconds: every attempt, the pauses between
-    // retries and name resolution included. A transfer it cuts short ends with
-    // CRED_REQ_ERR_TIMEOUT. 0 (the default) sets none; negative values set
-    // CRED_REQ_ERR_BAD_PARAM.
+    // A deadline for Process as a whole, in milliseconds, counted from the start of each
+    // Process: every attempt, the pauses between retries and name resolution included (libcurl
+    // is told not to wait for a resolver that has not answered, which finishes on its own
+    // thread). Each attempt gets what is left as its time limit; a retry, or its 1-second
+    // pause, that no longer fits is not made. Process then ends with CRED_REQ_ERR_TIMEOUT.
+    // Under the request manager it limits the transfer from Process(false) on. 0 (the default)
+    // sets none: the connect and response time-outs alone bound a transfer. Negative values
+    // set CRED_REQ_ERR_BAD_PARAM and change nothing. Read at every Process.
     bool SetTotalTimeout(long milliseconds);
     long GetTotalTimeout() const;
-    // The most a response held in memory (GetResponse) may grow to, in bytes: 64 MiB unless
-    // set; 0 lifts the cap. A larger answer ends the transfer with CRED_REQ_ERR_CURL_OTHER.
-    // Response streams and writers are never capped.
+    // The most a response held in memory (GetResponse) may grow to, in bytes: 64 MiB
+    // (67108864) unless set; 0 lifts the cap. An answer of exactly the cap comes back whole; a
+    // larger one ends the transfer with libcurl's write error, CRED_REQ_ERR_CURL_OTHER
+    // (GetCurlCode() 23). Decoded bytes count when SetEncoding is on. Response streams and
+    // writers are never capped. Read at every transfer.
     void SetMaxResponseSize(size_t bytes);
     size_t GetMaxResponseSize() const;
     // A file of trusted CA certificates (PEM) used instead of the system's bundle when
-    // certificates are checked (SetHTTPSVerify(true) or SetSSLVerify). False with
-    // CRED_REQ_ERR_BAD_PARAM for an empty path.
+    // certificates are checked (SetHTTPSVerify(true) or SetSSLVerify); the certificate must
+    // still name the host. A file that cannot be read fails the transfer. False with
+    // CRED_REQ_ERR_BAD_PARAM for an empty path. Read when the transfer is first set up.
     bool SetCAFile(const std::string &path);
     // Accepts the server only when its public key matches `pin`, in libcurl's pinned-key form
     // ("sha256//<Base64 of the SHA-256 of the DER public key>", several joined with ';'),
     // whether or not certificates are checked. A mismatch fails the transfer
     // (CRED_REQ_ERR_CURL_OTHER, GetCurlCode() 90). False with CRED_REQ_ERR_BAD_PARAM for an
-    // empty pin.
+    // empty pin. Read when the transfer is first set up.
     bool SetPinnedPublicKey(const std::string &pin);
 
     // ---- Results.
@@ -158,23 +165,34 @@ class KOVA_EXPORT CredRequest {
     void SetError(KOVA::_tag_CRED_REQ_ERR error);
     // The libcurl easy handle; null before the first transfer set-up. Owned by the request.
     CURL *GetCurlHandler();
+    // The response body held in memory when no response stream is set: at most
+    // GetMaxResponseSize() bytes (64 MiB unless set), the transfer failing with
+    // CRED_REQ_ERR_CURL_OTHER past that.
     std::string GetResponse();
     const Json::Value &GetResponseHeader();
     // The libcurl result of this request's last transfer attempt (CURLE_OK before any) and
     // libcurl's own text for it (the detailed message when libcurl gave one, else
     // curl_easy_strerror), so that a caller can name the cause behind a code such as
-    // CRED_REQ_ERR_CURL_OTHER. Per request, like GetError.
+    // CRED_REQ_ERR_CURL_OTHER. Per request, like GetError. Set by each attempt of Process; the
+    // text is "" before any.
     int GetCurlCode();
     std::string GetCurlErrorText();
     // Timing and connection facts of the last transfer, in seconds from its start:
     // {"namelookup", "connect", "tls", "firstByte", "total" (numbers), "reused" (true when it
     // rode a connection made earlier), "httpVersion" ("1.1", "2", ...), "remoteIp",
-    // "remotePort", "connects" (new connections it opened)}. Null before any transfer.
+    // "remotePort", "connects" (new connections it opened)}, taken after each attempt of
+    // Process; zeros and "" for what the attempt did not reach. Null before any transfer.
     Json::Value GetTransferInfo();
 
     // ---- Execution.
-    // Sets the transfer up and, when `perform`, runs it with up to `retries` further attempts.
-    // True only for HTTP status 200 (or a successful set-up when not performing).
+    // Sets the transfer up and, when `perform`, runs it with up to `retries` further attempts
+    // (within the total time-out, if one is set). True only for HTTP status 200 (or a
+    // successful set-up when not performing). A body held in memory is capped (see
+    // SetMaxResponseSize): a larger answer fails with CRED_REQ_ERR_CURL_OTHER. A response
+    // stream is cut back, before a retry, to where it stood when Process began only when the
+    // failed attempt wrote to it. In a process that gained privileges at exec (setuid, setgid,
+    // file capabilities) the invoker's proxy variables are ignored and, when this library
+    // initialises libcurl, SSLKEYLOGFILE is removed from the environment first.
     bool Process(bool perform = true, int retries = 0);
     // The error Process leaves for a transfer that ended with libcurl's `result` and, when that
     // is CURLE_OK, the HTTP `status`: CRED_REQ_ERR_NONE only for status 200. For callers that

@@ -1,0 +1,191 @@
+#include "support/tls_certs.h"
+
+#include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/sha.h>
+#include <openssl/x509.h>
+#include <openssl/x509v3.h>
+
+#include <chrono>
+
+#include <httplib.h>
+
+namespace kova_test {
+
+namespace {
+
+struct KeyFree {
+    void operator()(EVP_PKEY *key) const { EVP_PKEY_free(key); }
+};
+struct CertFree {
+    void operator()(X509 *cert) const { X509_free(cert); }
+};
+using KeyPtr = std::unique_ptr<EVP_PKEY, KeyFree>;
+using CertPtr = std::unique_ptr<X509, CertFree>;
+
+KeyPtr NewKey() {
+    return KeyPtr(EVP_EC_gen("P-256"));
+}
+
+// A certificate for `key` with the validity every test certificate has, not yet signed.
+CertPtr NewCertificate(EVP_PKEY *key, long serial) {
+    CertPtr cert(X509_new());
+    if (!cert) {
+        return cert;
+    }
+    X509_set_version(cert.get(), 2);
+    ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), serial);
+    X509_gmtime_adj(X509_getm_notBefore(cert.get()), -3600);
+    X509_gmtime_adj(X509_getm_notAfter(cert.get()), 7 * 24 * 3600);
+    X509_set_pubkey(cert.get(), key);
+    return cert;
+}
+
+bool AddExtension(X509 *cert, X509 *issuer, int nid, const char *value) {
+    X509V3_CTX ctx;
+    X509V3_set_ctx_nodb(&ctx);
+    X509V3_set_ctx(&ctx, issuer, cert, nullptr, nullptr, 0);
+    X509_EXTENSION *ext = X509V3_EXT_conf_nid(nullptr, &ctx, nid, value);
+    if (ext == nullptr) {
+        return false;
+    }
+    const bool added = X509_add_ext(cert, ext, -1) == 1;
+    X509_EXTENSION_free(ext);
+    return added;
+}
+
+template <typename Write>
+std::string Pem(Write write) {
+    BIO *bio = BIO_new(BIO_s_mem());
+    std::string text;
+    if (bio != nullptr && write(bio)) {
+        char *data = nullptr;
+        const long length = BIO_get_mem_data(bio, &data);
+        text.assign(data, static_cast<size_t>(length));
+    }
+    BIO_free(bio);
+    return text;
+}
+
+std::string Pin(EVP_PKEY *key) {
+    unsigned char *der = nullptr;
+    const int length = i2d_PUBKEY(key, &der);
+    if (length <= 0) {
+        return std::string();
+    }
+    unsigned char digest[SHA256_DIGEST_LENGTH];
+    SHA256(der, static_cast<size_t>(length), digest);
+    OPENSSL_free(der);
+    unsigned char base64[4 * ((SHA256_DIGEST_LENGTH + 2) / 3) + 1];
+    EVP_EncodeBlock(base64, digest, SHA256_DIGEST_LENGTH);
+    return "sha256//" + std::string(reinterpret_cast<char *>(base64));
+}
+
+}  // namespace
+
+struct TestCa::Keys {
+    KeyPtr key;
+    CertPtr cert;
+};
+
+TestCa::TestCa() : keys_(std::make_unique<Keys>()) {
+    keys_->key = NewKey();
+    if (!keys_->key) {
+        return;
+    }
+    keys_->cert = NewCertificate(keys_->key.get(), 1);
+    X509 *cert = keys_->cert.get();
+    if (cert == nullptr) {
+        return;
+    }
+    X509_NAME *name = X509_get_subject_name(cert);
+    X509_NAME_add_entry_by_txt(name, "CN", MBSTRING_ASC,
+                               reinterpret_cast<const unsigned char *>("kova test CA"), -1, -1, 0);
+    X509_set_issuer_name(cert, name);
+    if (!AddExtension(cert, cert, NID_basic_constraints, "critical,CA:TRUE") ||
+        !AddExtension(cert, cert, NID_key_usage, "critical,keyCertSign,cRLSign") ||
+        !AddExtension(cert, cert, NID_subject_key_identifier, "hash") ||
+        X509_sign(cert, keys_->key.get(), EVP_sha256()) == 0) {
+        return;
+    }
+    certPem_ = Pem([cert](BIO *bio) { return PEM_write_bio_X509(bio, cert) == 1; });
+}
+
+TestCa::~TestCa() = default;
+
+TlsIdentity TestCa::Issue(const std::string &subjectAltNames) const {
+    TlsIdentity identity;
+    static std::atomic<long> serial{2};
+    KeyPtr key = NewKey();
+    if (!key || certPem_.empty()) {
+        return identity;
+    }
+    CertPtr cert = NewCertificate(key.get(), serial++);
+    if (!cert) {
+        return identity;
+    }
+    X509 *issuer = keys_->cert.get();
+    X509_set_issuer_name(cert.get(), X509_get_subject_name(issuer));
+    if (!AddExtension(cert.get(), issuer, NID_basic_constraints, "critical,CA:FALSE") ||
+        !AddExtension(cert.get(), issuer, NID_ext_key_usage, "serverAuth") ||
+        !AddExtension(cert.get(), issuer, NID_authority_key_identifier, "keyid:always") ||
+        !AddExtension(cert.get(), issuer, NID_subject_alt_name, subjectAltNames.c_str()) ||
+        X509_sign(cert.get(), keys_->key.get(), EVP_sha256()) == 0) {
+        return identity;
+    }
+    identity.certPem = Pem([&](BIO *bio) { return PEM_write_bio_X509(bio, cert.get()) == 1; });
+    identity.keyPem = Pem([&](BIO *bio) {
+        return PEM_write_bio_PrivateKey(bio, key.get(), nullptr, nullptr, 0, nullptr, nullptr) == 1;
+    });
+    identity.pin = Pin(key.get());
+    return identity;
+}
+
+TlsServer::TlsServer(const TlsIdentity &identity) {
+    BIO *certBio =
+        BIO_new_mem_buf(identity.certPem.data(), static_cast<int>(identity.certPem.size()));
+    BIO *keyBio = BIO_new_mem_buf(identity.keyPem.data(), static_cast<int>(identity.keyPem.size()));
+    CertPtr cert(PEM_read_bio_X509(certBio, nullptr, nullptr, nullptr));
+    KeyPtr key(PEM_read_bio_PrivateKey(keyBio, nullptr, nullptr, nullptr));
+    BIO_free(certBio);
+    BIO_free(keyBio);
+    if (!cert || !key) {
+        return;
+    }
+    // The server's TLS context takes its own references to both.
+    server_ = std::make_unique<httplib::SSLServer>(cert.get(), key.get());
+    server_->Get("/ok", [this](const httplib::Request &, httplib::Response &res) {
+        ++requests_;
+        res.set_content("secure", "text/plain");
+    });
+}
+
+TlsServer::~TlsServer() {
+    if (thread_.joinable()) {
+        // stop() only ends a loop that runs: wait (bounded) until it does.
+        for (int i = 0; i < 500 && !server_->is_running(); ++i) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        }
+        server_->stop();
+        thread_.join();
+    }
+}
+
+bool TlsServer::Start() {
+    if (!server_ || !server_->is_valid()) {
+        return false;
+    }
+    port_ = server_->bind_to_any_port("127.0.0.1");
+    if (port_ <= 0) {
+        return false;
+    }
+    // The socket listens already; connections wait in its backlog until the loop runs.
+    thread_ = std::thread([this] { server_->listen_after_bind(); });
+    return true;
+}
+
+std::string TlsServer::Url() const {
+    return "https://127.0.0.1:" + std::to_string(port_) + "/ok";
+}
+
+}  // namespace kova_test
