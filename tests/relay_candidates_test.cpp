@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <future>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -202,6 +203,54 @@ TEST_F(RelayProbeTest, DeadSilentAndImpostorHostsAreSkipped) {
     }
     EXPECT_EQ(silent.ConnectionCount(), 1);
     EXPECT_EQ(probeHungUp, 1);
+}
+
+// With a deadline, six LAN addresses that accept and never answer (a minute and more of
+// probes without one) end the operation as soon as the deadline has passed: with error 10, no
+// tunnel asked for, and the plain service not tried after the HTTPS one ran out. Each call
+// runs on its own thread so that the test's wait for it is bounded.
+TEST_F(RelayCandidatesTest, DeadlineEndsProbesOfSilentHostsWithTimeout) {
+    kovasim::RawServer silent([](kovasim::RawServer::Connection &c) { c.WaitForClose(30000); },
+                              Addr(1));
+    ASSERT_TRUE(silent.Start());
+    const std::string port = std::to_string(silent.Port());
+    const std::string interfaces = kova_test::Fill(
+        R"([{"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}])",
+        {Addr(1)});
+    Serve(ParseJson(R"({"serverID": "S1", "interface": $0,
+                        "services": {"zon_https": {"port": $1}, "zon": {"port": $1}}})",
+                    {interfaces, port}));
+    const Json::Value info =
+        ParseJson(R"({"server": {"serverID": "S1", "interface": $0}, "service": {"port": $1}})",
+                  {interfaces, port});
+    const auto finishes = [](std::future<bool> &call) {
+        return call.wait_for(std::chrono::seconds(20)) == std::future_status::ready;
+    };
+
+    CredRequestFarlink client;
+    client.SetTotalTimeout(1500);
+    Json::Value candidate;
+    auto connInfo = std::async(std::launch::async,
+                               [&] { return client.GetAvailableConnInfo(info, candidate); });
+    ASSERT_TRUE(finishes(connInfo));
+    EXPECT_FALSE(connInfo.get());
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":10})"));
+    EXPECT_TRUE(Sim().Hits("request_tunnel").empty());
+    EXPECT_EQ(silent.ConnectionCount(), 1);
+
+    // The deadline is per operation: the next one has all of it again, and a later success
+    // does not depend on what an earlier operation used.
+    EXPECT_TRUE(client.GetSiteList(candidate));
+
+    Json::Value errors;
+    auto lookUp = std::async(std::launch::async, [&] {
+        return CredRequestFarlink::GetConnInfo("S1", candidate, &errors, 1500);
+    });
+    ASSERT_TRUE(finishes(lookUp));
+    EXPECT_FALSE(lookUp.get());
+    EXPECT_EQ(errors, ParseJson(R"({"code":10})"));
+    EXPECT_EQ(ServiceIdsAsked("get_server_info"), Names{"zon_https"});
+    EXPECT_TRUE(Sim().Hits("request_tunnel").empty());
 }
 
 TEST_F(RelayProbeTest, RelayAddressComesBeforeItsNameOnTheSamePort) {

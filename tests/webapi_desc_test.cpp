@@ -95,19 +95,34 @@ TEST_F(WebApiDescTest, UnknownApiSetsErrorSixAndIsQueriedAgain) {
     EXPECT_EQ("", format);
 }
 
+// "0,0,...,0" with `count` zeros.
+std::string ZeroList(size_t count) {
+    std::string list(2 * count - 1, ',');
+    for (size_t i = 0; i < list.size(); i += 2) {
+        list[i] = '0';
+    }
+    return list;
+}
+
 TEST_F(WebApiDescTest, UnusableAnswersAreNotCached) {
     const struct {
         std::string body;
         const char *log;
-    } cases[] = {{"<html><body>It works</body></html>", "Query response is invalid"},
-                 {"{\"success\":false,\"error\":{\"code\":105}}", "Query request fail!"},
-                 {"[\"success\"]", "Query request fail!"},
-                 {"{\"success\":true,\"data\":{\"x\":" + std::string(1000, '[') +
-                      std::string(1000, ']') + "}}",
-                  "Query response is invalid"}};
+    } cases[] = {
+        {"<html><body>It works</body></html>", "Query response is invalid"},
+        {"{\"success\":false,\"error\":{\"code\":105}}", "Query request fail!"},
+        {"[\"success\"]", "Query request fail!"},
+        {"{\"success\":true,\"data\":{\"x\":" + std::string(1000, '[') + std::string(1000, ']') +
+             "}}",
+         "Query response is invalid"},
+        // Values that would take far more memory than their text (about 100 bytes
+        // for each "0,"), and a description too large to keep for the process's life.
+        {"{\"success\":true,\"data\":[" + ZeroList(500000) + "]}", "Query response is invalid"},
+        {"{\"success\":true,\"data\":{\"x\":{\"path\":\"" + std::string(17000000, 'p') + "\"}}}",
+         "Query response is invalid"}};
     int id = 7;
     for (const auto &c : cases) {
-        SCOPED_TRACE(c.body);
+        SCOPED_TRACE(c.body.substr(0, 80));
         ClearLog();
         KOVA_CRED cred;
         auto server = FixedQuery(c.body, cred, ++id);
