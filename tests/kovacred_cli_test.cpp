@@ -26,10 +26,12 @@
 
 #include "kovacredential/kovacredential.h"
 #include "platform/json_text.h"
+#include "simlib/fault_server.h"
 #include "simlib/loopback_server.h"
 #include "store_fixture.h"
 #include "support/sim_process.h"
 #include "support/temp_dir.h"
+#include "support/tls_certs.h"
 
 namespace kova_test {
 namespace {
@@ -225,7 +227,7 @@ TEST_F(KovacredTest, FailuresPrintOneLineWithTheCodesNameAndExitNonZero) {
          "query failed)\n"},
         {"request http://127.0.0.1:1/", 20,
          "kovacred: request failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
-         "failed)\n"},
+         "failed): curl 7: Failed to connect to 127.0.0.1 port 1 "},
         // Causes the tool finds before the library runs.
         {"request ftp://127.0.0.1/", 1,
          "kovacred: request failed: unsupported scheme \"ftp\" (http or https)\n"},
@@ -238,18 +240,20 @@ TEST_F(KovacredTest, FailuresPrintOneLineWithTheCodesNameAndExitNonZero) {
         // A server that is down is named by the description query of login, call and apis.
         {"login 2", 20,
          "kovacred: login failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
-         "failed)\n"},
+         "failed): curl 7: "},
         {"call 2 KOVA.Demo.Echo 1 echo", 20,
          "kovacred: call KOVA.Demo.Echo failed (error 20 CRED_REQ_ERR_CONNECT: connecting or "
-         "receiving failed)\n"},
+         "receiving failed): curl 7: "},
         {"apis 2", 20,
          "kovacred: apis failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
-         "failed)\n"},
+         "failed): curl 7: "},
     };
+    // One line each, which starts with (or, ending in a newline, is) the expected text.
     for (const auto &c : cases) {
         Result r = Run(c.args);
         EXPECT_EQ(r.status, c.status) << c.args << ": " << r.err;
-        EXPECT_EQ(r.err, c.err) << c.args;
+        EXPECT_EQ(r.err.substr(0, c.err.size()), c.err) << c.args;
+        EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
         EXPECT_EQ(r.out, "") << c.args;
     }
     // -v copies the library's log records to standard error.
@@ -483,6 +487,13 @@ TEST_F(KovacredTest, RequestSendsItsOptionsAndPrintsTextOrJson) {
     EXPECT_EQ(answer["status"], 200);
     EXPECT_EQ(answer["headers"]["X-Answer"], "42");
     EXPECT_EQ(answer["body"], "POST /echo b=y H= C=");
+    answer = ParseOut(Run("request --timing --json " + url).out);
+    EXPECT_GT(answer["timing"]["total"].asDouble(), 0) << answer.toStyledString();
+    EXPECT_EQ(answer["timing"]["reused"], false);
+    EXPECT_TRUE(std::regex_match(
+        Run("request --timing " + url).err,
+        std::regex("kovacred: timing: name lookup [0-9.]+ s, connect [0-9.]+ s, TLS [0-9.]+ s, "
+                   "first byte [0-9.]+ s, total [0-9.]+ s, reused no\n")));
 
     EXPECT_EQ(Run("probe " + url).out, "reachable\n");
     EXPECT_EQ(ParseOut(Run("probe --json " + url).out),
@@ -515,7 +526,7 @@ TEST_F(KovacredTest, RequestOutputReplacesItsFileOnlyOnSuccess) {
     } cases[] = {
         {"http://127.0.0.1:1/", 20, "keep\n",
          "kovacred: request failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
-         "failed)\n"},
+         "failed): curl 7: Failed to connect to 127.0.0.1 port 1 "},
         {"--fail " + server.BaseUrl() + "/gone", 14, "keep\n",
          "kovacred: request failed (error 14 CRED_REQ_ERR_HTTP_CLIENT: HTTP status 400 to "
          "499)\n"},
@@ -526,7 +537,7 @@ TEST_F(KovacredTest, RequestOutputReplacesItsFileOnlyOnSuccess) {
         std::ofstream(file) << "keep\n";
         Result r = Run("request -o " + file + " " + c.args);
         EXPECT_EQ(r.status, c.status) << c.args;
-        EXPECT_EQ(r.err, c.err) << c.args;
+        EXPECT_EQ(c.err.empty() ? r.err : r.err.substr(0, c.err.size()), c.err) << c.args;
         EXPECT_EQ(ReadFile(file), c.file) << c.args;
         std::string listing;
         RunCommand("ls -A " + dir, &listing);
@@ -670,6 +681,103 @@ TEST_F(KovacredTest, BatchInterruptedPrintsWhatFinished) {
         std::regex_search(ReadFile(out), std::regex("\n0 +http://[^ ]+/slow +cancelled +- +-\n")))
         << ReadFile(out);
     EXPECT_EQ(ReadFile(err), "kovacred: batch: interrupted: 0 of 1 calls finished, 1 cancelled\n");
+}
+
+// --verify, --cacert and --pin check the server of request, login, call, apis and batch (the
+// library's default checks nothing); --max-time bounds them; a failure names libcurl's cause.
+TEST_F(KovacredTest, TransportOptionsCheckTheServerAndBoundTheTime) {
+    kova_test::TestCa ca;
+    const kova_test::TlsIdentity identity = ca.Issue("IP:127.0.0.1");
+    kova_test::TlsServer tls(identity);
+    ASSERT_TRUE(tls.Start());
+    const std::string caFile = db_.dir().File("ca.pem");
+    std::ofstream(caFile) << ca.CertPem();
+    const std::string known = db_.dir().File("known_servers");
+    const std::string server = tls.Url().substr(8, tls.Url().find("/ok") - 8);
+    const std::string unverified =
+        "failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other libcurl failure): curl 60: ";
+
+    Result r = Run("request " + tls.Url());
+    EXPECT_EQ(r.out, "secure") << r.err;
+    r = Run("request --verify " + tls.Url());
+    EXPECT_EQ(r.status, 12);
+    EXPECT_EQ(r.err.rfind("kovacred: request " + unverified, 0), 0u) << r.err;
+    EXPECT_EQ(Run("request --cacert " + caFile + " " + tls.Url()).out, "secure");
+
+    // Trust on first use: the key is recorded, then required.
+    r = Run("request --pin " + tls.Url());
+    EXPECT_EQ(r.out, "secure");
+    EXPECT_EQ(r.err, "kovacred: pinned the public key of " + server + " (" + identity.pin +
+                         ") in " + known + "\n");
+    EXPECT_EQ(ReadFile(known), server + " " + identity.pin + "\n");
+    struct stat st;
+    ASSERT_EQ(stat(known.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0600u);
+    r = Run("request --pin " + tls.Url());
+    EXPECT_EQ(r.out, "secure");
+    EXPECT_EQ(r.err, "");
+    const std::string other = ca.Issue("IP:127.0.0.1").pin;
+    std::ofstream(known) << server << " " << other << "\n";
+    const int served = tls.Requests();
+    r = Run("request --pin " + tls.Url());
+    EXPECT_EQ(r.status, 12);
+    EXPECT_EQ(r.err,
+              "kovacred: request failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other "
+              "libcurl failure): the public key of " +
+                  server + " has changed: known " + other + ", now " + identity.pin +
+                  "; if the change is expected, delete the line of " + server + " from " + known +
+                  " and run again\n");
+    EXPECT_EQ(tls.Requests(), served) << "the request reached a server with another key";
+
+    // The WebAPI commands against the simulator's self-signed certificate.
+    Add("admin", "secret", true);
+    for (const std::string command : {"login 1", "apis 1", "call 1 KOVA.Demo.Echo 1 echo"}) {
+        r = Run(command + " --verify");
+        EXPECT_EQ(r.status, 12) << command;
+        EXPECT_NE(r.err.find(unverified), std::string::npos) << command << ": " << r.err;
+    }
+    EXPECT_TRUE(std::regex_search(
+        Run("batch - --verify", R"([{"cred": 1, "api": "KOVA.Demo.Echo", "version": 1,
+                                    "method": "echo"}])")
+            .err,
+        std::regex("call 0: the API description \\(error 12 [^\n]*curl 60: ")));
+    r = Run("login 1 --pin");
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_NE(ReadFile(known).find("127.0.0.1:" + std::to_string(sim_->HttpsPort()) + " sha256//"),
+              std::string::npos);
+
+    // A server that never answers.
+    kovasim::FaultServer silent(kovasim::Fault::kSilent);
+    ASSERT_TRUE(silent.Start());
+    r = Run("request --max-time 0.5 " + silent.BaseUrl() + "/");
+    EXPECT_EQ(r.status, 10);
+    EXPECT_NE(r.err.find("(error 10 CRED_REQ_ERR_TIMEOUT: operation timed out): curl 28: "),
+              std::string::npos)
+        << r.err;
+    ASSERT_EQ(Run("add --host 127.0.0.1 --port " + std::to_string(silent.Port()) +
+                      " --protocol http --account a",
+                  "pw\n")
+                  .status,
+              0);
+    r = Run("login 2 --max-time 0.5");
+    EXPECT_EQ(r.status, 10) << r.err;
+    EXPECT_EQ(r.err.rfind("kovacred: login failed (error 10 CRED_REQ_ERR_TIMEOUT", 0), 0u) << r.err;
+}
+
+// A body larger than the in-memory cap is refused with the way out.
+TEST_F(KovacredTest, RequestPastTheMemoryCapSaysUseOutputFile) {
+    kovasim::LoopbackServer server;
+    server.Route("GET", "/big", [](const httplib::Request &, httplib::Response &res) {
+        res.set_content(std::string((size_t{64} << 20) + 1, 'x'), "application/octet-stream");
+    });
+    ASSERT_TRUE(server.Start());
+    Result r = Run("request " + server.BaseUrl() + "/big");
+    EXPECT_EQ(r.status, 12);
+    EXPECT_EQ(r.err,
+              "kovacred: request failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other libcurl "
+              "failure): the answer is larger than the 67108864 bytes held in memory; use -o "
+              "FILE\n");
+    EXPECT_TRUE(r.out.empty()) << r.out.size() << " bytes on standard output";
 }
 
 // The completion function run in bash, as bash-completion runs it.

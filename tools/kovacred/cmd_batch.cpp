@@ -3,6 +3,7 @@
 // their transfers run together over one libcurl multi handle driven here, so that each
 // transfer's end is seen as it happens: for the progress line and each call's own time.
 #include <signal.h>
+#include <stdlib.h>
 #include <stdint.h>
 #include <stdio.h>
 #include <unistd.h>
@@ -86,8 +87,31 @@ bool ReadCalls(const std::string &path, Json::Value &calls, std::string &problem
     return true;
 }
 
+// The transport for the server at scheme://host:port, readied on its first use; null with
+// the reason in `call` when it cannot be.
+const Transport *ServerTransport(const Transport &options,
+                                 std::map<std::string, Transport> &servers,
+                                 const std::string &scheme, const std::string &host, int port,
+                                 Call &call) {
+    const std::string key = scheme + "://" + host + ":" + std::to_string(port);
+    auto found = servers.find(key);
+    if (found != servers.end()) {
+        return &found->second;
+    }
+    Transport transport = options;
+    const int exitCode = gExitCode;
+    if (!PrepareTransport("batch", transport, scheme, host, port)) {
+        gExitCode = exitCode;
+        call.problem = "the transport options cannot be used for " + key;
+        return nullptr;
+    }
+    return &servers.emplace(key, transport).first->second;
+}
+
 // Adds one call to the manager; on failure leaves the reason and the error code in `call`.
-void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call) {
+// Each server's transport is readied once (`servers`, by "scheme://host:port").
+void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call,
+             const Transport &options, std::map<std::string, Transport> &servers) {
     call.code = KOVA::CRED_REQ_ERR_BAD_PARAM;
     if (!item.isObject()) {
         call.problem = "not an object";
@@ -100,7 +124,17 @@ void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call) {
             return;
         }
         call.target = item["url"].asString();
+        std::string scheme;
+        std::string host;
+        std::string port;
+        KOVA::CredRequestUtil::ParseURL(call.target, scheme, host, port);
+        const Transport *transport =
+            ServerTransport(options, servers, scheme, host, atoi(port.c_str()), call);
+        if (transport == nullptr) {
+            return;
+        }
         std::unique_ptr<KOVA::CredRequest> request(new KOVA::CredRequest());
+        ApplyTransport(*transport, *request);
         if (!request->SetURL(call.target)) {
             call.problem = "bad url";
             call.code = request->GetError();
@@ -135,10 +169,21 @@ void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call) {
         call.problem = "no credential with id " + std::to_string(call.credId);
         return;
     }
-    // A login the manager would make is made here, so that its failure is named as the login
-    // command names it.
-    KOVA_CRED_SESS sess;
+    // The description query and the login the manager would make are made here, so that the
+    // transport options apply to the query and a failure is named as login names it.
+    const Transport *transport =
+        ServerTransport(options, servers, cred.protocol, cred.host, cred.port, call);
+    if (transport == nullptr) {
+        return;
+    }
+    Json::Value desc;
     std::string failure;
+    if (!KOVA::CredRequestUtil::IsCredIdCached(call.credId) &&
+        !FetchDescription(cred, *transport, desc, failure, call.code)) {
+        call.problem = "the API description " + failure;
+        return;
+    }
+    KOVA_CRED_SESS sess;
     if ((KOVACredSessGetByID(call.credId, &sess) < 0 || sess.filled == 0) &&
         !LogIn(cred, "", failure, call.code)) {
         call.problem = "login failed (" + failure + ")";
@@ -148,6 +193,7 @@ void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call) {
     call.index = mgr.AddWebAPIRequest(call.credId, item["api"].asString(), item["version"].asInt(),
                                       item["method"].asString(), params);
     if (call.index >= 0) {
+        ApplyTransport(*transport, *mgr.GetRequest(call.index));
         call.code = 0;
         return;
     }
@@ -334,7 +380,7 @@ bool UsesCredentials(const Json::Value &items) {
     return false;
 }
 
-void RunBatch(const std::string &path, bool json) {
+void RunBatch(const std::string &path, bool json, const Transport &options) {
     Json::Value items;
     std::string problem;
     if (!ReadCalls(path, items, problem)) {
@@ -345,6 +391,7 @@ void RunBatch(const std::string &path, bool json) {
         return;
     }
     const InterruptCatcher catcher;
+    std::map<std::string, Transport> servers;
     KOVA::CredRequestMgr mgr;
     std::vector<Call> calls(items.size());
     for (Json::ArrayIndex i = 0; i < items.size(); ++i) {
@@ -352,7 +399,7 @@ void RunBatch(const std::string &path, bool json) {
             calls[i].cancelled = true;
             continue;
         }
-        AddCall(mgr, items[i], calls[i]);
+        AddCall(mgr, items[i], calls[i], options, servers);
         if (calls[i].index < 0) {
             fprintf(stderr, "kovacred: batch: call %u: %s\n", i, calls[i].problem.c_str());
         }
@@ -411,14 +458,16 @@ const Registrar registrar([](CLI::App &app) {
         "batch", "run a JSON array of calls together and summarise their outcomes");
     auto path = std::make_shared<std::string>();
     auto json = std::make_shared<bool>(false);
+    auto transport = std::make_shared<Transport>();
     cmd->add_option("FILE", *path,
                     "JSON array of {\"cred\", \"api\", \"version\", \"method\", \"params\"} "
                     "or {\"url\"} calls; - reads standard input")
         ->required();
     AddJsonFlag(cmd, json.get());
-    cmd->callback([path, json] {
+    AddTransportOptions(cmd, transport.get());
+    cmd->callback([path, json, transport] {
         try {
-            RunBatch(*path, *json);
+            RunBatch(*path, *json, *transport);
         } catch (const std::exception &e) {
             FailText(std::string("batch: ") + e.what());
         }

@@ -44,6 +44,7 @@ struct RequestOptions {
     Transport transport;
     bool noFollow = false;
     bool fail = false;
+    bool timing = false;
     bool json = false;
 };
 
@@ -139,14 +140,29 @@ bool SplitPair(const std::string &text, char sep, std::string &name, std::string
     return true;
 }
 
-// A failed transfer: the library's code, and what the tool can tell of the cause.
-int FailRequest(KOVA::CredRequest &req, bool inMemory) {
-    (void)inMemory;
-    return Fail("request", req.GetError());
+// A failed transfer: the library's code, and the cause libcurl gave.
+int FailRequest(KOVA::CredRequest &req, bool inMemory, const Transport &transport) {
+    if (inMemory && req.GetCurlCode() == CURLE_WRITE_ERROR) {
+        FailText("request failed (" + ErrorText(req.GetError()) +
+                 "): the answer is larger than the " + std::to_string(req.GetMaxResponseSize()) +
+                 " bytes held in memory; use -o FILE");
+        gExitCode = req.GetError();
+        return gExitCode;
+    }
+    return FailTransfer("request", req, &transport);
 }
 
-int RunRequest(const RequestOptions &o) {
-    if (!CheckURL("request", o.url)) {
+// The scheme, host and port of `url`, for the transport options.
+bool PrepareFor(const std::string &what, const std::string &url, Transport &transport) {
+    std::string scheme;
+    std::string host;
+    std::string port;
+    KOVA::CredRequestUtil::ParseURL(url, scheme, host, port);
+    return PrepareTransport(what, transport, scheme, host, atoi(port.c_str()));
+}
+
+int RunRequest(RequestOptions &o) {
+    if (!CheckURL("request", o.url) || !PrepareFor("request", o.url, o.transport)) {
         return gExitCode;
     }
     KOVA::CredRequest req;
@@ -234,8 +250,11 @@ int RunRequest(const RequestOptions &o) {
     if (req.GetCurlHandler() != nullptr) {
         curl_easy_getinfo(req.GetCurlHandler(), CURLINFO_RESPONSE_CODE, &status);
     }
-    if (!done && (status == 0 || (o.fail && status >= 400))) {
-        return FailRequest(req, o.output.empty());
+    if (!done && (req.GetCurlCode() != CURLE_OK || status == 0 || (o.fail && status >= 400))) {
+        return FailRequest(req, o.output.empty(), o.transport);
+    }
+    if (o.timing && !o.json) {
+        PrintTiming(req);
     }
     if (!done) {
         fprintf(stderr, "kovacred: request: HTTP status %ld (%s)\n", status,
@@ -256,6 +275,9 @@ int RunRequest(const RequestOptions &o) {
         out["url"] = o.url;
         out["status"] = static_cast<Json::Int64>(status);
         out["headers"] = req.GetResponseHeader();
+        if (o.timing) {
+            out["timing"] = req.GetTransferInfo();
+        }
         if (output) {
             out["output"] = o.output;
             out["bytes"] = static_cast<Json::Int64>(written);
@@ -302,6 +324,8 @@ void RegisterRequestCommands(CLI::App &app) {
     request->add_flag("--headers", opts->showHeaders, "print the response headers as JSON first");
     AddTransportOptions(request, &opts->transport);
     request->add_flag("--no-follow", opts->noFollow, "do not follow redirects");
+    request->add_flag("--timing", opts->timing,
+                      "show the transfer's timing on standard error (in the JSON with --json)");
     request->add_flag("-f,--fail", opts->fail,
                       "fail (no output) when the HTTP status is 400 or more");
     AddJsonFlag(request, &opts->json);
@@ -310,18 +334,30 @@ void RegisterRequestCommands(CLI::App &app) {
     struct ProbeOptions {
         std::string url;
         bool json = false;
+        Transport transport;
     };
     auto probeOpts = std::make_shared<ProbeOptions>();
     CLI::App *probe = app.add_subcommand("probe", "check that a GET of URL answers 200");
     probe->add_option("url", probeOpts->url, "address to probe")->required();
     AddJsonFlag(probe, &probeOpts->json);
+    AddTransportOptions(probe, &probeOpts->transport);
     probe->callback([probeOpts] {
-        if (!CheckURL("probe", probeOpts->url)) {
+        if (!CheckURL("probe", probeOpts->url) ||
+            !PrepareFor("probe", probeOpts->url, probeOpts->transport)) {
             return;
         }
+        // The library's probe (a GET with a 10-second connect time-out), made here so that the
+        // transport options apply and the cause of a failure is known.
         KOVA::CredRequest req;
-        if (!req.isURLValid(probeOpts->url)) {
-            Fail("probe", KOVA::CredRequestUtil::m_errCode);
+        req.SetURL(probeOpts->url);
+        req.SetDefaultTimeout(10);
+        ApplyTransport(probeOpts->transport, req);
+        if (!req.Process(true, 0)) {
+            const std::string cause = TransferCause(req);
+            fprintf(stderr, "kovacred: probe failed (%s)%s%s\n",
+                    ErrorText(KOVA::CRED_REQ_ERR_QUERY_FAIL).c_str(), cause.empty() ? "" : ": ",
+                    cause.c_str());
+            gExitCode = KOVA::CRED_REQ_ERR_QUERY_FAIL;
             return;
         }
         if (probeOpts->json) {

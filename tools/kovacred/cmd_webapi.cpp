@@ -60,39 +60,20 @@ bool LoadCred(const std::string &what, int id, KOVA_CRED &cred) {
     return true;
 }
 
-// The credential's API description, asked for by a request of the tool's own (the query
-// the library would make), so that the command line's transport options apply to it and a
-// failure names its cause. The answer goes into the library's description cache, where its
-// login and request factory find it instead of asking again. False after the failure line.
-bool FetchDescription(const std::string &what, const KOVA_CRED &cred, const Transport &transport,
+// The credential's API description for a command (see the other FetchDescription), after
+// readying the transport for its server; false after the failure line.
+bool FetchDescription(const std::string &what, const KOVA_CRED &cred, Transport &transport,
                       Json::Value &desc) {
-    CredRequest request;
-    if (!request.SetURL(cred.protocol, cred.host, cred.port, "webapi/query.cgi")) {
-        FailTransfer(what, request);
+    std::string failure;
+    long code = 0;
+    if (!PrepareTransport(what, transport, cred.protocol, cred.host, cred.port)) {
         return false;
     }
-    Json::Value params(Json::objectValue);
-    params["api"] = "KOVA.API.Info";
-    params["version"] = 1;
-    params["method"] = "query";
-    request.AddPostParam(params);
-    request.SetResponseTimeout(30);
-    request.SetEncoding(true);
-    ApplyTransport(transport, request);
-    if (!request.Process(true, 0)) {
-        FailTransfer(what, request);
+    if (!FetchDescription(cred, transport, desc, failure, code)) {
+        fprintf(stderr, "kovacred: %s failed %s\n", what.c_str(), failure.c_str());
+        gExitCode = code >= 1 && code <= 255 ? static_cast<int>(code) : 1;
         return false;
     }
-    Json::Value answer;
-    if (!ParseJson(request.GetResponse(), answer) || !answer.isObject() ||
-        !answer["success"].isBool() || !answer["success"].asBool() || !answer["data"].isObject()) {
-        FailText(what + " failed (" + ErrorText(KOVA::CRED_REQ_ERR_QUERY_FAIL) +
-                 "): the server's API description is not usable");
-        gExitCode = KOVA::CRED_REQ_ERR_QUERY_FAIL;
-        return false;
-    }
-    desc = answer["data"];
-    CredRequestUtil::m_jsData["webapiDesc"][std::to_string(cred.id)] = desc;
     return true;
 }
 
@@ -124,6 +105,39 @@ bool LogIn(KOVA_CRED &cred, const std::string &otp, std::string &failure, long &
     return false;
 }
 
+bool FetchDescription(const KOVA_CRED &cred, const Transport &transport, Json::Value &desc,
+                      std::string &failure, long &code) {
+    CredRequest request;
+    if (!request.SetURL(cred.protocol, cred.host, cred.port, "webapi/query.cgi")) {
+        code = request.GetError();
+        failure = TransferFailure(request);
+        return false;
+    }
+    Json::Value params(Json::objectValue);
+    params["api"] = "KOVA.API.Info";
+    params["version"] = 1;
+    params["method"] = "query";
+    request.AddPostParam(params);
+    request.SetResponseTimeout(30);
+    request.SetEncoding(true);
+    ApplyTransport(transport, request);
+    if (!request.Process(true, 0)) {
+        code = request.GetError();
+        failure = TransferFailure(request, &transport);
+        return false;
+    }
+    Json::Value answer;
+    if (!ParseJson(request.GetResponse(), answer) || !answer.isObject() ||
+        !answer["success"].isBool() || !answer["success"].asBool() || !answer["data"].isObject()) {
+        code = KOVA::CRED_REQ_ERR_QUERY_FAIL;
+        failure = "(" + ErrorText(code) + "): the server's API description is not usable";
+        return false;
+    }
+    desc = answer["data"];
+    CredRequestUtil::m_jsData["webapiDesc"][std::to_string(cred.id)] = desc;
+    return true;
+}
+
 namespace {
 
 // The session of credential `id` the library's factory will use: the stored one, or one a
@@ -143,7 +157,7 @@ bool HaveSession(const std::string &what, KOVA_CRED &cred) {
     return false;
 }
 
-void RunLogin(const LoginOptions &opts) {
+void RunLogin(LoginOptions &opts) {
     KOVA_CRED cred;
     if (!LoadCred("login", opts.id, cred)) {
         return;
@@ -164,14 +178,24 @@ void RunLogin(const LoginOptions &opts) {
            opts.id);
 }
 
-void RunLogout(int id) {
+struct LogoutOptions {
+    int id = 0;
+    Transport transport;
+};
+
+void RunLogout(LogoutOptions &opts) {
+    const int id = opts.id;
     KOVA_CRED cred;
+    Json::Value desc;
     if (!LoadCred("logout", id, cred)) {
         return;
     }
     KOVA_CRED_SESS sess;
     if (KOVACredSessGetByID(id, &sess) < 0 || sess.filled == 0) {
         FailText("logout failed: no stored session for credential " + std::to_string(id));
+        return;
+    }
+    if (!FetchDescription("logout", cred, opts.transport, desc)) {
         return;
     }
     if (!CredRequestUtil::Logout(&cred, &sess)) {
@@ -191,10 +215,11 @@ struct CallOptions {
     std::string params;
     std::vector<std::string> files;
     bool json = false;
+    bool timing = false;
     Transport transport;
 };
 
-void RunCall(const CallOptions &opts) {
+void RunCall(CallOptions &opts) {
     Json::Value params(Json::objectValue);
     if (!opts.params.empty()) {
         if (!ParseJson(opts.params, params) || !params.isObject()) {
@@ -248,8 +273,12 @@ void RunCall(const CallOptions &opts) {
             return;
         }
     }
-    if (!request->Process(true, 0)) {
-        FailTransfer(what, *request);
+    const bool done = request->Process(true, 0);
+    if (opts.timing) {
+        PrintTiming(*request);
+    }
+    if (!done) {
+        FailTransfer(what, *request, &opts.transport);
         return;
     }
     Json::Value answer;
@@ -278,7 +307,7 @@ struct ApisOptions {
     Transport transport;
 };
 
-void RunApis(const ApisOptions &opts) {
+void RunApis(ApisOptions &opts) {
     KOVA_CRED cred;
     if (!LoadCred("apis", opts.id, cred)) {
         return;
@@ -323,11 +352,12 @@ void RegisterWebApi(CLI::App &app) {
     AddTransportOptions(loginCmd, &login->transport);
     loginCmd->callback([login] { RunLogin(*login); });
 
-    auto logoutId = std::make_shared<int>(0);
+    auto logout = std::make_shared<LogoutOptions>();
     CLI::App *logoutCmd =
         app.add_subcommand("logout", "log the stored session out and remove it from the store");
-    AddIdArgument(logoutCmd, logoutId.get());
-    logoutCmd->callback([logoutId] { RunLogout(*logoutId); });
+    AddIdArgument(logoutCmd, &logout->id);
+    AddTransportOptions(logoutCmd, &logout->transport);
+    logoutCmd->callback([logout] { RunLogout(*logout); });
 
     auto call = std::make_shared<CallOptions>();
     CLI::App *callCmd = app.add_subcommand(
@@ -343,6 +373,7 @@ void RegisterWebApi(CLI::App &app) {
     callCmd->add_option("--file", call->files, "upload a file as FIELD=PATH")
         ->allow_extra_args(false);
     AddJsonFlag(callCmd, &call->json);
+    callCmd->add_flag("--timing", call->timing, "show the call's timing on standard error");
     AddTransportOptions(callCmd, &call->transport);
     callCmd->callback([call] { RunCall(*call); });
 

@@ -4,6 +4,7 @@
 #ifndef KOVACRED_COMMANDS_H
 #define KOVACRED_COMMANDS_H
 
+#include <chrono>
 #include <functional>
 #include <string>
 #include <vector>
@@ -78,23 +79,61 @@ int FailStore(const std::string &what);
 
 // ---- Transfers.
 
-// How the tool's requests reach a server: certificate checks and time limits. The library's
-// defaults (no checks) stay unless a command line asks.
+// How the tool's requests reach a server: certificate checks, a public key pinned on first
+// use, and a time limit. The library's defaults (no checks, no limit) stay unless a command
+// line asks.
 struct Transport {
     bool verify = false;
+    std::string caFile;  // --cacert
+    bool pin = false;
+    double maxTime = 0;  // seconds; 0: none
+    // Set by PrepareTransport when pinning: "host:port" and the key it must show.
+    std::string server;
+    std::string pinned;
+    std::chrono::steady_clock::time_point start = std::chrono::steady_clock::now();
+
+    // What is left of --max-time, in milliseconds (at least 1); 0 without a limit.
+    long MaxTimeMs() const;
 };
 
-// Adds --verify to a command that makes requests.
+// Adds --verify, --cacert, --pin and --max-time to a command that makes requests.
 void AddTransportOptions(CLI::App *cmd, Transport *transport);
+
+// Readies `transport` for the server at scheme://host:port before the first request: checks
+// the CA file and, with --pin, finds the key the server must show in the known-servers file
+// next to the database, or (first use) records the key it shows now. False after the failure
+// line.
+bool PrepareTransport(const std::string &what, Transport &transport, const std::string &scheme,
+                      const std::string &host, int port);
 
 // Applies `transport` to a request before it runs.
 void ApplyTransport(const Transport &transport, KOVA::CredRequest &request);
 
-// The failure line of a transfer that did not end with status 200: the library's code and,
-// behind it, the cause as far as it is known. Sets the exit status as Fail and returns it.
-int FailTransfer(const std::string &what, KOVA::CredRequest &request);
+// libcurl's code and text behind a failed transfer ("curl 7: Failed to connect ..."), "" when
+// libcurl reported nothing.
+std::string TransferCause(KOVA::CredRequest &request);
 
-// ---- Logging in.
+// "(<ErrorText of the library's code>)[: <cause>]" of a failed transfer.
+std::string TransferFailure(KOVA::CredRequest &request, const Transport *transport = nullptr);
+
+// The failure line of a transfer that did not end with status 200: "<what> failed (<the
+// library's code>): <the cause>", where a key that does not match its pin is shown with both
+// fingerprints and how to accept the new one. Sets the exit status as Fail and returns it.
+int FailTransfer(const std::string &what, KOVA::CredRequest &request,
+                 const Transport *transport = nullptr);
+
+// "kovacred: timing: name lookup 0.000 s, connect ..., reused no" on standard error, from
+// the request's transfer facts.
+void PrintTiming(KOVA::CredRequest &request);
+
+// ---- WebAPI.
+
+// The credential's API description, asked for by a request of the tool's own (the query the
+// library would make), so that the transport options apply to it and a failure names its
+// cause. The answer goes into the library's description cache, where its login and request
+// factories find it instead of asking again. False with TransferFailure's text and the code.
+bool FetchDescription(const KOVA_CRED &cred, const Transport &transport, Json::Value &desc,
+                      std::string &failure, long &code);
 
 // Logs in with credential `cred` (the library's login, with the one-time code `otp` when not
 // empty) and stores the session; false with the failure's text ("server error 400: wrong

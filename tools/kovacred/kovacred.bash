@@ -4,10 +4,10 @@
 _kovacred_value_opts='--db --host --port --protocol --account --application --extra --owner
     --otp --params --file -q --query -d --data -H --header -b --cookie -F --upload
     --body-file -T --upload-file -o --output --format -r --retries --connect-timeout
-    --response-timeout'
+    --response-timeout --cacert --max-time'
 
 # The options of every command that makes requests.
-_kovacred_transfer_opts='--verify'
+_kovacred_transfer_opts='--verify --cacert --pin --max-time'
 
 # The ids `kovacred list` prints for the database the command line (or kovacredential_db)
 # names. A database that does not exist yet is not created for this.
@@ -45,7 +45,7 @@ _kovacred() {
     done
 
     case $prev in
-        --db | --body-file | -T | --upload-file | -o | --output)
+        --db | --body-file | -T | --upload-file | -o | --output | --cacert)
             _filedir
             return
             ;;
@@ -66,7 +66,7 @@ _kovacred() {
             ;;
         --host | --port | --account | --application | --extra | --owner | \
             --otp | --params | -q | --query | -d | --data | -H | --header | -b | --cookie | \
-            --format | -r | --retries | --connect-timeout | --response-timeout)
+            --format | -r | --retries | --connect-timeout | --response-timeout | --max-time)
             return
             ;;
     esac
@@ -75,16 +75,18 @@ _kovacred() {
     case $command/$sub in
         /) opts='--db --verbose --version --help' ;;
         add/) opts='--host --port --protocol --account --application --extra --owner --json' ;;
-        list/ | show/ | probe/ | batch/ | session/show) opts='--json' ;;
+        list/ | show/ | session/show) opts='--json' ;;
+        probe/ | batch/) opts="--json $_kovacred_transfer_opts" ;;
+        logout/) opts="$_kovacred_transfer_opts" ;;
         session/set) opts='--extra' ;;
         login/) opts="--otp $_kovacred_transfer_opts" ;;
         apis/) opts="--json $_kovacred_transfer_opts" ;;
-        call/) opts="--params --file --json $_kovacred_transfer_opts" ;;
-        resolve/) opts='--portal --json' ;;
+        call/) opts="--params --file --json --timing $_kovacred_transfer_opts" ;;
+        resolve/) opts='--portal --json --max-time' ;;
         request/)
             opts='--query --data --header --cookie --upload --body-file --upload-file --output
                 --format --retries --connect-timeout --response-timeout --headers --no-follow
-                --fail --json '"$_kovacred_transfer_opts"
+                --fail --timing --json '"$_kovacred_transfer_opts"
             ;;
     esac
     if [[ $cur == -* ]]; then
