@@ -621,6 +621,7 @@ TEST_F(KovacredTest, UsageErrorsExitTwoNamingTheWord) {
         {"add --host h --port 1 --account a --protocol ftp", "ftp"},
         {"add --host '' --port 1 --account a", "add: --host must not be empty"},
         {"add --host h --port 1 --account a --password x", "--password"},
+        {"session set 1 --sid S", "--sid"},
         {"request", "url is required"},
         {"request -d novalue http://127.0.0.1:1/", "bad --data novalue"},
     };
