@@ -2,14 +2,17 @@
 #   libkovacredential6     the shared library and its soname link (component runtime),
 #   libkovacredential-dev  headers, the .so link, kovacredential.pc, the CMake package and
 #                          libkovacredential(3) (component dev),
-#   kovacred               kovacred and kovasim, their manual pages and the bash completion
-#                          (component tools).
+#   kovacred               kovacred, its manual page and the bash completion (component tools),
+#   kovasim                the loopback simulator and its manual page (component sim), apart so
+#                          that kovacred neither installs it nor pulls in what only it needs
+#                          (cpp-httplib, zlib).
 #
-# lintian reports no error on them. The warnings left, and why:
-# - maintscript-calls-ldconfig (libkovacredential6, postinst and postrm): CPack writes these
-#   scripts for every library under /usr/lib. The ldconfig trigger above makes the call
-#   redundant, not harmful; replacing the scripts by empty ones only trades this warning for
-#   maintainer-script-empty.
+# The library package carries dpkg's ldconfig trigger and a symbols file. CPack checks the
+# library's symbols against doc/deb/libkovacredential6.symbols before it builds the packages
+# (doc/deb/check-symbols.cmake: a symbol missing fails the build) and afterwards takes out
+# the postinst and postrm that call ldconfig (doc/deb/drop-ldconfig-scripts.cmake).
+#
+# lintian reports no error on them. The warning left, and why:
 # - pkg-config-unavailable-for-cross-compilation (libkovacredential-dev): only for packages
 #   made from a build whose library folder is not the multiarch one (the test suite's build,
 #   prefix /usr/local, installs into lib/). scripts/package configures for /usr, which puts
@@ -25,7 +28,7 @@ set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
 set(CPACK_DEBIAN_PACKAGE_PRIORITY optional)
 set(CPACK_COMPONENTS_ALL runtime dev)
 if(KOVA_BUILD_TOOLS)
-  list(APPEND CPACK_COMPONENTS_ALL tools)
+  list(APPEND CPACK_COMPONENTS_ALL tools sim)
 endif()
 
 # The Debian architecture the packages are for: the build machine's, or a cross build's
@@ -48,22 +51,30 @@ else()
   # dpkg-shlibdeps looks the libraries up in the installed packages of the target
   # architecture, and a cross build has none: these are the dependencies it computes for the
   # native Debian 12 build. Package names and symbol versions are the same on every Debian
-  # architecture; the tools use cpp-httplib only through its header here.
+  # architecture; kovasim uses cpp-httplib only through its header here.
   set(KOVA_DEB_LIBRARY_DEPENDS "libc6 (>= 2.34), libcurl4 (>= 7.66.0), libgcc-s1 (>= 3.0), \
 libjsoncpp25 (>= 1.9.5), libsqlite3-0 (>= 3.6.5), libssl3 (>= 3.0.0), libstdc++6 (>= 12)")
   set(CPACK_DEBIAN_RUNTIME_PACKAGE_DEPENDS ${KOVA_DEB_LIBRARY_DEPENDS})
-  set(CPACK_DEBIAN_TOOLS_PACKAGE_DEPENDS "${KOVA_DEB_LIBRARY_DEPENDS}, zlib1g (>= 1:1.1.4)")
+  set(CPACK_DEBIAN_TOOLS_PACKAGE_DEPENDS ${KOVA_DEB_LIBRARY_DEPENDS})
+  set(CPACK_DEBIAN_SIM_PACKAGE_DEPENDS "${KOVA_DEB_LIBRARY_DEPENDS}, zlib1g (>= 1:1.1.4)")
 endif()
 set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS ON)
 set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS_POLICY ">=")
 set(CPACK_DEBIAN_ENABLE_COMPONENT_DEPENDS ON)
 set(CPACK_COMPONENT_DEV_DEPENDS runtime)
 set(CPACK_COMPONENT_TOOLS_DEPENDS runtime)
+set(CPACK_COMPONENT_SIM_DEPENDS runtime)
 
 set(CPACK_DEBIAN_RUNTIME_PACKAGE_NAME libkovacredential6)
 set(CPACK_DEBIAN_RUNTIME_PACKAGE_SECTION libs)
-# dpkg's ldconfig trigger updates the linker cache (lintian's lacks-ldconfig-trigger).
-set(CPACK_DEBIAN_RUNTIME_PACKAGE_CONTROL_EXTRA ${PROJECT_SOURCE_DIR}/doc/deb/triggers)
+# dpkg's ldconfig trigger updates the linker cache (lintian's lacks-ldconfig-trigger); the
+# symbols file is the one check-symbols.cmake writes from the checked-in one.
+set(CPACK_KOVA_SYMBOLS_TEMPLATE ${PROJECT_SOURCE_DIR}/doc/deb/libkovacredential6.symbols)
+set(CPACK_KOVA_SYMBOLS_OUTPUT ${PROJECT_BINARY_DIR}/deb/symbols/symbols)
+set(CPACK_DEBIAN_RUNTIME_PACKAGE_CONTROL_EXTRA ${PROJECT_SOURCE_DIR}/doc/deb/triggers
+    ${CPACK_KOVA_SYMBOLS_OUTPUT})
+set(CPACK_PRE_BUILD_SCRIPTS ${PROJECT_SOURCE_DIR}/doc/deb/check-symbols.cmake)
+set(CPACK_POST_BUILD_SCRIPTS ${PROJECT_SOURCE_DIR}/doc/deb/drop-ldconfig-scripts.cmake)
 set(CPACK_COMPONENT_RUNTIME_DESCRIPTION
     "credential store and WebAPI requests for server programs
 libkovacredential keeps credentials for remote servers in a SQLite
@@ -90,11 +101,18 @@ and the manual page libkovacredential(3).")
 set(CPACK_DEBIAN_TOOLS_PACKAGE_NAME kovacred)
 set(CPACK_DEBIAN_TOOLS_PACKAGE_SECTION utils)
 set(CPACK_COMPONENT_TOOLS_DESCRIPTION
-    "command-line tools for libkovacredential credentials and WebAPI calls
+    "command-line tool for libkovacredential credentials and WebAPI calls
 kovacred stores credentials for remote servers, logs in with them, calls
 their WebAPI one by one or many at once, sends single HTTP(S) requests
-and finds servers through the relay directory. kovasim simulates such
-servers on loopback.")
+and finds servers through the relay directory.")
+
+set(CPACK_DEBIAN_SIM_PACKAGE_NAME kovasim)
+set(CPACK_DEBIAN_SIM_PACKAGE_SECTION devel)
+set(CPACK_COMPONENT_SIM_DESCRIPTION
+    "loopback simulator of the servers libkovacredential talks to
+kovasim serves a WebAPI (discovery, encryption information, login,
+logout and demo APIs) and optionally a relay directory on loopback
+HTTP and HTTPS, or one hostile peer, to try programs against.")
 
 # Each package carries the copyright file and changelog Debian asks for; a plain
 # `cmake --install` leaves them out.

@@ -2,6 +2,7 @@
 // the server id and its MD5, the error state, and one directory request to "/Serv.php".
 #include "request/cred_request_farlink_p.h"
 
+#include <limits.h>
 #include <stdlib.h>
 
 #include <algorithm>
@@ -155,27 +156,24 @@ bool CredRequestFarlinkPrivate::DeadlineExpired() const {
 
 bool CredRequestFarlinkPrivate::BoundRequest(CredRequest &request, long responseTimeout,
                                              long defaultTimeout) {
-    if (deadlineRunning) {
-        const long long left = std::chrono::duration_cast<std::chrono::milliseconds>(
-                                   deadline - std::chrono::steady_clock::now())
-                                   .count();
-        if (left <= 0) {
-            return false;
-        }
-        // The request's time-outs count whole seconds. Rounding up makes a request that runs
-        // out end at or after the deadline, so that its failure is seen as the deadline's.
-        const long seconds = static_cast<long>(std::min<long long>((left + 999) / 1000, 1L << 30));
-        responseTimeout = responseTimeout > 0 ? std::min(responseTimeout, seconds) : seconds;
-        defaultTimeout =
-            std::min(defaultTimeout > 0 ? defaultTimeout : request.GetDefaultTimeout(), seconds);
-    }
     if (responseTimeout > 0) {
         request.SetResponseTimeout(responseTimeout);
     }
     if (defaultTimeout > 0) {
         request.SetDefaultTimeout(defaultTimeout);
     }
-    return true;
+    if (!deadlineRunning) {
+        return true;
+    }
+    // Rounded up, so that a request cut short by it ends at or after the deadline and its
+    // failure is seen as the deadline's.
+    const long long left =
+        std::chrono::ceil<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now())
+            .count();
+    if (left <= 0) {
+        return false;
+    }
+    return request.SetTotalTimeout(static_cast<long>(std::min<long long>(left, LONG_MAX)));
 }
 
 // ---- Errors.
@@ -248,7 +246,7 @@ CredRequest *CredRequestFarlinkPrivate::CreateFarlinkRequest(const Json::Value &
         SetError(CRED_REQ_ERR_UNKNOWN, "Cannot set timeout");
         return nullptr;
     }
-    if (!BoundRequest(*request, timeout, 0)) {
+    if (!BoundRequest(*request, 0, 0)) {
         SetError(CRED_REQ_ERR_TIMEOUT, Json::Value());
         return nullptr;
     }

@@ -74,8 +74,9 @@ class CredRequestFarlinkPrivate {
     // Whether a running deadline has passed.
     bool DeadlineExpired() const;
     // Gives `request` the time-outs it is meant to have (`responseTimeout` and
-    // `defaultTimeout` in seconds; 0 leaves the request's own), each bounded by what is left of
-    // a running deadline. False with CRED_REQ_ERR_TIMEOUT when nothing is left.
+    // `defaultTimeout` in seconds; 0 leaves the request's own) and, while a deadline runs,
+    // what is left of it as the request's total time-out. False, setting no error, when
+    // nothing is left.
     bool BoundRequest(CredRequest &request, long responseTimeout, long defaultTimeout);
     // The whole look-up of GetConnInfo and GetConnInfoPortal: `httpsService`, then
     // `plainService`, within `milliseconds` (0: no deadline).

@@ -78,9 +78,13 @@ void CredRequestPrivate::ScrubCurlEnvironment(bool secure) {
     }
 }
 
+namespace {
+// libcurl's global initialisation, made once per process by InitCurlGlobal.
+std::once_flag curlGlobalOnce;
+}  // namespace
+
 void CredRequestPrivate::InitCurlGlobal(bool secure) {
-    static std::once_flag once;
-    std::call_once(once, [secure] {
+    std::call_once(curlGlobalOnce, [secure] {
         ScrubCurlEnvironment(secure);
         curl_global_init(CURL_GLOBAL_DEFAULT);
     });

@@ -7,6 +7,7 @@
 #include <map>
 #include <sstream>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -19,7 +20,8 @@ namespace {
 
 const std::string kVersion = KOVA_VERSION;
 const std::string kLibDir = std::string("usr/") + KOVA_INSTALL_LIBDIR;
-const char *const kPackages[] = {"libkovacredential6", "libkovacredential-dev", "kovacred"};
+const char *const kPackages[] = {"libkovacredential6", "libkovacredential-dev", "kovacred",
+                                 "kovasim"};
 
 class PackageTest : public ::testing::Test {
   protected:
@@ -72,9 +74,12 @@ TEST_F(PackageTest, EachPackageHoldsItsFilesAndNothingElse) {
           "./usr/share/doc/libkovacredential-dev/changelog.gz",
           "./usr/share/doc/libkovacredential-dev/copyright"}},
         {"kovacred",
-         {"./usr/bin/kovacred", "./usr/bin/kovasim", "./usr/share/man/man1/kovacred.1.gz",
-          "./usr/share/man/man1/kovasim.1.gz", "./usr/share/bash-completion/completions/kovacred",
+         {"./usr/bin/kovacred", "./usr/share/man/man1/kovacred.1.gz",
+          "./usr/share/bash-completion/completions/kovacred",
           "./usr/share/doc/kovacred/changelog.gz", "./usr/share/doc/kovacred/copyright"}},
+        {"kovasim",
+         {"./usr/bin/kovasim", "./usr/share/man/man1/kovasim.1.gz",
+          "./usr/share/doc/kovasim/changelog.gz", "./usr/share/doc/kovasim/copyright"}},
     };
     for (const auto &entry : expected) {
         // "dpkg-deb -c" lists like "tar tv"; the path (and link target) is what follows the time.
@@ -121,6 +126,8 @@ TEST_F(PackageTest, ControlFieldsNameTheDependencies) {
         {"libkovacredential-dev", "Section", {"libdevel"}},
         {"kovacred", "Depends", {"libkovacredential6 (= " + kVersion + ")", "libcurl4 ("}},
         {"kovacred", "Section", {"utils"}},
+        {"kovasim", "Depends", {"libkovacredential6 (= " + kVersion + ")"}},
+        {"kovasim", "Section", {"devel"}},
     };
     for (const Field &f : fields) {
         const std::string value = Output("dpkg-deb -f " + Deb(f.package) + " " + f.field);
@@ -129,19 +136,74 @@ TEST_F(PackageTest, ControlFieldsNameTheDependencies) {
                 << f.package << " " << f.field << ": " << value;
         }
     }
-    // The runtime package tells dpkg-shlibdeps of other packages what its soname needs.
+    // kovacred needs nothing that only the simulator uses.
+    const std::string toolDepends = Output("dpkg-deb -f " + Deb("kovacred") + " Depends");
+    for (const std::string simOnly : {"httplib", "zlib1g", "kovasim"}) {
+        EXPECT_EQ(toolDepends.find(simOnly), std::string::npos) << toolDepends;
+    }
+    // The runtime package tells dpkg-shlibdeps of other packages what its soname needs, by
+    // soname and by symbol; dpkg's ldconfig trigger, not a maintainer script, updates the
+    // linker cache.
     EXPECT_EQ(Output("dpkg-deb -I " + Deb("libkovacredential6") + " shlibs"),
               "libkovacredential 6 libkovacredential6 (>= " + kVersion + ")\n");
+    const std::string symbols = Output("dpkg-deb -I " + Deb("libkovacredential6") + " symbols");
+    EXPECT_EQ(symbols.rfind("libkovacredential.so.6 libkovacredential6 #MINVER#\n", 0), 0u)
+        << symbols;
+    EXPECT_NE(symbols.find(" _ZN4KOVA15CredRequestUtil9m_errCodeE@Base "), std::string::npos)
+        << symbols;
+    EXPECT_EQ(Output("dpkg-deb -I " + Deb("libkovacredential6") + " triggers"),
+              "activate-noawait ldconfig\n");
+    const std::string control = Output("dpkg-deb -I " + Deb("libkovacredential6"));
+    EXPECT_EQ(control.find("postinst"), std::string::npos) << control;
+    EXPECT_EQ(control.find("postrm"), std::string::npos) << control;
 }
 
 TEST_F(PackageTest, LintianReportsNoError) {
-    const std::string report = Output("lintian --no-tag-display-limit " + Deb(kPackages[0]) + " " +
-                                      Deb(kPackages[1]) + " " + Deb(kPackages[2]) + " 2>&1");
+    std::string debs;
+    for (const char *package : kPackages) {
+        debs += " " + Deb(package);
+    }
+    const std::string report = Output("lintian --no-tag-display-limit" + debs + " 2>&1");
     std::istringstream lines(report);
     for (std::string line; std::getline(lines, line);) {
         EXPECT_NE(line.rfind("E: ", 0), 0u) << line;
+        EXPECT_EQ(line.find("maintscript-calls-ldconfig"), std::string::npos) << line;
     }
     EXPECT_EQ(report.find("lintian: command not found"), std::string::npos);
+}
+
+// The symbol check CPack runs before it builds the packages, on the unpacked library: a symbol
+// of the symbols file that the library lacks fails it; one the file does not list yet passes.
+TEST_F(PackageTest, SymbolCheckFailsOnALostSymbolOnly) {
+    const std::string symbols = ReadFile(KOVA_SOURCE_DIR "/doc/deb/libkovacredential6.symbols");
+    const std::string removed = " (c++)\"KOVACredAlloc()@Base\" 6.0.0~\n";
+    ASSERT_NE(symbols.find(removed), std::string::npos);
+    std::string fewer = symbols;
+    fewer.erase(fewer.find(removed), removed.size());
+    const std::string lost = symbols + " (c++)\"KOVACredLost(long)@Base\" 6.0.0~\n";
+    for (const auto &template_ :
+         {std::make_pair(std::string("fewer"), fewer), std::make_pair(std::string("lost"), lost)}) {
+        std::ofstream(dir_->File(template_.first + ".symbols")) << template_.second;
+        std::string log;
+        const int status = RunCommand(
+            "cmake -DCPACK_KOVA_SYMBOLS_TEMPLATE=" + dir_->File(template_.first + ".symbols") +
+                " -DCPACK_KOVA_SYMBOLS_OUTPUT=" + dir_->File(template_.first + "/symbols") +
+                " -DCPACK_TEMPORARY_INSTALL_DIRECTORY=" + Root() +
+                " -DCPACK_PACKAGE_VERSION=" + kVersion +
+                " -DCPACK_DEBIAN_PACKAGE_ARCHITECTURE=" KOVA_DEB_ARCHITECTURE " -P " KOVA_SOURCE_DIR
+                "/doc/deb/check-symbols.cmake 2>&1",
+            &log);
+        if (template_.first == "fewer") {
+            EXPECT_EQ(status, 0) << log;
+            EXPECT_NE(ReadFile(dir_->File("fewer/symbols")).find(" _Z13KOVACredAllocv@Base "),
+                      std::string::npos);
+        } else {
+            EXPECT_NE(status, 0) << log;
+            EXPECT_NE(log.find("#MISSING: " + kVersion + "# (c++)\"KOVACredLost(long)@Base\""),
+                      std::string::npos)
+                << log;
+        }
+    }
 }
 
 // Unpacked into a throwaway root, the -dev package builds the consumer program, and the tools

@@ -205,24 +205,23 @@ TEST_F(RelayProbeTest, DeadSilentAndImpostorHostsAreSkipped) {
     EXPECT_EQ(probeHungUp, 1);
 }
 
-// With a deadline, six LAN addresses that accept and never answer (a minute and more of
-// probes without one) end the operation as soon as the deadline has passed: with error 10, no
-// tunnel asked for, and the plain service not tried after the HTTPS one ran out. Each call
-// runs on its own thread so that the test's wait for it is bounded.
-TEST_F(RelayCandidatesTest, DeadlineEndsProbesOfSilentHostsWithTimeout) {
-    kovasim::RawServer silent([](kovasim::RawServer::Connection &c) { c.WaitForClose(30000); },
-                              Addr(1));
+// With a deadline, hosts that accept and never answer end each operation as soon as the
+// deadline has passed, with error 10 and nothing tried after it: six LAN addresses (probes of
+// 5 s each without a deadline), a relay endpoint (probed with libcurl's 120 s), and a directory
+// host asked without a response time-out. Each call runs on a thread of its own so that the
+// test's wait for it is bounded.
+TEST_F(RelayCandidatesTest, DeadlineEndsEachOperationOverSilentHosts) {
+    const auto stall = [](kovasim::RawServer::Connection &c) { c.WaitForClose(30000); };
+    kovasim::RawServer silent(stall, Addr(1));
     ASSERT_TRUE(silent.Start());
     const std::string port = std::to_string(silent.Port());
     const std::string interfaces = kova_test::Fill(
         R"([{"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}])",
         {Addr(1)});
-    Serve(ParseJson(R"({"serverID": "S1", "interface": $0,
-                        "services": {"zon_https": {"port": $1}, "zon": {"port": $1}}})",
-                    {interfaces, port}));
-    const Json::Value info =
-        ParseJson(R"({"server": {"serverID": "S1", "interface": $0}, "service": {"port": $1}})",
-                  {interfaces, port});
+    // The HTTPS service has no port, so its look-up goes on to the (silent) relay.
+    Serve(ParseJson(R"({"serverID": "S1", "interface": $0, "services": {
+                        "zon_https": {"relay_ip": "$1", "relay_port": $2}, "zon": {"port": $2}}})",
+                    {interfaces, Addr(1), port}));
     const auto finishes = [](std::future<bool> &call) {
         return call.wait_for(std::chrono::seconds(20)) == std::future_status::ready;
     };
@@ -230,16 +229,17 @@ TEST_F(RelayCandidatesTest, DeadlineEndsProbesOfSilentHostsWithTimeout) {
     CredRequestFarlink client;
     client.SetTotalTimeout(1500);
     Json::Value candidate;
-    auto connInfo = std::async(std::launch::async,
-                               [&] { return client.GetAvailableConnInfo(info, candidate); });
-    ASSERT_TRUE(finishes(connInfo));
-    EXPECT_FALSE(connInfo.get());
+    const Json::Value info =
+        ParseJson(R"({"server": {"serverID": "S1", "interface": $0}, "service": {"port": $1}})",
+                  {interfaces, port});
+    auto probes = std::async(std::launch::async,
+                             [&] { return client.GetAvailableConnInfo(info, candidate); });
+    ASSERT_TRUE(finishes(probes));
+    EXPECT_FALSE(probes.get());
     EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":10})"));
     EXPECT_TRUE(Sim().Hits("request_tunnel").empty());
     EXPECT_EQ(silent.ConnectionCount(), 1);
-
-    // The deadline is per operation: the next one has all of it again, and a later success
-    // does not depend on what an earlier operation used.
+    // Each operation has the whole deadline again.
     EXPECT_TRUE(client.GetSiteList(candidate));
 
     Json::Value errors;
@@ -250,7 +250,20 @@ TEST_F(RelayCandidatesTest, DeadlineEndsProbesOfSilentHostsWithTimeout) {
     EXPECT_FALSE(lookUp.get());
     EXPECT_EQ(errors, ParseJson(R"({"code":10})"));
     EXPECT_EQ(ServiceIdsAsked("get_server_info"), Names{"zon_https"});
-    EXPECT_TRUE(Sim().Hits("request_tunnel").empty());
+    EXPECT_EQ(ServiceIdsAsked("request_tunnel"), Names{"zon_https"});
+    EXPECT_EQ(silent.ConnectionCount(), 2);
+
+    kovasim::RawServer silentDirectory(stall, Addr(2), true, 80);
+    ASSERT_TRUE(silentDirectory.Start());
+    client.SetServerName(Addr(2));
+    client.SetServerId("S1");
+    client.SetTimeout(0);
+    auto directory =
+        std::async(std::launch::async, [&] { return client.GetServerInfo(candidate); });
+    ASSERT_TRUE(finishes(directory));
+    EXPECT_FALSE(directory.get());
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":10})"));
+    EXPECT_EQ(silentDirectory.ConnectionCount(), 1);
 }
 
 TEST_F(RelayProbeTest, RelayAddressComesBeforeItsNameOnTheSamePort) {

@@ -21,8 +21,10 @@ using KOVA::CredRequest;
 using KOVA::CredRequestUtil;
 
 // In a forked child, runs `work(thread, round)` for `rounds` rounds on each of `threads`
-// threads and expects every call to return true (each failure is reported on standard error).
-void ExpectOnThreads(int threads, int rounds, const std::function<bool(int, int)> &work) {
+// threads and expects every call to return true (each failure is reported on standard error),
+// then, when given, `after` on the child's first thread once all have ended.
+void ExpectOnThreads(int threads, int rounds, const std::function<bool(int, int)> &work,
+                     const std::function<bool()> &after = nullptr) {
     const std::string ended = kova_test::RunInChild(60, [&] {
         std::atomic<int> failures{0};
         std::vector<std::thread> pool;
@@ -38,6 +40,10 @@ void ExpectOnThreads(int threads, int rounds, const std::function<bool(int, int)
         }
         for (std::thread &thread : pool) {
             thread.join();
+        }
+        if (after && !after()) {
+            fprintf(stderr, "the check after the threads failed\n");
+            ++failures;
         }
         return failures.load();
     });
@@ -72,6 +78,16 @@ TEST_F(ThreadsWebApiTest, EncryptionInformation) {
         return CredRequestUtil::GetEncInfo(url, info) &&
                info["public_key"].asString() == Sim().PublicKeyHex();
     });
+}
+
+// The last error is one value for the whole process: what the threads' failed probes left is
+// what the first thread reads, and the library's stores of it do not race.
+TEST_F(ThreadsWebApiTest, LastErrorIsProcessWide) {
+    const std::string missing = Server().BaseUrl() + "/missing";
+    CredRequestUtil::m_errCode = KOVA::CRED_REQ_ERR_NONE;
+    ExpectOnThreads(
+        8, 5, [&](int, int) { return !CredRequestUtil::TestURL(missing); },
+        [] { return CredRequestUtil::m_errCode == KOVA::CRED_REQ_ERR_QUERY_FAIL; });
 }
 
 // The threads start with an empty cache, so they race to fill and read it.

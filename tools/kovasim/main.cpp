@@ -22,12 +22,18 @@
 // plain-on-tls, tls-on-plain, huge-body. It prints "https 127.0.0.1:PORT" for plain-on-tls
 // (clients are to use TLS there; --https-port picks the port) and "http 127.0.0.1:PORT" for
 // the others (--http-port).
+//
+// `kovasim link --listen PORT --to HOST:PORT --rtt MS` serves no roles: it relays TCP from
+// 127.0.0.1:PORT (0 picks a free one) to HOST:PORT with a set round-trip time
+// (tools/simlib/link_relay.h), prints "link 127.0.0.1:PORT", and prints
+// "connections N up BYTES down BYTES" on SIGUSR1 and once more when it stops.
 #include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
 #include <time.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <fstream>
 #include <memory>
 #include <sstream>
@@ -40,6 +46,7 @@
 
 #include "common/tool_version.h"
 #include "simlib/fault_server.h"
+#include "simlib/link_relay.h"
 #include "simlib/loopback_server.h"
 #include "simlib/relay_sim.h"
 #include "simlib/webapi_sim.h"
@@ -175,6 +182,85 @@ struct RelayRole {
     }
 };
 
+struct LinkSettings {
+    int listen = 0;
+    std::string to;
+    int rttMs = 50;
+};
+
+void PrintLinkStats(const kovasim::LinkRelay &link) {
+    printf("connections %d up %lld down %lld\n", link.ConnectionCount(), link.BytesUp(),
+           link.BytesDown());
+    fflush(stdout);
+}
+
+// Relays until SIGINT or SIGTERM (or --duration), printing the counts on SIGUSR1.
+int RunLink(const LinkSettings &settings, double duration) {
+    const size_t colon = settings.to.rfind(':');
+    kovasim::LinkRelay::Options options;
+    options.listenPort = settings.listen;
+    options.rttMs = settings.rttMs;
+    try {
+        options.toHost = settings.to.substr(0, colon);
+        options.toPort = std::stoi(settings.to.substr(colon + 1));
+    } catch (const std::exception &) {
+        options.toPort = 0;
+    }
+    if (colon == std::string::npos || options.toHost.empty() || options.toPort <= 0 ||
+        options.toPort > 65535) {
+        fprintf(stderr, "kovasim: link: --to needs HOST:PORT\n");
+        return 2;
+    }
+    if (options.toHost.size() > 2 && options.toHost.front() == '[' &&
+        options.toHost.back() == ']') {
+        options.toHost = options.toHost.substr(1, options.toHost.size() - 2);
+    }
+    sigset_t signals;
+    sigemptyset(&signals);
+    sigaddset(&signals, SIGINT);
+    sigaddset(&signals, SIGTERM);
+    sigaddset(&signals, SIGUSR1);
+    pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+    signal(SIGPIPE, SIG_IGN);
+
+    kovasim::LinkRelay link(options);
+    if (!link.Start()) {
+        fprintf(stderr, "kovasim: link: %s\n", link.Error().c_str());
+        return 1;
+    }
+    printf("link 127.0.0.1:%d\n", link.Port());
+    fflush(stdout);
+    const auto stopAt = std::chrono::steady_clock::now() +
+                        std::chrono::duration_cast<std::chrono::steady_clock::duration>(
+                            std::chrono::duration<double>(duration));
+    for (;;) {
+        int sig = 0;
+        if (duration > 0) {
+            const auto left = stopAt - std::chrono::steady_clock::now();
+            if (left <= std::chrono::steady_clock::duration::zero()) {
+                break;
+            }
+            const auto ns = std::chrono::duration_cast<std::chrono::nanoseconds>(left).count();
+            struct timespec limit;
+            limit.tv_sec = static_cast<time_t>(ns / 1000000000);
+            limit.tv_nsec = static_cast<long>(ns % 1000000000);
+            sig = sigtimedwait(&signals, nullptr, &limit);
+        } else {
+            sigwait(&signals, &sig);
+        }
+        if (sig != SIGUSR1) {
+            if (sig > 0 || duration <= 0) {
+                break;
+            }
+            continue;
+        }
+        PrintLinkStats(link);
+    }
+    link.Stop();
+    PrintLinkStats(link);
+    return 0;
+}
+
 }  // namespace
 
 int main(int argc, char **argv) {
@@ -200,7 +286,19 @@ int main(int argc, char **argv) {
     }
     app.add_option("--fault", settings.fault, "serve one hostile peer instead of the roles")
         ->check(CLI::IsMember(faultNames));
+    LinkSettings link;
+    CLI::App *linkCommand = app.add_subcommand(
+        "link", "relay TCP from a loopback port to HOST:PORT with a set round-trip time");
+    linkCommand->add_option("--listen", link.listen, "loopback port to listen on (0 picks one)")
+        ->check(CLI::Range(0, 65535));
+    linkCommand->add_option("--to", link.to, "HOST:PORT to relay to")->required();
+    linkCommand->add_option("--rtt", link.rttMs, "round-trip time in milliseconds (default 50)")
+        ->check(CLI::Range(0, 60000));
+    linkCommand->add_option("--duration", settings.duration, "stop after this many seconds");
     CLI11_PARSE(app, argc, argv);
+    if (*linkCommand) {
+        return RunLink(link, settings.duration);
+    }
     if (settings.redirectHttp && (settings.noHttp || settings.noHttps)) {
         fprintf(stderr, "kovasim: --redirect-http needs both listeners\n");
         return 2;
