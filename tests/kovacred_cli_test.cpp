@@ -501,7 +501,8 @@ TEST_F(KovacredTest, RequestSendsItsOptionsAndPrintsTextOrJson) {
 }
 
 // -o replaces its file only when the request succeeds; like curl, the body of any HTTP answer
-// is the output unless --fail; what cannot be written exits 23.
+// is the output unless --fail; a body past the in-memory cap needs -o; what cannot be written
+// exits 23.
 TEST_F(KovacredTest, RequestOutputReplacesItsFileOnlyOnSuccess) {
     kovasim::LoopbackServer server;
     server.Route("GET", "/text", [](const httplib::Request &, httplib::Response &res) {
@@ -510,6 +511,9 @@ TEST_F(KovacredTest, RequestOutputReplacesItsFileOnlyOnSuccess) {
     server.Route("GET", "/gone", [](const httplib::Request &, httplib::Response &res) {
         res.status = 404;
         res.set_content("gone body", "text/plain");
+    });
+    server.Route("GET", "/big", [](const httplib::Request &, httplib::Response &res) {
+        res.set_content(std::string((size_t{64} << 20) + 1, 'x'), "application/octet-stream");
     });
     ASSERT_TRUE(server.Start());
     const std::string dir = db_.dir().File("out");
@@ -547,6 +551,13 @@ TEST_F(KovacredTest, RequestOutputReplacesItsFileOnlyOnSuccess) {
     EXPECT_EQ(r.status, 0);
     EXPECT_EQ(r.out, "gone body");
     EXPECT_EQ(r.err, notFound);
+    r = Run("request " + server.BaseUrl() + "/big");
+    EXPECT_EQ(r.status, 12);
+    EXPECT_EQ(r.err,
+              "kovacred: request failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other libcurl "
+              "failure): the answer is larger than the 67108864 bytes held in memory; use -o "
+              "FILE\n");
+    EXPECT_TRUE(r.out.empty()) << r.out.size() << " bytes on standard output";
 
     // Standard output that cannot be written.
     Add("admin", "secret");
@@ -763,22 +774,6 @@ TEST_F(KovacredTest, TransportOptionsCheckTheServerAndBoundTheTime) {
     r = Run("login 2 --max-time 0.5");
     EXPECT_EQ(r.status, 10) << r.err;
     EXPECT_EQ(r.err.rfind("kovacred: login failed (error 10 CRED_REQ_ERR_TIMEOUT", 0), 0u) << r.err;
-}
-
-// A body larger than the in-memory cap is refused with the way out.
-TEST_F(KovacredTest, RequestPastTheMemoryCapSaysUseOutputFile) {
-    kovasim::LoopbackServer server;
-    server.Route("GET", "/big", [](const httplib::Request &, httplib::Response &res) {
-        res.set_content(std::string((size_t{64} << 20) + 1, 'x'), "application/octet-stream");
-    });
-    ASSERT_TRUE(server.Start());
-    Result r = Run("request " + server.BaseUrl() + "/big");
-    EXPECT_EQ(r.status, 12);
-    EXPECT_EQ(r.err,
-              "kovacred: request failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other libcurl "
-              "failure): the answer is larger than the 67108864 bytes held in memory; use -o "
-              "FILE\n");
-    EXPECT_TRUE(r.out.empty()) << r.out.size() << " bytes on standard output";
 }
 
 // The completion function run in bash, as bash-completion runs it.
