@@ -27,30 +27,6 @@ namespace {
 using namespace store_test;
 using LockTest = StoreTest;
 
-// Forks a child that runs `body` and that an alarm ends after `seconds`, so that a crash or a
-// hang fails one test; the child exits with 1 when one of its expectations failed.
-template <typename Body>
-pid_t StartChild(Body body, unsigned seconds) {
-    fflush(nullptr);
-    const pid_t pid = fork();
-    if (pid == 0) {
-        alarm(seconds);
-        body();
-        fflush(nullptr);
-        _exit(::testing::Test::HasFailure() ? 1 : 0);
-    }
-    return pid;
-}
-
-// The exit status of a child, or 128 + the signal that ended it.
-int WaitChild(pid_t pid) {
-    int status = 0;
-    if (pid < 0 || waitpid(pid, &status, 0) != pid) {
-        return -1;
-    }
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-}
-
 // Counts the executions of statements that begin with a prefix on one connection.
 struct StatementCounter {
     std::string prefix;
