@@ -13,6 +13,7 @@
 #include <openssl/evp.h>
 
 #include "platform/json_text.h"
+#include "platform/kova_env.h"
 #include "platform/kova_log.h"
 
 namespace KOVA {
@@ -30,7 +31,7 @@ const long kDefaultTimeout = 5;
 std::string HostFromEnv(const char *variable, const char *fallback) {
     // Ignored in setuid and setgid processes, so that whoever starts them cannot redirect
     // look-ups to a directory of their own.
-    const char *value = secure_getenv(variable);
+    const char *value = kova::SecureEnv(variable);
     return (value != nullptr && value[0] != '\0') ? std::string(value) : std::string(fallback);
 }
 

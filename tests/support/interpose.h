@@ -30,6 +30,9 @@ void SetFakeSleep(bool on);
 // Real sleeps last 1/divisor of what was asked (1, the default, is the full time); a long run
 // keeps its pauses and their order in less time.
 void SetSleepDivisor(unsigned divisor);
+// While on, a signal ends a real usleep early with -1 and errno EINTR, as libc's does
+// (otherwise the pause is resumed, so that tests need not care about signals).
+void SetSleepInterruptible(bool on);
 std::vector<unsigned> UsleepCalls();  // microseconds of each usleep call
 std::vector<unsigned> SleepCalls();   // seconds of each sleep call
 void ClearSleeps();
