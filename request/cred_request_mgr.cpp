@@ -3,13 +3,18 @@
 #include "kovacredential/cred_request_mgr.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <limits.h>
+#include <sched.h>
 #include <string.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <memory>
 #include <new>
+#include <vector>
 
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
@@ -213,9 +218,104 @@ namespace {
 constexpr int kLineSocketFunctionFail = 230;
 constexpr int kLineSocketDataFail = 231;
 constexpr int kLineAddHandleFail = 262;
+
+using Clock = std::chrono::steady_clock;
+using Millis = std::chrono::milliseconds;
+
+// Runs in progress that Cancel can reach. Cancel may run in a signal handler, so the registry
+// is a fixed array of lock-free atomics: a run claims a slot, opens a wake pipe and publishes
+// its manager; Cancel raises the slot's flag and writes a byte to the pipe, which the run's
+// wait watches. `callers` counts Cancel calls looking at a slot, so that a finishing run closes
+// its pipe only once no Cancel can still write to it.
+struct RunSlot {
+    std::atomic<bool> claimed{false};
+    std::atomic<const CredRequestMgr *> manager{nullptr};
+    std::atomic<bool> cancelled{false};
+    std::atomic<int> wakeFd{-1};
+    std::atomic<int> callers{0};
+};
+static_assert(std::atomic<bool>::is_always_lock_free && std::atomic<int>::is_always_lock_free &&
+                  std::atomic<const CredRequestMgr *>::is_always_lock_free,
+              "Cancel must not take a lock");
+
+// Runs that may be in progress at once in a process and still be cancelled; a run beyond that
+// number runs to its end.
+constexpr size_t kRunSlots = 256;
+RunSlot gRunSlots[kRunSlots];
+
+// A run's place in the registry for its lifetime (see RunSlot).
+class RunRegistration {
+  public:
+    explicit RunRegistration(const CredRequestMgr *mgr) {
+        for (RunSlot &slot : gRunSlots) {
+            bool expected = false;
+            if (slot.claimed.compare_exchange_strong(expected, true)) {
+                slot_ = &slot;
+                break;
+            }
+        }
+        if (slot_ == nullptr) {
+            return;
+        }
+        // Without a pipe a Cancel still raises the flag; a signal, or the next wake-up of
+        // libcurl's own, then ends the wait.
+        if (pipe2(pipe_, O_NONBLOCK | O_CLOEXEC) != 0) {
+            pipe_[0] = pipe_[1] = -1;
+        }
+        slot_->cancelled.store(false);
+        slot_->wakeFd.store(pipe_[1]);
+        slot_->manager.store(mgr);
+    }
+    ~RunRegistration() {
+        if (slot_ != nullptr) {
+            slot_->manager.store(nullptr);
+            while (slot_->callers.load() != 0) {
+                sched_yield();  // a Cancel on another thread is between its check and its write
+            }
+            slot_->wakeFd.store(-1);
+            slot_->claimed.store(false);
+        }
+        for (int fd : pipe_) {
+            if (fd >= 0) {
+                close(fd);
+            }
+        }
+    }
+    RunRegistration(const RunRegistration &) = delete;
+    RunRegistration &operator=(const RunRegistration &) = delete;
+
+    bool Cancelled() const { return slot_ != nullptr && slot_->cancelled.load(); }
+    // The read end of the wake pipe, or -1.
+    int WakeFd() const { return pipe_[0]; }
+
+  private:
+    RunSlot *slot_ = nullptr;
+    int pipe_[2] = {-1, -1};
+};
+
+// What Run adds to the transfer loop: the transfers it started, its deadline and its
+// registration for Cancel.
+struct RunControl {
+    std::vector<CredRequest *> active;  // requests whose transfers are unfinished
+    bool hasDeadline = false;
+    Clock::time_point deadline;
+    const RunRegistration *registration = nullptr;
+};
+
+bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunControl *control);
+
 }  // namespace
 
 bool CredRequestMgr::Run() {
+    return Run(0);
+}
+
+bool CredRequestMgr::Run(long timeoutMilliseconds) {
+    if (timeoutMilliseconds < 0) {
+        SetError(CRED_REQ_ERR_BAD_PARAM);
+        return false;
+    }
+    const Clock::time_point start = Clock::now();
     MultiPtr multi(curl_multi_init());
     if (!multi) {
         SetError(CRED_REQ_ERR_CURL_INTERNAL);
@@ -238,28 +338,62 @@ bool CredRequestMgr::Run() {
         return true;
     }
 
-    long longestTimeout = 0;
-    for (CredRequest *request : requests) {
-        if (request == nullptr) {
-            continue;
+    return kova::Guarded(kUnit, kLineMgrException, false, [&] {
+        const RunRegistration registration(this);
+        RunControl control;
+        control.registration = &registration;
+        if (timeoutMilliseconds > 0) {
+            control.hasDeadline = true;
+            control.deadline = start + Millis(timeoutMilliseconds);
         }
-        long timeout = request->GetResponseTimeout();
-        if (timeout > longestTimeout) {
-            longestTimeout = timeout;
-        }
-        // The select loop below is the only time limit of a managed transfer.
-        request->SetResponseTimeout(0);
-        if (request->Process(false, 0)) {
-            code = curl_multi_add_handle(multi.get(), request->GetCurlHandler());
-            if (code != CURLM_OK) {
-                // The request is left out, like one whose set-up failed.
-                request->SetError(CRED_REQ_ERR_CURL_INTERNAL);
-                LogMultiError(kLineAddHandleFail, code);
+        control.active.reserve(requests.size());
+        long longestTimeout = 0;
+        for (CredRequest *request : requests) {
+            if (request == nullptr) {
+                continue;
+            }
+            long timeout = request->GetResponseTimeout();
+            if (timeout > longestTimeout) {
+                longestTimeout = timeout;
+            }
+            // The select loop below is the only time limit of a managed transfer.
+            request->SetResponseTimeout(0);
+            if (request->Process(false, 0)) {
+                // A run that stops early (its deadline, Cancel) leaves a resolver thread that
+                // has not answered to finish on its own instead of waiting for it.
+                curl_easy_setopt(request->GetCurlHandler(), CURLOPT_QUICK_EXIT, 1L);
+                code = curl_multi_add_handle(multi.get(), request->GetCurlHandler());
+                if (code != CURLM_OK) {
+                    // The request is left out, like one whose set-up failed.
+                    request->SetError(CRED_REQ_ERR_CURL_INTERNAL);
+                    LogMultiError(kLineAddHandleFail, code);
+                } else {
+                    control.active.push_back(request);
+                }
             }
         }
+        return DriveTransfers(*this, multi.get(),
+                              longestTimeout > 0 ? longestTimeout : kDefaultWaitSeconds, &control);
+    });
+}
+
+void CredRequestMgr::Cancel() {
+    const int savedErrno = errno;  // a signal handler must leave errno as it found it
+    for (RunSlot &slot : gRunSlots) {
+        slot.callers.fetch_add(1);
+        if (slot.manager.load() == this) {
+            slot.cancelled.store(true);
+            const int fd = slot.wakeFd.load();
+            if (fd >= 0) {
+                const char byte = 1;
+                // A full pipe wakes the run already, so a failed write needs no retry.
+                const ssize_t written = write(fd, &byte, 1);
+                (void)written;
+            }
+        }
+        slot.callers.fetch_sub(1);
     }
-    return curlHandlerProcess(multi.get(),
-                              longestTimeout > 0 ? longestTimeout : kDefaultWaitSeconds);
+    errno = savedErrno;
 }
 
 std::string CredRequestMgr::GetResponse(int index) {
@@ -304,20 +438,21 @@ constexpr int kLineMaxRetries = 332;
 constexpr int kLineRetryPerformFail = 335;
 constexpr int kLineSelectTimeout = 339;
 constexpr int kLineReadyPerformFail = 343;
-}  // namespace
 
-namespace {
-
-using Clock = std::chrono::steady_clock;
-using Millis = std::chrono::milliseconds;
-
-// Waits up to `ms` for activity on the multi handle's sockets. curl_multi_poll also sleeps
-// when libcurl has no socket yet; the older curl_multi_wait returns at once then.
-CURLMcode WaitForSockets(CURLM *multi, int ms, int *ready) {
+// Waits up to `ms` for activity on the multi handle's sockets or on `wakeFd` (-1: none).
+// libcurl shortens the wait to its own next timer, and a signal that interrupts it ends it
+// quietly, as a wait without activity.
+CURLMcode WaitForSockets(CURLM *multi, int wakeFd, int ms, int *ready) {
+    struct curl_waitfd wake = {};
+    wake.fd = wakeFd;
+    wake.events = CURL_WAIT_POLLIN;
+    const unsigned int extra = wakeFd >= 0 ? 1 : 0;
 #if LIBCURL_VERSION_NUM >= 0x074200
-    return curl_multi_poll(multi, nullptr, 0, ms, ready);
+    // curl_multi_poll also sleeps when libcurl has no socket yet; the older curl_multi_wait
+    // returns at once then.
+    return curl_multi_poll(multi, extra > 0 ? &wake : nullptr, extra, ms, ready);
 #else
-    return curl_multi_wait(multi, nullptr, 0, ms, ready);
+    return curl_multi_wait(multi, extra > 0 ? &wake : nullptr, extra, ms, ready);
 #endif
 }
 
@@ -331,55 +466,112 @@ bool IsPollFailure(CURLMcode code) {
 #endif
 }
 
-}  // namespace
+// The held request whose transfer is `easy`, or null.
+CredRequest *RequestOf(CredRequestMgr &mgr, CURL *easy) {
+    for (int i = 0; i < mgr.Size(); ++i) {
+        CredRequest *request = mgr.GetRequest(i);
+        if (request != nullptr && request->GetCurlHandler() == easy) {
+            return request;
+        }
+    }
+    return nullptr;
+}
 
-bool CredRequestMgr::curlHandlerProcess(CURLM *multi, long waitSeconds) {
+// Reads the results of the transfers libcurl has finished. A failed transfer gives its request
+// the error Process gives for the same result (a response over the in-memory cap, for one,
+// ends with libcurl's write error); the socket callback's mark stays on the others.
+void CollectFinished(CredRequestMgr &mgr, CURLM *multi, RunControl *control) {
+    int queued = 0;
+    while (CURLMsg *message = curl_multi_info_read(multi, &queued)) {
+        if (message->msg != CURLMSG_DONE) {
+            continue;
+        }
+        CURL *easy = message->easy_handle;
+        CredRequest *request = RequestOf(mgr, easy);
+        if (request != nullptr && message->data.result != CURLE_OK) {
+            request->SetError(CredRequest::ErrorOf(message->data.result, 0));
+        }
+        if (control != nullptr) {
+            auto &active = control->active;
+            active.erase(
+                std::remove_if(active.begin(), active.end(),
+                               [easy](CredRequest *r) { return r->GetCurlHandler() == easy; }),
+                active.end());
+        }
+    }
+}
+
+// Ends a run before its transfers finished: every unfinished transfer is taken off the multi
+// handle and its request gets `error`, as does the manager.
+bool StopRun(CredRequestMgr &mgr, CURLM *multi, RunControl &control,
+             KOVA::_tag_CRED_REQ_ERR error) {
+    for (CredRequest *request : control.active) {
+        curl_multi_remove_handle(multi, request->GetCurlHandler());
+        // After the removal, so that the socket callback's mark of a closed socket gives way.
+        request->SetError(error);
+    }
+    control.active.clear();
+    mgr.SetError(error);
+    return false;
+}
+
+bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunControl *control) {
     int running = 0;
     CURLMcode code = curl_multi_perform(multi, &running);
     if (code != CURLM_OK) {
-        SetError(CRED_REQ_ERR_CURL_INTERNAL);
+        mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
         LogMultiError(kLineFirstPerformFail, code);
         return false;
     }
+    CollectFinished(mgr, multi, control);
     // The run ends with a time-out once no socket has been ready for a whole wait. The wait is
-    // polled (descriptors of any number), never past libcurl's own next timer, and resumed
-    // after a signal; each wake-up lets libcurl advance.
+    // polled (descriptors of any number); libcurl cuts it short for its own timer, and so does
+    // a signal. Each wake-up lets libcurl advance, and the quiet time is counted by the clock,
+    // so that a wake-up without activity does not end the run early.
     const Millis wholeWait =
         std::chrono::duration_cast<Millis>(std::chrono::seconds(std::max(waitSeconds, 0L)));
+    const RunRegistration *registration = control != nullptr ? control->registration : nullptr;
+    const int wakeFd = registration != nullptr ? registration->WakeFd() : -1;
     Clock::time_point quietSince = Clock::now();
     int retries = 0;
-    for (;;) {
+    while (running != 0) {
         errno = 0;
-        long curlTimeout = -1;
-        curl_multi_timeout(multi, &curlTimeout);
-        const Millis quiet = std::chrono::duration_cast<Millis>(Clock::now() - quietSince);
-        Millis wait = std::max(wholeWait - quiet, Millis(0));
-        if (curlTimeout >= 0) {
-            wait = std::min(wait, Millis(curlTimeout));
+        const Clock::time_point now = Clock::now();
+        Millis wait =
+            std::max(wholeWait - std::chrono::duration_cast<Millis>(now - quietSince), Millis(0));
+        if (control != nullptr && control->hasDeadline) {
+            wait = std::min(
+                wait, std::max(std::chrono::ceil<Millis>(control->deadline - now), Millis(0)));
         }
         int ready = 0;
-        code = WaitForSockets(multi, static_cast<int>(std::min<Millis::rep>(wait.count(), INT_MAX)),
-                              &ready);
+        code = WaitForSockets(
+            multi, wakeFd, static_cast<int>(std::min<Millis::rep>(wait.count(), INT_MAX)), &ready);
+        const int err = errno;
+        if (registration != nullptr && registration->Cancelled()) {
+            // Cancel ends the run as an interrupted wait ends it.
+            kova::Log("%s:%d %s select error: %s[%d]", kUnit, kLineSelectError, kLoopName,
+                      strerror(EINTR), EINTR);
+            return StopRun(mgr, multi, *control, CRED_REQ_ERR_SELECT);
+        }
+        if (control != nullptr && control->hasDeadline && Clock::now() >= control->deadline) {
+            return StopRun(mgr, multi, *control, CRED_REQ_ERR_TIMEOUT);
+        }
         if (code != CURLM_OK) {
-            const int err = errno;
             if (!IsPollFailure(code)) {
-                SetError(CRED_REQ_ERR_CURL_INTERNAL);
+                mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
                 LogMultiError(kLineFdsetFail, code);
                 return false;
             }
-            if (err == EINTR) {
-                continue;  // a signal cut the wait short; the quiet time goes on counting
-            }
             kova::Log("%s:%d %s select error: %s[%d]", kUnit, kLineSelectError, kLoopName,
                       strerror(err), err);
-            SetError(CRED_REQ_ERR_SELECT);
+            mgr.SetError(CRED_REQ_ERR_SELECT);
             return false;
         }
         if (ready > 0) {
             quietSince = Clock::now();
             code = curl_multi_perform(multi, &running);
             if (code != CURLM_OK) {
-                SetError(CRED_REQ_ERR_CURL_INTERNAL);
+                mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
                 LogMultiError(kLineReadyPerformFail, code);
                 return false;
             }
@@ -387,23 +579,22 @@ bool CredRequestMgr::curlHandlerProcess(CURLM *multi, long waitSeconds) {
             // libcurl's timer is due (or a signal woke the wait): let it advance.
             code = curl_multi_perform(multi, &running);
             if (code != CURLM_OK) {
-                SetError(CRED_REQ_ERR_CURL_INTERNAL);
+                mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
                 LogMultiError(kLineIdlePerformFail, code);
                 return false;
             }
         } else {
-            const int err = errno;
             if (retries > kMaxSelectRetries) {
                 kova::Log("%s:%d Exceed max retries times!", kUnit, kLineMaxRetries);
                 kova::Log("%s:%d %s select timeout(%ld): %s[%d]", kUnit, kLineSelectTimeout,
                           kLoopName, waitSeconds, strerror(err), err);
-                SetError(CRED_REQ_ERR_TIMEOUT);
+                mgr.SetError(CRED_REQ_ERR_TIMEOUT);
                 return false;
             }
             if (err != EINPROGRESS && err != EAGAIN) {
                 kova::Log("%s:%d %s select timeout(%ld): %s[%d]", kUnit, kLineSelectTimeout,
                           kLoopName, waitSeconds, strerror(err), err);
-                SetError(CRED_REQ_ERR_TIMEOUT);
+                mgr.SetError(CRED_REQ_ERR_TIMEOUT);
                 return false;
             }
             // A connection still in progress earns another whole wait, a limited number of times.
@@ -411,15 +602,21 @@ bool CredRequestMgr::curlHandlerProcess(CURLM *multi, long waitSeconds) {
             ++retries;
             quietSince = Clock::now();
             if (code != CURLM_OK) {
-                SetError(CRED_REQ_ERR_CURL_INTERNAL);
+                mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
                 LogMultiError(kLineRetryPerformFail, code);
                 return false;
             }
         }
-        if (running == 0) {
-            return true;
-        }
+        CollectFinished(mgr, multi, control);
     }
+    return true;
+}
+
+}  // namespace
+
+bool CredRequestMgr::curlHandlerProcess(CURLM *multi, long waitSeconds) {
+    return kova::Guarded(kUnit, kLineMgrException, false,
+                         [&] { return DriveTransfers(*this, multi, waitSeconds, nullptr); });
 }
 
 }  // namespace KOVA

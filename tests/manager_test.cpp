@@ -1,10 +1,16 @@
 // The request manager with plain requests against loopback servers: ownership and slots,
 // concurrent runs, set-up failures, silent and refusing servers, and the socket callback.
 
+#include <arpa/inet.h>
+#include <dlfcn.h>
 #include <fcntl.h>
+#include <netdb.h>
+#include <netinet/in.h>
 #include <signal.h>
 #include <sys/resource.h>
+#include <sys/socket.h>
 #include <sys/wait.h>
+#include <string.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -14,15 +20,44 @@
 #include <memory>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include <gtest/gtest.h>
 
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_mgr.h"
+#include "simlib/fault_server.h"
 #include "simlib/loopback_server.h"
 #include "simlib/relay_sim.h"
 #include "support/child.h"
 #include "support/interpose.h"
+
+// Name resolution of kStalledHost hangs (up to 30 s, or until released), as with a DNS server
+// that never answers; every other name resolves as usual. The test program's definition takes
+// the place of libc's for libcurl's resolver thread too.
+namespace {
+
+constexpr char kStalledHost[] = "stalled.invalid";
+std::atomic<bool> gResolverStalled{false};
+std::atomic<bool> gReleaseResolver{false};
+
+}  // namespace
+
+extern "C" int getaddrinfo(const char *node, const char *service, const struct addrinfo *hints,
+                           struct addrinfo **res) {
+    using Real = int (*)(const char *, const char *, const struct addrinfo *, struct addrinfo **);
+    if (node != nullptr && strcmp(node, kStalledHost) == 0) {
+        gResolverStalled = true;
+        const struct timespec step = {0, 10 * 1000 * 1000};
+        for (int i = 0; i < 3000 && !gReleaseResolver; ++i) {
+            nanosleep(&step, nullptr);
+        }
+        gResolverStalled = false;
+        return EAI_AGAIN;
+    }
+    static const Real real = reinterpret_cast<Real>(dlsym(RTLD_NEXT, "getaddrinfo"));
+    return real(node, service, hints, res);
+}
 
 namespace {
 
@@ -148,8 +183,9 @@ TEST_F(ManagerTest, SlotsBadArgumentsAndTheSocketCallback) {
 
 // One run drives every held request at once, each answer in its slot: a removed slot is neither
 // run nor answered, a request whose set-up fails is left out, a refused connection ends only its
-// own transfer, and response time-outs are lifted (the limited request's answer comes 0.5 s
-// after its own limit). A second run starts from empty responses.
+// own transfer (with the error Process gives it), and response time-outs are lifted (the
+// limited request's answer comes 0.5 s after its own limit). A second run, under a deadline it
+// does not reach, starts from empty responses.
 TEST_F(ManagerTest, RunDrivesEveryHeldRequestAtOnce) {
     constexpr int kSlow = 8;
     kovasim::RefusedPort refused;
@@ -174,7 +210,7 @@ TEST_F(ManagerTest, RunDrivesEveryHeldRequestAtOnce) {
 
     for (int run = 0; run < 2; ++run) {
         SCOPED_TRACE("run " + std::to_string(run));
-        EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+        EXPECT_TRUE(run == 0 ? mgr.Run() : mgr.Run(60000)) << kova_test::LogDump();
         Json::Value all = mgr.GetAllResponse();
         ASSERT_EQ(static_cast<Json::ArrayIndex>(kSlow + 4), all.size());
         for (int i = 0; i < kSlow; ++i) {
@@ -187,13 +223,16 @@ TEST_F(ManagerTest, RunDrivesEveryHeldRequestAtOnce) {
         EXPECT_EQ("", all[kSlow].asString());
         EXPECT_EQ("", removed->GetResponse());
         EXPECT_EQ("", all[kSlow + 1].asString());
-        EXPECT_EQ(KOVA::CRED_REQ_ERR_NO_URL, noUrl->GetError());
+        if (run == 0) {
+            EXPECT_EQ(KOVA::CRED_REQ_ERR_NO_URL, noUrl->GetError());
+        }
         EXPECT_EQ("", all[kSlow + 2].asString());
         long status = -1;
         ASSERT_NE(nullptr, mgr.GetRequest(kSlow + 2)->GetCurlHandler());
         curl_easy_getinfo(mgr.GetRequest(kSlow + 2)->GetCurlHandler(), CURLINFO_RESPONSE_CODE,
                           &status);
         EXPECT_EQ(0, status);
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_CONNECT, mgr.GetRequest(kSlow + 2)->GetError());
         EXPECT_EQ("slow L", all[kSlow + 3].asString());
         EXPECT_EQ(0, limited->GetResponseTimeout());
     }
@@ -222,6 +261,130 @@ TEST_F(ManagerTest, SilentServerEndsRunThroughTimeout) {
     // The answering server was served in the same run.
     EXPECT_EQ("hello", mgr.GetResponse(2));
     EXPECT_EQ("", mgr.GetResponse(0));
+}
+
+// Requests that cannot run are left out, each with its own error, and a run with nothing left
+// to run ends at once with true: a handle libcurl will not take (it is in another multi handle
+// already) leaves its request with error 8, and a URL libcurl cannot parse fails its transfer
+// with the error Process gives. A run that waited for nothing would end after the wait of 1 s
+// asked for, with the time-out.
+TEST_F(ManagerTest, HandleLibcurlWillNotTakeAndNothingLeftToRun) {
+    std::unique_ptr<CURLM, CURLMcode (*)(CURLM *)> other(curl_multi_init(), curl_multi_cleanup);
+    CredRequestMgr mgr;
+    CredRequest *taken = NewRequest(Url("/hello"), 1);
+    ASSERT_TRUE(taken->Process(false, 0));
+    ASSERT_EQ(CURLM_OK, curl_multi_add_handle(other.get(), taken->GetCurlHandler()));
+    ASSERT_EQ(0, mgr.AddCredRequest(taken));
+    ASSERT_EQ(1, mgr.AddCredRequest(NewRequest("http://bad url/", 1)));
+    ASSERT_EQ(2, mgr.AddCredRequest(NewRequest(Url("/hello"), 1)));
+    delete mgr.RemoveRequest(2);
+
+    EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_CURL_INTERNAL, taken->GetError());
+    EXPECT_EQ(1u, kova_test::LogCount("cred_request_mgr:262 CURL Error(7): "))
+        << kova_test::LogDump();
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_CURL_OTHER, mgr.GetRequest(1)->GetError());
+    EXPECT_EQ(0u, server_->RequestCount());
+    curl_multi_remove_handle(other.get(), taken->GetCurlHandler());
+
+    // With every slot emptied the default wait is 120 s; the child's alarm comes long before.
+    const std::string hello = Url("/hello");
+    const auto body = [&] {
+        CredRequestMgr emptied;
+        emptied.AddCredRequest(NewRequest(hello));
+        delete emptied.RemoveRequest(0);
+        return emptied.Run() && emptied.GetError() == KOVA::CRED_REQ_ERR_NONE ? 0 : 1;
+    };
+    EXPECT_EQ(kova_test::RunInChild(20, body), "exit 0");
+}
+
+// A response held in memory may reach the cap exactly; one byte more, or a gzip body that
+// decodes past it, fails that request's transfer with the error Process gives for it, while the
+// run itself succeeds.
+TEST_F(ManagerTest, ResponsesPastTheInMemoryCapFailTheirRequest) {
+    constexpr size_t kCap = size_t{64} << 20;
+    const std::string bomb = kovasim::GzipBomb(uint64_t{kCap} * 2);
+    kovasim::RawServer server([&](kovasim::RawServer::Connection &c) {
+        const std::string &head = c.Head();
+        if (head.find(" /bomb ") != std::string::npos) {
+            c.Send("HTTP/1.1 200 OK\r\nContent-Encoding: gzip\r\nContent-Length: " +
+                   std::to_string(bomb.size()) + "\r\n\r\n" + bomb);
+            return;
+        }
+        const size_t size = head.find(" /over ") != std::string::npos ? kCap + 1 : kCap;
+        if (!c.Send("HTTP/1.1 200 OK\r\nContent-Length: " + std::to_string(size) + "\r\n\r\n")) {
+            return;
+        }
+        const std::string block(size_t{1} << 20, 'c');
+        for (size_t sent = 0; sent < size; sent += block.size()) {
+            if (!c.Send(block.data(), std::min(block.size(), size - sent))) {
+                return;  // the client gave up
+            }
+        }
+    });
+    ASSERT_TRUE(server.Start());
+    const struct {
+        const char *path;
+        KOVA::_tag_CRED_REQ_ERR error;
+    } cases[] = {{"/cap", KOVA::CRED_REQ_ERR_NONE},
+                 {"/over", KOVA::CRED_REQ_ERR_CURL_OTHER},
+                 {"/bomb", KOVA::CRED_REQ_ERR_CURL_OTHER}};
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.path);
+        CredRequestMgr mgr;
+        CredRequest *request = NewRequest(server.BaseUrl() + c.path);
+        request->SetEncoding(true);
+        ASSERT_EQ(0, mgr.AddCredRequest(request));
+        EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetError());
+        EXPECT_EQ(c.error, request->GetError());
+        long status = 0;
+        curl_easy_getinfo(request->GetCurlHandler(), CURLINFO_RESPONSE_CODE, &status);
+        EXPECT_EQ(200, status);
+        const size_t got = request->GetResponse().size();
+        if (c.error == KOVA::CRED_REQ_ERR_NONE) {
+            EXPECT_EQ(kCap, got);
+        } else {
+            EXPECT_LE(got, kCap);
+        }
+    }
+}
+
+// A deadline for the whole run stops a transfer that trickles on (a byte a second keeps it
+// inside every quiet wait, and the manager lifts the low-speed limit) and one whose host name
+// never resolves with the time-out, while a request that answered in time keeps its answer.
+TEST_F(ManagerTest, DeadlineStopsTheRunAndItsUnfinishedRequests) {
+    constexpr int kDripBytes = 60;
+    kovasim::RawServer drip([](kovasim::RawServer::Connection &c) {
+        if (!c.Send("HTTP/1.1 200 OK\r\nContent-Length: " + std::to_string(kDripBytes) +
+                    "\r\n\r\n")) {
+            return;
+        }
+        for (int i = 0; i < kDripBytes && c.Send("d"); ++i) {
+            c.Pause(1000);
+        }
+    });
+    ASSERT_TRUE(drip.Start());
+    CredRequestMgr mgr;
+    ASSERT_EQ(0, mgr.AddCredRequest(NewRequest(drip.BaseUrl() + "/drip")));
+    ASSERT_EQ(1, mgr.AddCredRequest(NewRequest(Url("/hello"))));
+    ASSERT_EQ(2, mgr.AddCredRequest(NewRequest(std::string("http://") + kStalledHost + "/")));
+    EXPECT_FALSE(mgr.Run(-1));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
+    EXPECT_EQ(0u, server_->RequestCount());
+
+    mgr.SetError(KOVA::CRED_REQ_ERR_NONE);
+    EXPECT_FALSE(mgr.Run(2000));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, mgr.GetError());
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, mgr.GetRequest(0)->GetError());
+    EXPECT_LT(mgr.GetResponse(0).size(), static_cast<size_t>(kDripBytes));
+    EXPECT_EQ("hello", mgr.GetResponse(1));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetRequest(1)->GetError());
+    // The run did not wait for the resolver that never answers.
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, mgr.GetRequest(2)->GetError());
+    EXPECT_TRUE(gResolverStalled);
+    gReleaseResolver = true;
 }
 
 // A large raw body makes libcurl ask for "100 Continue"; a server that never sends it is waited
@@ -303,6 +466,124 @@ TEST_F(ManagerTest, SignalsDuringTheWaitAreRidden) {
         return ok && mgr.GetResponse(0) == "slow 1" ? 0 : 1;
     };
     EXPECT_EQ(kova_test::RunInChild(30, body), "exit 0");
+}
+
+// A loopback port whose accept queue is full: a new connection to it stays in its handshake,
+// where libcurl keeps no timer but the connect time-out (120 s), so nothing wakes a run.
+class FullAcceptQueue {
+  public:
+    FullAcceptQueue() {
+        listener_ = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        struct sockaddr_in address = {};
+        address.sin_family = AF_INET;
+        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        socklen_t length = sizeof(address);
+        if (listener_ < 0 || bind(listener_, reinterpret_cast<sockaddr *>(&address), length) != 0 ||
+            listen(listener_, 0) != 0 ||
+            getsockname(listener_, reinterpret_cast<sockaddr *>(&address), &length) != 0) {
+            return;
+        }
+        // Connections that are never accepted fill the queue.
+        for (int i = 0; i < 4; ++i) {
+            const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+            connect(fd, reinterpret_cast<sockaddr *>(&address), length);
+            fillers_.push_back(fd);
+        }
+        port_ = ntohs(address.sin_port);
+    }
+    ~FullAcceptQueue() {
+        for (int fd : fillers_) {
+            close(fd);
+        }
+        close(listener_);
+    }
+    FullAcceptQueue(const FullAcceptQueue &) = delete;
+    FullAcceptQueue &operator=(const FullAcceptQueue &) = delete;
+    std::string Url() const { return "http://127.0.0.1:" + std::to_string(port_) + "/never"; }
+    int Port() const { return port_; }
+
+  private:
+    int listener_ = -1;
+    std::vector<int> fillers_;
+    int port_ = 0;
+};
+
+std::atomic<CredRequestMgr *> gCancelTarget{nullptr};
+
+void CancelTarget(int) {
+    if (CredRequestMgr *mgr = gCancelTarget.load()) {
+        mgr->Cancel();
+    }
+}
+
+// Cancel ends a run at its next wake-up as an interrupted wait ends it (17, logged so), its
+// unfinished request stopped with 17 too, whether it comes from another thread (Cancel wakes
+// the wait itself) or from a signal handler; the connection that never completes would hold
+// the run for its whole wait of 30 s, past the children's alarms. A Cancel while no run is in
+// progress changes nothing.
+TEST_F(ManagerTest, CancelEndsTheRunFromAnotherThreadOrASignalHandler) {
+    const FullAcceptQueue queue;
+    ASSERT_NE(0, queue.Port());
+    const std::string never = queue.Url();
+
+    CredRequestMgr mgr;
+    ASSERT_EQ(0, mgr.AddCredRequest(NewRequest(Url("/hello"))));
+    mgr.Cancel();
+    EXPECT_TRUE(mgr.Run()) << kova_test::LogDump();
+    EXPECT_EQ("hello", mgr.GetResponse(0));
+
+    // From another thread, in a child whose alarm comes long before the run's whole wait ends.
+    const auto fromThread = [&] {
+        mgr.AddCredRequest(NewRequest(never, 30));
+        std::thread canceller([&] {
+            // Most likely the run sleeps in its wait by then; Cancel ends it wherever it is.
+            std::this_thread::sleep_for(std::chrono::milliseconds(500));
+            mgr.Cancel();
+        });
+        const bool ok = mgr.Run();
+        canceller.join();
+        const size_t logged = kova_test::LogCount(
+            "cred_request_mgr:320 curlHandlerProcess select error: Interrupted system call[4]");
+        fprintf(stderr, "run %d error %d request error %d logged %zu\n", ok, mgr.GetError(),
+                mgr.GetRequest(1)->GetError(), logged);
+        return !ok && mgr.GetError() == KOVA::CRED_REQ_ERR_SELECT &&
+                       mgr.GetRequest(1)->GetError() == KOVA::CRED_REQ_ERR_SELECT && logged == 1
+                   ? 0
+                   : 1;
+    };
+    EXPECT_EQ(kova_test::RunInChild(15, fromThread), "exit 0");
+
+    // The signals come from a process of its own, as in the test above; the first may come
+    // before the run begins.
+    const auto body = [&] {
+        struct sigaction action = {};
+        action.sa_handler = CancelTarget;
+        sigaction(SIGUSR2, &action, nullptr);
+        CredRequestMgr signalled;
+        signalled.AddCredRequest(NewRequest(never, 30));
+        gCancelTarget = &signalled;
+        const pid_t runner = getpid();
+        const pid_t signaller = fork();
+        if (signaller == 0) {
+            const struct timespec pause = {0, 100 * 1000 * 1000};
+            for (int i = 0; i < 300 && getppid() == runner; ++i) {
+                kill(runner, SIGUSR2);
+                nanosleep(&pause, nullptr);
+            }
+            _exit(0);
+        }
+        const bool ok = signalled.Run();
+        kill(signaller, SIGKILL);
+        waitpid(signaller, nullptr, 0);
+        gCancelTarget = nullptr;
+        fprintf(stderr, "run %d error %d request error %d\n", ok, signalled.GetError(),
+                signalled.GetRequest(0)->GetError());
+        return !ok && signalled.GetError() == KOVA::CRED_REQ_ERR_SELECT &&
+                       signalled.GetRequest(0)->GetError() == KOVA::CRED_REQ_ERR_SELECT
+                   ? 0
+                   : 1;
+    };
+    EXPECT_EQ(kova_test::RunInChild(20, body), "exit 0");
 }
 
 }  // namespace

@@ -3,7 +3,8 @@
 // RemoveRequest.
 //
 // Concurrency: separate managers may run on separate threads at once; one manager, with the
-// requests it holds, is used by one thread at a time.
+// requests it holds, is used by one thread at a time; only Cancel may be called while another
+// thread runs it.
 #ifndef KOVACREDENTIAL_CRED_REQUEST_MGR_H
 #define KOVACREDENTIAL_CRED_REQUEST_MGR_H
 
@@ -62,17 +63,26 @@ class KOVA_EXPORT CredRequestMgr {
     // Runs every request concurrently on the calling thread until all have finished; false on
     // the first failure of the loop itself (CRED_REQ_ERR_CURL_INTERNAL, _SELECT, or _TIMEOUT
     // after a whole wait of the largest response time-out, 120 s by default, without progress).
-    // Requests whose set-up fails are left out and keep their own error. Each request's outcome
-    // is read from the request (GetResponse, GetError of the request).
+    // Requests whose set-up fails, or whose handle libcurl will not take
+    // (CRED_REQ_ERR_CURL_INTERNAL), are left out and keep their own error; with no request left
+    // to run the result is true at once. A transfer that fails gives its request the error
+    // Process gives for the same libcurl result (a response over the in-memory cap of
+    // CredRequest ends with CRED_REQ_ERR_CURL_OTHER); a transfer that completes leaves the
+    // request's error as it was, so each request's outcome is read from the request
+    // (GetResponse, GetError, its HTTP status).
     bool Run();
-    // Run with a deadline for the whole run, in milliseconds (0: none, as Run()). When it
-    // passes, every unfinished request is stopped with CRED_REQ_ERR_TIMEOUT, the manager's
-    // error becomes CRED_REQ_ERR_TIMEOUT and the result is false.
+    // Run with a deadline for the whole run, in milliseconds from the call (0: none, as Run();
+    // negative: CRED_REQ_ERR_BAD_PARAM and false, nothing run). When it passes, every
+    // unfinished request is stopped with CRED_REQ_ERR_TIMEOUT, the manager's error becomes
+    // CRED_REQ_ERR_TIMEOUT and the result is false; a host name still being resolved is not
+    // waited for.
     bool Run(long timeoutMilliseconds);
     // Makes a Run of this manager in progress return false at its next wake-up with
-    // CRED_REQ_ERR_SELECT, its unfinished requests stopped. Async-signal-safe: may be called
-    // from a signal handler or from another thread while Run waits. Does nothing when no Run
-    // of this manager is in progress.
+    // CRED_REQ_ERR_SELECT (logged as an interrupted wait), its unfinished requests stopped with
+    // CRED_REQ_ERR_SELECT too. Async-signal-safe (errno is kept): may be called from a signal
+    // handler or from another thread while Run waits; it wakes the wait itself. Does nothing
+    // when no Run of this manager is in progress. It reaches a run that began while fewer than
+    // 256 runs were in progress in the process; a run beyond those cannot be cancelled.
     void Cancel();
     // A copy of the response body of the request at `index`; "" and CRED_REQ_ERR_BAD_PARAM for
     // a bad index.
@@ -81,11 +91,14 @@ class KOVA_EXPORT CredRequestMgr {
     Json::Value GetAllResponse();
 
     // The multi handle's socket callback: on CURL_POLL_REMOVE it marks the request holding
-    // `easy` with CRED_REQ_ERR_TIMEOUT. Always returns 0.
+    // `easy` with CRED_REQ_ERR_TIMEOUT (a failed transfer's own error replaces the mark).
+    // Always returns 0.
     static int SocketCallback(CURL *easy, curl_socket_t socket, int what, void *userp,
                               void *socketp);
-    // The transfer loop of Run: select over the multi handle's sockets, waiting at most
-    // `waitSeconds` for progress. True when every transfer has finished.
+    // The transfer loop of Run: waits on the multi handle's sockets, at most `waitSeconds`
+    // without progress, and gives a failed transfer's request its error as Run does. True when
+    // every transfer has finished (at once when none runs). Neither Cancel nor a deadline
+    // reaches it outside Run.
     bool curlHandlerProcess(CURLM *multi, long waitSeconds);
 
   private:
