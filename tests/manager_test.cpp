@@ -437,6 +437,27 @@ TEST_F(ManagerTest, DescriptorsBeyondTheSelectLimit) {
 
 void IgnoreSignal(int) {}
 
+// Forks a process that sends `sig` to this one every `ms` milliseconds, at most `count` times
+// and only while this process lives.
+pid_t StartSignaller(int sig, long ms, int count) {
+    const pid_t runner = getpid();
+    const pid_t signaller = fork();
+    if (signaller == 0) {
+        const struct timespec pause = {0, ms * 1000 * 1000};
+        for (int i = 0; i < count && getppid() == runner; ++i) {
+            kill(runner, sig);
+            nanosleep(&pause, nullptr);
+        }
+        _exit(0);
+    }
+    return signaller;
+}
+
+void StopSignaller(pid_t signaller) {
+    kill(signaller, SIGKILL);
+    waitpid(signaller, nullptr, 0);
+}
+
 // A signal that interrupts the wait does not end the run. A process of its own sends them, so
 // that the runner stays the only thread (under qemu-user on i386 a thread that signalled
 // another can no longer be joined).
@@ -446,21 +467,11 @@ TEST_F(ManagerTest, SignalsDuringTheWaitAreRidden) {
         struct sigaction action = {};
         action.sa_handler = IgnoreSignal;  // no SA_RESTART
         sigaction(SIGUSR1, &action, nullptr);
-        const pid_t runner = getpid();
-        const pid_t signaller = fork();
-        if (signaller == 0) {
-            const struct timespec pause = {0, 50 * 1000 * 1000};
-            for (int i = 0; i < 600 && getppid() == runner; ++i) {
-                nanosleep(&pause, nullptr);
-                kill(runner, SIGUSR1);
-            }
-            _exit(0);
-        }
         CredRequestMgr mgr;
         mgr.AddCredRequest(NewRequest(slow));
+        const pid_t signaller = StartSignaller(SIGUSR1, 50, 600);
         const bool ok = mgr.Run();
-        kill(signaller, SIGKILL);
-        waitpid(signaller, nullptr, 0);
+        StopSignaller(signaller);
         fprintf(stderr, "run %d error %d response %s\n", ok, mgr.GetError(),
                 mgr.GetResponse(0).c_str());
         return ok && mgr.GetResponse(0) == "slow 1" ? 0 : 1;
@@ -562,19 +573,9 @@ TEST_F(ManagerTest, CancelEndsTheRunFromAnotherThreadOrASignalHandler) {
         CredRequestMgr signalled;
         signalled.AddCredRequest(NewRequest(never, 30));
         gCancelTarget = &signalled;
-        const pid_t runner = getpid();
-        const pid_t signaller = fork();
-        if (signaller == 0) {
-            const struct timespec pause = {0, 100 * 1000 * 1000};
-            for (int i = 0; i < 300 && getppid() == runner; ++i) {
-                kill(runner, SIGUSR2);
-                nanosleep(&pause, nullptr);
-            }
-            _exit(0);
-        }
+        const pid_t signaller = StartSignaller(SIGUSR2, 100, 300);
         const bool ok = signalled.Run();
-        kill(signaller, SIGKILL);
-        waitpid(signaller, nullptr, 0);
+        StopSignaller(signaller);
         gCancelTarget = nullptr;
         fprintf(stderr, "run %d error %d request error %d\n", ok, signalled.GetError(),
                 signalled.GetRequest(0)->GetError());

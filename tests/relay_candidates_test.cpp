@@ -116,7 +116,7 @@ TEST_F(RelayCandidatesTest, DirectThenRelayCandidatesAreProbedInOrder) {
 
 // The LAN addresses are probed only on the service's port, the external address and the DDNS
 // name only on its external port. The first address probed answers as another server.
-TEST_F(RelayProbeTest, EachPortReachesItsOwnAddresses) {
+TEST_F(RelayProbeTest, EachPortReachesItsOwnAddressesAndIncompleteInformationIs402) {
     for (const bool external : {false, true}) {
         SCOPED_TRACE(external ? "external port" : "LAN port");
         ProbeTargets targets;
@@ -140,6 +140,15 @@ TEST_F(RelayProbeTest, EachPortReachesItsOwnAddresses) {
         EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
         EXPECT_EQ(client.GetServerIdMd5(), kovasim::Md5Hex("S1"));
     }
+    // Server information without both parts is 402.
+    CredRequestFarlink client;
+    Json::Value candidate;
+    for (const Json::Value &info :
+         {Json::Value("text"), ParseJson(R"({"server": {}})"), ParseJson(R"({"service": {}})")}) {
+        EXPECT_FALSE(client.GetAvailableConnInfo(info, candidate)) << info;
+        EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_CONN_INFO) << info;
+        EXPECT_EQ(client.GetErrors()["error"], info) << info;
+    }
 }
 
 TEST_F(RelayCandidatesTest, NoPortMeans405WithoutProbesAndTheTunnelIsAsked) {
@@ -162,17 +171,6 @@ TEST_F(RelayCandidatesTest, NoPortMeans405WithoutProbesAndTheTunnelIsAsked) {
     EXPECT_EQ(candidate, Candidate("http", Addr(4), relayPort));
     EXPECT_EQ(Sim().Hits("request_tunnel").size(), 1u);
     EXPECT_EQ(targets_.Order(), Names{"relay"});
-}
-
-TEST_F(RelayProbeTest, UnusableServerInformationIs402) {
-    CredRequestFarlink client;
-    Json::Value candidate;
-    for (const Json::Value &info :
-         {Json::Value("text"), ParseJson(R"({"server": {}})"), ParseJson(R"({"service": {}})")}) {
-        EXPECT_FALSE(client.GetAvailableConnInfo(info, candidate)) << info;
-        EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_CONN_INFO) << info;
-        EXPECT_EQ(client.GetErrors()["error"], info) << info;
-    }
 }
 
 TEST_F(RelayProbeTest, DeadSilentAndImpostorHostsAreSkipped) {

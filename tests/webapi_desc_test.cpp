@@ -151,18 +151,8 @@ TEST_F(WebApiDescTest, UnusableAnswersAreNotCached) {
     EXPECT_EQ("", format);
 }
 
-TEST_F(WebApiDescTest, FailedTransferSetsErrorFive) {
-    kovasim::RefusedPort closed;
-    KOVA_CRED cred = Cred(closed.Port());
-    cred.id = 11;
-    EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, CredRequestUtil::m_errCode);
-    EXPECT_TRUE(LogHas("Cred Error:[http://127.0.0.1:" + std::to_string(cred.port) +
-                       "/webapi/query.cgi][20]"))
-        << LogDump();
-}
-
-TEST_F(WebApiDescTest, BadArgumentsAndUnknownIdsAreRefusedWithoutTraffic) {
+// Bad arguments and unknown ids are refused without traffic; a failed transfer sets error 5.
+TEST_F(WebApiDescTest, BadArgumentsUnknownIdsAndFailedTransfers) {
     EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(nullptr));
     EXPECT_EQ("", CredRequestUtil::GetWebAPIPath(nullptr, "KOVA.Demo.Echo"));
     std::string format;
@@ -176,6 +166,15 @@ TEST_F(WebApiDescTest, BadArgumentsAndUnknownIdsAreRefusedWithoutTraffic) {
     EXPECT_TRUE(LogHas("Cannot find id[999] in database")) << LogDump();
     EXPECT_EQ(0u, Server().RequestCount());
     EXPECT_FALSE(CredRequestUtil::IsCredIdCached(999));
+
+    kovasim::RefusedPort closed;
+    KOVA_CRED cred = Cred(closed.Port());
+    cred.id = 11;
+    EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, CredRequestUtil::m_errCode);
+    EXPECT_TRUE(LogHas("Cred Error:[http://127.0.0.1:" + std::to_string(cred.port) +
+                       "/webapi/query.cgi][20]"))
+        << LogDump();
 }
 
 }  // namespace

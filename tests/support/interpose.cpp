@@ -147,6 +147,14 @@ void ClearSleeps() {
     gSleeps.clear();
 }
 
+std::string Pattern(size_t size) {
+    std::string text(size, '\0');
+    for (size_t i = 0; i < size; ++i) {
+        text[i] = static_cast<char>('a' + (i * 7 + i / 251) % 26);
+    }
+    return text;
+}
+
 File StreamWith(const std::string &text, bool atEnd) {
     File f(tmpfile());
     if (f) {

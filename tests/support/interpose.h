@@ -51,6 +51,9 @@ class FakeSleepScope {
 File StreamWith(const std::string &text, bool atEnd = false);
 // Everything `f` holds (after flushing it), from its start.
 std::string ReadAll(FILE *f);
+// `size` letters in a pattern that does not repeat within a few kilobytes, so that a body cut,
+// doubled or shifted anywhere shows.
+std::string Pattern(size_t size);
 
 }  // namespace kova_test
 
