@@ -3,6 +3,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <pthread.h>
+#include <stddef.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -16,6 +17,7 @@
 
 #include "credential/cred_internal.h"
 #include "kovacredential/kovacred_db.h"
+#include "platform/kova_env.h"
 #include "platform/kova_log.h"
 #include "platform/vlibc.h"
 
@@ -27,7 +29,9 @@ constexpr const char kUnit[] = "cred_db";
 
 // Lines that the messages of this unit carry.
 constexpr int kLineChmodFailed = 165;
+constexpr int kLineOtherOwner = 166;
 constexpr int kLineRefused = 167;
+constexpr int kLineModeRefused = 168;
 constexpr int kLineOpenError = 169;
 constexpr int kLineOpenLog = 170;
 constexpr int kLinePragma = 174;
@@ -207,37 +211,79 @@ class FileDescriptor {
     int fd_;
 };
 
-struct FreeDeleter {
-    void operator()(char *p) const { free(p); }
-};
-
-// The path with its folder resolved to a path free of symbolic links; the path as it is when
-// the folder cannot be resolved.
-std::string ResolveFolder(const std::string &path) {
-    const size_t slash = path.rfind('/');
-    if (slash == std::string::npos || slash + 1 == path.size()) {
-        return path;
-    }
-    std::unique_ptr<char, FreeDeleter> folder(
-        realpath(slash == 0 ? "/" : path.substr(0, slash).c_str(), nullptr));
-    if (!folder) {
-        return path;
-    }
-    return std::string(folder.get()) + (folder.get()[1] == '\0' ? "" : "/") +
-           path.substr(slash + 1);
-}
-
-// sqlite3_open_v2 of an existing file for reading and writing, never through a link.
-int OpenNoFollow(const char *path, sqlite3 **db) {
-    *db = nullptr;
-    return sqlite3_open_v2(path, db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOFOLLOW, nullptr);
-}
-
-// Refuses to open the database file: logs why and fails as a failed open does.
-sqlite3 *Refuse(const std::string &path, const char *why) {
-    Log("%s:%d %s %s, not opened.\n", kUnit, kLineRefused, path.c_str(), why);
+// Refuses to open the database file: logs why at `line` and fails as a failed open does.
+sqlite3 *Refuse(int line, const std::string &path, const char *why) {
+    Log("%s:%d %s %s, not opened.\n", kUnit, line, path.c_str(), why);
     VLIBCErrSetEx(KOVA_ERR_DB_OPEN, kUnit, kLineOpenError);
     return nullptr;
+}
+
+bool SameFile(const struct stat &a, const struct stat &b) {
+    return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
+}
+
+// A descriptor of the file at `path` that fchmod takes: for reading and writing, or for
+// reading where writing is refused (a read-only mount). O_NONBLOCK, so that a FIFO swapped in
+// since the type check cannot make the open wait. -1 with errno set when there is none.
+int OpenForMode(const std::string &path) {
+    constexpr int kFlags = O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
+    const int fd = open(path.c_str(), O_RDWR | kFlags);
+    return fd >= 0 ? fd : open(path.c_str(), O_RDONLY | kFlags);
+}
+
+// Sets mode 0600 on the regular file `checked` describes, reached through `path`; the file
+// must still be that one. Returns 0, or the errno of the failure (ESTALE when another file
+// took its place).
+int SetMode(const std::string &path, const struct stat &checked) {
+    FileDescriptor file(OpenForMode(path));
+    // A file of ours that lost its read and write bits cannot be opened: its mode is set through
+    // the path, which can change only a file of ours (the caller is its owner), and the file
+    // opened then is compared like any other.
+    if (file.get() < 0 && errno == EACCES && chmod(path.c_str(), 0600) == 0) {
+        file.reset(OpenForMode(path));
+    }
+    struct stat now;
+    if (file.get() < 0 || fstat(file.get(), &now) != 0) {
+        return errno;
+    }
+    if (!SameFile(now, checked)) {
+        return ESTALE;
+    }
+    return fchmod(file.get(), 0600) == 0 ? 0 : errno;
+}
+
+// The descriptor through which SQLite reads and writes the main database of `db`, or -1 when
+// `db` does not use one of SQLite's unix VFSs. SQLite has no interface that gives it; the file
+// object of every unix VFS (unixFile in SQLite's os_unix.c) begins with its methods, its VFS,
+// its inode record and then the descriptor, a layout that has not changed since SQLite 3.7.
+int SqliteDescriptor(sqlite3 *db) {
+    struct UnixFileHead {
+        const sqlite3_io_methods *methods;
+        sqlite3_vfs *vfs;
+        void *inode;
+        int fd;
+    };
+    sqlite3_vfs *vfs = nullptr;
+    sqlite3_file *file = nullptr;
+    if (sqlite3_file_control(db, "main", SQLITE_FCNTL_VFS_POINTER, &vfs) != SQLITE_OK ||
+        vfs == nullptr || vfs->zName == nullptr ||
+        (strcmp(vfs->zName, "unix") != 0 && strncmp(vfs->zName, "unix-", 5) != 0) ||
+        sqlite3_file_control(db, "main", SQLITE_FCNTL_FILE_POINTER, &file) != SQLITE_OK ||
+        file == nullptr || file->pMethods == nullptr) {
+        return -1;
+    }
+    int fd = -1;
+    memcpy(&fd, reinterpret_cast<const char *>(file) + offsetof(UnixFileHead, fd), sizeof(fd));
+    return fd;
+}
+
+// Whether SQLite's connection `db` holds the file `checked` describes. Where SQLite's
+// descriptor cannot be had (a VFS of the caller's), the file the path names now is compared.
+bool HoldsFile(sqlite3 *db, const std::string &path, const struct stat &checked) {
+    struct stat opened;
+    const int fd = SqliteDescriptor(db);
+    const int rc = fd >= 0 ? fstat(fd, &opened) : stat(path.c_str(), &opened);
+    return rc == 0 && SameFile(opened, checked);
 }
 
 bool Given(const char *text) {
@@ -301,8 +347,23 @@ int NewestCredIdByApplication(sqlite3 *db, const char *application) {
 }
 
 std::string DatabasePath() {
-    const char *path = secure_getenv("kovacredential_db");
+    const char *path = kova::SecureEnv(kova::kEnvDatabase);
     return (path != nullptr && *path != '\0') ? path : kDefaultDatabasePath;
+}
+
+void SleepFully(uint32_t micros) {
+    timespec start;
+    clock_gettime(CLOCK_MONOTONIC, &start);
+    for (uint32_t left = micros; usleep(left) != 0 && errno == EINTR;) {
+        timespec now;
+        clock_gettime(CLOCK_MONOTONIC, &now);
+        const int64_t slept = (static_cast<int64_t>(now.tv_sec) - start.tv_sec) * 1000000 +
+                              (now.tv_nsec - start.tv_nsec) / 1000;
+        if (slept >= static_cast<int64_t>(micros)) {
+            break;
+        }
+        left = micros - static_cast<uint32_t>(slept);
+    }
 }
 
 uint32_t LockBackoffMicros(int randomValue) {
@@ -328,7 +389,7 @@ ExecResult ExecWithRetry(sqlite3 *db, const char *sql, sqlite3_callback callback
             *errorMessage = std::move(message);
             return ExecResult::kFailed;
         }
-        usleep(LockBackoffMicros(rand()));
+        SleepFully(LockBackoffMicros(rand()));
     }
 }
 
@@ -357,59 +418,62 @@ sqlite3 *KOVACredDBInit(void) {
         VLIBCErrSetEx(KOVA_ERR_OUT_OF_MEMORY, kUnit, kLineOpenError);
         return nullptr;
     }
-    // Only a regular file is opened, and its mode is set on the file a descriptor holds, so that
-    // whoever names the path cannot have another file changed. O_PATH with O_NOFOLLOW holds a
-    // link itself rather than its target, opens a FIFO or device without touching it, and needs
-    // no read permission, so a file whose mode lost its read bits is still set back to 0600.
-    // Where nothing can be held the file is missing: it is made, and a failure to make it shows
-    // up below, where setting the mode and the open fail.
-    FileDescriptor file(open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-    if (file.get() < 0) {
-        VLIBCFileTouch(path.c_str());
-        file.reset(open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    // Only a regular file of the effective user is opened, a link to one included. It is held
+    // by an O_PATH descriptor, which touches no FIFO or device and needs no permission, for the
+    // checks; its mode is set through a descriptor of the same file; and SQLite's own
+    // descriptor must hold it too, so that a file swapped in at the path meanwhile is refused.
+    // The held descriptor stays open until the end, so the checked file cannot go and leave
+    // its inode number to another; closing it releases none of SQLite's locks, as an O_PATH
+    // descriptor holds none. Where nothing can be held the file is missing: it is made (never
+    // through a dangling link), and a failure to make it shows up below, where the open fails.
+    FileDescriptor held(open(path.c_str(), O_PATH | O_CLOEXEC));
+    if (held.get() < 0 && errno == ENOENT) {
+        if (VLIBCFileTouch(path.c_str()) != 0 && errno == ELOOP) {
+            return Refuse(kLineRefused, path, "is a symbolic link");
+        }
+        held.reset(open(path.c_str(), O_PATH | O_CLOEXEC));
     }
     struct stat st;
-    const bool opened = file.get() >= 0 && fstat(file.get(), &st) == 0;
-    if (opened && !S_ISREG(st.st_mode)) {
-        return Refuse(path, S_ISLNK(st.st_mode) ? "is a symbolic link" : "is not a regular file");
-    }
-    int modeError = opened ? 0 : errno;
-    if (opened) {
-        // fchmod does not take an O_PATH descriptor; its /proc name leads to that file only.
-        char held[64];
-        snprintf(held, sizeof(held), "/proc/self/fd/%d", file.get());
-        modeError = chmod(held, 0600) == 0 ? 0 : errno;
+    const bool checked = held.get() >= 0 && fstat(held.get(), &st) == 0;
+    int modeError = errno;
+    if (checked) {
+        if (!S_ISREG(st.st_mode)) {
+            return Refuse(kLineRefused, path, "is not a regular file");
+        }
+        if (st.st_uid != geteuid()) {
+            kova::Log("%s:%d %s belongs to uid %lu, not to the effective uid %lu, not opened.\n",
+                      kUnit, kLineOtherOwner, path.c_str(), static_cast<unsigned long>(st.st_uid),
+                      static_cast<unsigned long>(geteuid()));
+            VLIBCErrSetEx(KOVA_ERR_DB_OPEN, kUnit, kLineOpenError);
+            return nullptr;
+        }
+        modeError = SetMode(path, st);
+        if (modeError == ESTALE) {
+            return Refuse(kLineRefused, path, "was replaced while being opened");
+        }
     }
     if (modeError != 0) {
         kova::Log("%s:%d %s chmod failed. errno=[0x%04X]", kUnit, kLineChmodFailed, path.c_str(),
                   modeError);
     }
-    // The file exists by now, so SQLite is not asked to create one (it would not set the mode).
-    // SQLite's NOFOLLOW open refuses a link anywhere in the path, while a linked folder is a
-    // normal set-up: such a path is opened again with its folder resolved.
-    sqlite3 *raw = nullptr;
-    int rc = OpenNoFollow(path.c_str(), &raw);
-    if (rc != SQLITE_OK && sqlite3_extended_errcode(raw) == SQLITE_CANTOPEN_SYMLINK) {
-        sqlite3_close(raw);
-        try {
-            rc = OpenNoFollow(ResolveFolder(path).c_str(), &raw);
-        } catch (const std::bad_alloc &) {
-            VLIBCErrSetEx(KOVA_ERR_OUT_OF_MEMORY, kUnit, kLineOpenError);
-            return nullptr;
-        }
+    // Credentials never go into a file that others may read: a file whose mode stays wider is
+    // refused (one already at 0600 on a read-only mount is used).
+    struct stat now;
+    if (checked && modeError != 0 &&
+        (fstat(held.get(), &now) != 0 || (now.st_mode & 07777) != 0600)) {
+        return Refuse(kLineModeRefused, path, "cannot be given mode 0600");
     }
-    if (rc != SQLITE_OK) {
+    // The file exists by now, so SQLite is not asked to create one (it would not set the mode).
+    sqlite3 *raw = nullptr;
+    if (sqlite3_open_v2(path.c_str(), &raw, SQLITE_OPEN_READWRITE, nullptr) != SQLITE_OK) {
         VLIBCErrSetEx(KOVA_ERR_DB_OPEN, kUnit, kLineOpenError);
         kova::Log("%s:%d Can't open database: %s\n", kUnit, kLineOpenLog, sqlite3_errmsg(raw));
         sqlite3_close(raw);
         return nullptr;
     }
     Database db(raw);
-    // The file SQLite opened must be the one whose mode was set, not one swapped in since.
-    struct stat now;
-    if (opened &&
-        (lstat(path.c_str(), &now) != 0 || now.st_dev != st.st_dev || now.st_ino != st.st_ino)) {
-        return Refuse(path, "was replaced while being opened");
+    if (!checked || !HoldsFile(db.get(), path, st)) {
+        return Refuse(kLineRefused, path, "was replaced while being opened");
     }
     // SQLite reads the file only at the first statement, so a file that is not a database
     // fails here rather than at the open.

@@ -48,6 +48,10 @@ constexpr int kLockAttempts = 101;
 // So a negative sum becomes 999999 and the pause is always in [0, 999999].
 uint32_t LockBackoffMicros(int randomValue);
 
+// usleep(micros), resumed with the time still left whenever a signal ends it early, so that the
+// whole pause passes whatever signals arrive.
+void SleepFully(uint32_t micros);
+
 enum class ExecResult {
     kOk,
     kFailedSilently,  // SQLite gave no message; callers give up without a log
@@ -55,7 +59,8 @@ enum class ExecResult {
 };
 
 // Executes `sql` with sqlite3_exec, retrying while SQLite reports "database is locked"
-// (kLockAttempts executions at most, a LockBackoffMicros pause before each retry). On
+// (kLockAttempts executions at most, a LockBackoffMicros pause slept in full before each
+// retry). On
 // kFailed, *errorMessage holds SQLite's message of the last attempt.
 ExecResult ExecWithRetry(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg,
                          SqlText *errorMessage);

@@ -2,14 +2,18 @@
 // the server id and its MD5, the error state, and one directory request to "/Serv.php".
 #include "request/cred_request_farlink_p.h"
 
+#include <limits.h>
 #include <stdlib.h>
 
+#include <algorithm>
+#include <chrono>
 #include <memory>
 #include <new>
 
 #include <openssl/evp.h>
 
 #include "platform/json_text.h"
+#include "platform/kova_env.h"
 #include "platform/kova_log.h"
 
 namespace KOVA {
@@ -27,7 +31,7 @@ const long kDefaultTimeout = 5;
 std::string HostFromEnv(const char *variable, const char *fallback) {
     // Ignored in setuid and setgid processes, so that whoever starts them cannot redirect
     // look-ups to a directory of their own.
-    const char *value = secure_getenv(variable);
+    const char *value = kova::SecureEnv(variable);
     return (value != nullptr && value[0] != '\0') ? std::string(value) : std::string(fallback);
 }
 
@@ -125,9 +129,62 @@ void CredRequestFarlinkPrivate::Clear() {
     timeout = kDefaultTimeout;
 }
 
+// ---- Deadline of one operation.
+
+void CredRequestFarlinkPrivate::SetTotalTimeout(long milliseconds) {
+    totalTimeout = std::max(milliseconds, 0L);
+}
+
+CredRequestFarlinkPrivate::DeadlineScope::DeadlineScope(CredRequestFarlinkPrivate &client,
+                                                        long milliseconds)
+    : client_(client), started_(!client.deadlineRunning && milliseconds > 0) {
+    if (started_) {
+        client_.deadline =
+            std::chrono::steady_clock::now() + std::chrono::milliseconds(milliseconds);
+        client_.deadlineRunning = true;
+    }
+}
+
+CredRequestFarlinkPrivate::DeadlineScope::~DeadlineScope() {
+    if (started_) {
+        client_.deadlineRunning = false;
+    }
+}
+
+bool CredRequestFarlinkPrivate::DeadlineExpired() const {
+    return deadlineRunning && std::chrono::steady_clock::now() >= deadline;
+}
+
+bool CredRequestFarlinkPrivate::BoundRequest(CredRequest &request, long responseTimeout,
+                                             long defaultTimeout) {
+    if (responseTimeout > 0) {
+        request.SetResponseTimeout(responseTimeout);
+    }
+    if (defaultTimeout > 0) {
+        request.SetDefaultTimeout(defaultTimeout);
+    }
+    if (!deadlineRunning) {
+        return true;
+    }
+    // Rounded up, so that a request cut short by it ends at or after the deadline and its
+    // failure is seen as the deadline's.
+    const long long left =
+        std::chrono::ceil<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now())
+            .count();
+    if (left <= 0) {
+        return false;
+    }
+    return request.SetTotalTimeout(static_cast<long>(std::min<long long>(left, LONG_MAX)));
+}
+
 // ---- Errors.
 
 void CredRequestFarlinkPrivate::SetError(KOVA::_tag_CRED_REQ_ERR code, const Json::Value &detail) {
+    if (DeadlineExpired()) {
+        error = CRED_REQ_ERR_TIMEOUT;
+        errorDetail = Json::Value();
+        return;
+    }
     error = code;
     errorDetail = detail;
 }
@@ -190,6 +247,10 @@ CredRequest *CredRequestFarlinkPrivate::CreateFarlinkRequest(const Json::Value &
         SetError(CRED_REQ_ERR_UNKNOWN, "Cannot set timeout");
         return nullptr;
     }
+    if (!BoundRequest(*request, 0, 0)) {
+        SetError(CRED_REQ_ERR_TIMEOUT, Json::Value());
+        return nullptr;
+    }
     if (!request->AddRawParam(kova::JsonToString(body))) {
         SetError(CRED_REQ_ERR_UNKNOWN, body);
         return nullptr;
@@ -209,22 +270,10 @@ bool CredRequestFarlinkPrivate::SendFarlinkRequest(const Json::Value &body, Json
     }
     const std::string text = request->GetResponse();
     if (!kova::JsonFromString(text, answer)) {
-        SetError(CRED_REQ_ERR_SERVER_ERRNO, ResponseDetail(text));
+        SetError(CRED_REQ_ERR_SERVER_ERRNO, Json::Value(text));
         return false;
     }
     return true;
-}
-
-Json::Value CredRequestFarlinkPrivate::ResponseDetail(const std::string &text) {
-    size_t length = text.size();
-    if (length > kResponseDetailLimit) {
-        // Cut at a character boundary so that the detail stays valid UTF-8 text.
-        length = kResponseDetailLimit;
-        while (length > 0 && (static_cast<unsigned char>(text[length]) & 0xC0) == 0x80) {
-            --length;
-        }
-    }
-    return Json::Value(text.data(), text.data() + length);
 }
 
 // ---- CredRequestFarlink: the public object owns one implementation object.
@@ -263,6 +312,10 @@ void CredRequestFarlink::SetServerName(const std::string &name) {
 
 void CredRequestFarlink::SetTimeout(long seconds) {
     Configure(d, [&](CredRequestFarlinkPrivate &p) { p.SetTimeout(seconds); });
+}
+
+void CredRequestFarlink::SetTotalTimeout(long milliseconds) {
+    Configure(d, [&](CredRequestFarlinkPrivate &p) { p.SetTotalTimeout(milliseconds); });
 }
 
 void CredRequestFarlink::SetServerId(const std::string &serverId) {

@@ -63,14 +63,21 @@ bool CredRequestFarlinkPrivate::ProbeCandidates(const std::vector<ProbeTarget> &
         }
         probe->SetURL(*target.protocol, target.host->isString() ? target.host->asString() : "",
                       target.port, kProbePath);
-        if (direct) {
-            probe->SetResponseTimeout(kDirectResponseTimeout);
-            probe->SetDefaultTimeout(kDirectDefaultTimeout);
+        if (!BoundRequest(*probe, direct ? kDirectResponseTimeout : 0,
+                          direct ? kDirectDefaultTimeout : 0)) {
+            break;
         }
         if (probe->Process(true, 0) && IsProbeAnswer(probe->GetResponse())) {
             candidate = Candidate(*target.protocol, *target.host, target.port);
             break;
         }
+        if (DeadlineExpired()) {
+            break;
+        }
+    }
+    // A failed probe sets no error; running out of time does.
+    if (candidate.empty() && DeadlineExpired()) {
+        SetError(CRED_REQ_ERR_TIMEOUT, Json::Value());
     }
     return !candidate.empty();
 }
@@ -162,8 +169,13 @@ bool CredRequestFarlink::GetAvailableConnInfo(const Json::Value &serverInfo,
                                    d->SetError(CRED_REQ_ERR_NO_CONN_INFO, serverInfo);
                                    return false;
                                }
+                               CredRequestFarlinkPrivate::DeadlineScope scope(*d);
                                if (d->GetAvailableDirectConnInfo(serverInfo, candidate)) {
                                    return true;
+                               }
+                               if (d->DeadlineExpired()) {
+                                   d->SetError(CRED_REQ_ERR_TIMEOUT, Json::Value());
+                                   return false;
                                }
                                // The tunnel is asked of the site that gave the server information.
                                Json::Value tunnelAnswer;
@@ -174,43 +186,64 @@ bool CredRequestFarlink::GetAvailableConnInfo(const Json::Value &serverInfo,
                            });
 }
 
-namespace {
-
-// One whole look-up with a client of its own: the HTTPS service first, then the plain one.
-bool ResolveServer(const std::string &serverId, const char *httpsService, const char *plainService,
-                   Json::Value &candidate, Json::Value *errors) {
+bool CredRequestFarlinkPrivate::Resolve(const std::string &serverId, const char *httpsService,
+                                        const char *plainService, Json::Value &candidate,
+                                        Json::Value *errors, long milliseconds) {
     return kova::Guarded(kFarlinkGuardUnit, kLineConnException, false, [&]() -> bool {
         CredRequestFarlink client;
+        if (client.d == nullptr) {
+            if (errors != nullptr) {
+                *errors = client.GetErrors();
+            }
+            return false;
+        }
+        CredRequestFarlinkPrivate &d = *client.d;
+        // One deadline for the whole look-up, both services included.
+        DeadlineScope scope(d, milliseconds);
         if (serverId.empty()) {
-            client.SetError(CRED_REQ_ERR_NO_SERVER_ID);
+            d.SetError(CRED_REQ_ERR_NO_SERVER_ID, Json::Value());
         } else {
-            client.SetServerId(serverId);
+            d.SetServerId(serverId);
             for (const char *service : {httpsService, plainService}) {
-                client.SetServiceId(service);
+                d.SetServiceId(service);
                 Json::Value info;
                 if (client.GetAvailableServerInfo(info) &&
                     client.GetAvailableConnInfo(info, candidate)) {
                     return true;
                 }
+                if (d.DeadlineExpired()) {
+                    d.SetError(CRED_REQ_ERR_TIMEOUT, Json::Value());
+                    break;
+                }
             }
         }
         if (errors != nullptr) {
-            *errors = client.GetErrors();
+            *errors = d.GetErrors();
         }
         return false;
     });
 }
 
-}  // namespace
-
 bool CredRequestFarlink::GetConnInfo(const std::string &serverId, Json::Value &candidate,
                                      Json::Value *errors) {
-    return ResolveServer(serverId, "zon_https", "zon", candidate, errors);
+    return GetConnInfo(serverId, candidate, errors, 0);
 }
 
 bool CredRequestFarlink::GetConnInfoPortal(const std::string &serverId, Json::Value &candidate,
                                            Json::Value *errors) {
-    return ResolveServer(serverId, "zon_portal_https", "zon_portal", candidate, errors);
+    return GetConnInfoPortal(serverId, candidate, errors, 0);
+}
+
+bool CredRequestFarlink::GetConnInfo(const std::string &serverId, Json::Value &candidate,
+                                     Json::Value *errors, long timeoutMilliseconds) {
+    return CredRequestFarlinkPrivate::Resolve(serverId, "zon_https", "zon", candidate, errors,
+                                              timeoutMilliseconds);
+}
+
+bool CredRequestFarlink::GetConnInfoPortal(const std::string &serverId, Json::Value &candidate,
+                                           Json::Value *errors, long timeoutMilliseconds) {
+    return CredRequestFarlinkPrivate::Resolve(serverId, "zon_portal_https", "zon_portal", candidate,
+                                              errors, timeoutMilliseconds);
 }
 
 }  // namespace KOVA

@@ -68,6 +68,7 @@ CredRequest *CredRequestFarlink::GetServerInfo() {
     return kova::GuardedOn(
         kFarlinkGuardUnit, kLineInfoException, d, static_cast<CredRequest *>(nullptr),
         [&](CredRequestFarlinkPrivate &) -> CredRequest * {
+            CredRequestFarlinkPrivate::DeadlineScope scope(*d);
             if (d->GetServerId().empty()) {
                 d->SetError(CRED_REQ_ERR_NO_SERVER_ID, Json::Value());
                 return nullptr;
@@ -85,6 +86,7 @@ CredRequest *CredRequestFarlink::GetServerInfo() {
 bool CredRequestFarlink::GetServerInfo(Json::Value &info) {
     return kova::GuardedOn(
         kFarlinkGuardUnit, kLineInfoException, d, false, [&](CredRequestFarlinkPrivate &) -> bool {
+            CredRequestFarlinkPrivate::DeadlineScope scope(*d);
             std::unique_ptr<CredRequest> request(GetServerInfo());
             if (!request) {
                 d->SetError(CRED_REQ_ERR_UNKNOWN, Json::Value());
@@ -96,8 +98,7 @@ bool CredRequestFarlink::GetServerInfo(Json::Value &info) {
             }
             const std::string text = request->GetResponse();
             if (!d->CheckResponse(text, &info)) {
-                d->SetError(CRED_REQ_ERR_SERVER_ERRNO,
-                            CredRequestFarlinkPrivate::ResponseDetail(text));
+                d->SetError(CRED_REQ_ERR_SERVER_ERRNO, Json::Value(text));
                 return false;
             }
             return true;
@@ -109,6 +110,7 @@ bool CredRequestFarlink::GetSiteList(Json::Value &answer) {
         kFarlinkGuardUnit, kLineInfoException, d, false, [&](CredRequestFarlinkPrivate &) -> bool {
             // The site list always comes from the global directory host; the configured
             // server name is put back on every path.
+            CredRequestFarlinkPrivate::DeadlineScope scope(*d);
             ServerNameScope global(*d, CredRequestFarlinkPrivate::GlobalServerName());
             return SendCommand(*d, Command("get_site_list"), answer);
         });
@@ -117,6 +119,7 @@ bool CredRequestFarlink::GetSiteList(Json::Value &answer) {
 bool CredRequestFarlink::GetAvailableServerInfo(Json::Value &info) {
     return kova::GuardedOn(kFarlinkGuardUnit, kLineInfoException, d, false,
                            [&](CredRequestFarlinkPrivate &) -> bool {
+                               CredRequestFarlinkPrivate::DeadlineScope scope(*d);
                                Json::Value list;
                                if (!GetSiteList(list)) {
                                    return false;
@@ -135,6 +138,10 @@ bool CredRequestFarlink::GetAvailableServerInfo(Json::Value &info) {
                                    Json::Value candidate;
                                    if (GetServerInfo(candidate)) {
                                        info.swap(candidate);
+                                       break;
+                                   }
+                                   if (d->DeadlineExpired()) {
+                                       d->SetError(CRED_REQ_ERR_TIMEOUT, Json::Value());
                                        break;
                                    }
                                }
@@ -159,6 +166,7 @@ bool CredRequestFarlinkPrivate::SiteHosts(const Json::Value &siteList,
 bool CredRequestFarlink::RequestTunnel(Json::Value &answer) {
     return kova::GuardedOn(
         kFarlinkGuardUnit, kLineInfoException, d, false, [&](CredRequestFarlinkPrivate &) -> bool {
+            CredRequestFarlinkPrivate::DeadlineScope scope(*d);
             if (d->GetServerId().empty()) {
                 d->SetError(CRED_REQ_ERR_BAD_PARAM, Json::Value());
                 return false;

@@ -4,6 +4,7 @@
 #ifndef KOVA_REQUEST_CRED_REQUEST_FARLINK_P_H
 #define KOVA_REQUEST_CRED_REQUEST_FARLINK_P_H
 
+#include <chrono>
 #include <string>
 #include <vector>
 
@@ -51,17 +52,45 @@ class CredRequestFarlinkPrivate {
     // Server name, both HTTPS flags and the time-out back to their defaults.
     void Clear();
 
+    // ---- Deadline of one operation.
+    // Milliseconds each whole operation may take; 0 or less: no deadline.
+    void SetTotalTimeout(long milliseconds);
+    // Starts the deadline of an operation unless an enclosing operation already runs one
+    // (GetAvailableConnInfo asking for a tunnel, a look-up running its commands), and ends it
+    // with the scope that started it.
+    class DeadlineScope {
+      public:
+        explicit DeadlineScope(CredRequestFarlinkPrivate &client)
+            : DeadlineScope(client, client.totalTimeout) {}
+        DeadlineScope(CredRequestFarlinkPrivate &client, long milliseconds);
+        ~DeadlineScope();
+        DeadlineScope(const DeadlineScope &) = delete;
+        DeadlineScope &operator=(const DeadlineScope &) = delete;
+
+      private:
+        CredRequestFarlinkPrivate &client_;
+        bool started_;
+    };
+    // Whether a running deadline has passed.
+    bool DeadlineExpired() const;
+    // Gives `request` the time-outs it is meant to have (`responseTimeout` and
+    // `defaultTimeout` in seconds; 0 leaves the request's own) and, while a deadline runs,
+    // what is left of it as the request's total time-out. False, setting no error, when
+    // nothing is left.
+    bool BoundRequest(CredRequest &request, long responseTimeout, long defaultTimeout);
+    // The whole look-up of GetConnInfo and GetConnInfoPortal: `httpsService`, then
+    // `plainService`, within `milliseconds` (0: no deadline).
+    static bool Resolve(const std::string &serverId, const char *httpsService,
+                        const char *plainService, Json::Value &candidate, Json::Value *errors,
+                        long milliseconds);
+
     // ---- Errors.
     KOVA::_tag_CRED_REQ_ERR GetError() const { return error; }
+    // Stores code and detail; inside an operation whose deadline has passed, every failure is
+    // CRED_REQ_ERR_TIMEOUT without detail, whatever step noticed it.
     void SetError(KOVA::_tag_CRED_REQ_ERR code, const Json::Value &detail);
     // {"code": error, "error": detail}; "error" only when the detail is not empty.
     Json::Value GetErrors() const;
-    // The most of a response's text an error detail carries: a hostile or broken directory
-    // can send any amount, and the detail is copied again by every GetErrors.
-    static constexpr size_t kResponseDetailLimit = 4096;
-    // `text` as a JSON string, cut to at most kResponseDetailLimit bytes.
-    static Json::Value ResponseDetail(const std::string &text);
-
     // ---- Directory protocol.
     // Whether a directory answer is an object whose "errno" is 0 (a missing one counts as 0).
     static bool IsSuccessAnswer(const Json::Value &answer);
@@ -115,6 +144,9 @@ class CredRequestFarlinkPrivate {
     Json::Value errorDetail;
     std::string serviceId = "zon";
     std::string serviceProtocol = "http";
+    long totalTimeout = 0;
+    bool deadlineRunning = false;
+    std::chrono::steady_clock::time_point deadline;
 };
 
 }  // namespace KOVA

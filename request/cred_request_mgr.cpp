@@ -494,6 +494,9 @@ bool CredRequestMgr::Run(long timeoutMilliseconds) {
             // The select loop below is the only time limit of a managed transfer.
             request->SetResponseTimeout(0);
             if (request->Process(false, 0)) {
+                // A run that stops early (its deadline, Cancel) leaves a resolver thread that
+                // has not answered to finish on its own instead of waiting for it.
+                curl_easy_setopt(request->GetCurlHandler(), CURLOPT_QUICK_EXIT, 1L);
                 StartOrQueue(multi, request, control);
             }
         }

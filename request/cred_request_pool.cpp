@@ -12,11 +12,11 @@
 #include <mutex>
 #include <vector>
 
+#include "platform/kova_env.h"
+
 namespace KOVA {
 
 namespace {
-
-constexpr char kNoReuseEnv[] = "kovacredential_no_reuse";
 
 using Clock = std::chrono::steady_clock;
 
@@ -181,7 +181,7 @@ constexpr long kMaxIdleConnectionsPerThread = 64;
 }  // namespace
 
 bool CredRequestPool::ReuseEnabled() {
-    return secure_getenv(kNoReuseEnv) == nullptr;
+    return kova::SecureEnv(kova::kEnvNoReuse) == nullptr;
 }
 
 unsigned CredRequestPool::Generation() {

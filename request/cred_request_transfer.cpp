@@ -10,6 +10,7 @@
 #include <stdexcept>
 
 #include "platform/json_text.h"
+#include "platform/kova_env.h"
 #include "platform/kova_log.h"
 #include "request/cred_request_p.h"
 #include "request/cred_request_pool.h"
@@ -172,7 +173,7 @@ bool CredRequestPrivate::InitCurlHandler() {
     if (encoding && !SetOption(CURLOPT_ACCEPT_ENCODING, "")) {
         return false;
     }
-    if (secure_getenv(kDebugEnv) != nullptr) {
+    if (kova::SecureEnv(kDebugEnv) != nullptr) {
         if (!SetOption(CURLOPT_VERBOSE, 1L) ||
             !SetOption(CURLOPT_DEBUGFUNCTION, &CredRequestPrivate::DebugCallback)) {
             return false;

@@ -135,8 +135,8 @@ bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
         request.SetFollowLocation(false);
         if (!request.SetURL(cred->protocol, cred->host, cred->port, path)) {
             kova::Log("%s:%d SetURL failed. %s %s %ld %s", kUnit, kLineRedirSetUrl,
-                      cred->protocol.c_str(), cred->host.c_str(), static_cast<long>(cred->port),
-                      path.c_str());
+                      cred->protocol.c_str(), kova::UrlForLog(cred->host).c_str(),
+                      static_cast<long>(cred->port), path.c_str());
             return false;
         }
         request.SetResponseTimeout(30);

@@ -14,7 +14,6 @@
 
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
-#include "request/cred_request_util_p.h"
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
 #include "request/cred_request_util_p.h"
@@ -93,9 +92,14 @@ constexpr int kLineDescInvalid = 86;
 constexpr int kLineDescFail = 90;
 constexpr int kLineDescException = 96;
 
+// The most a parsed description may take (JsonParseCost): it stays in the cache for the life
+// of the process, so a larger answer is refused as invalid however much the parse budget of its
+// text would allow. Real servers describe a few thousand APIs in well under a megabyte.
+constexpr uint64_t kMaxDescriptionCost = uint64_t{16} << 20;
+
 bool StoreWebAPIDescAnswer(const std::string &key, const std::string &body) {
     Json::Value answer;
-    if (!kova::JsonFromString(body, answer)) {
+    if (!kova::JsonFromString(body, answer, kMaxDescriptionCost)) {
         kova::Log("%s:%d Query response is invalid", kUnit, kLineDescInvalid);
         return false;
     }
@@ -103,8 +107,9 @@ bool StoreWebAPIDescAnswer(const std::string &key, const std::string &body) {
         kova::Log("%s:%d Query request fail!", kUnit, kLineDescFail);
         return false;
     }
+    // Moved, not copied, into the cache.
     const DescGuard lock(gDescLock);
-    DescRoot()[key] = answer["data"];
+    DescRoot()[key].swap(answer["data"]);
     return true;
 }
 
@@ -119,8 +124,8 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
         CredRequest request;
         if (!request.SetURL(cred->protocol, cred->host, cred->port, path)) {
             kova::Log("%s:%d SetURL failed. %s %s %ld %s", kUnit, kLineDescSetUrl,
-                      cred->protocol.c_str(), cred->host.c_str(), static_cast<long>(cred->port),
-                      path.c_str());
+                      cred->protocol.c_str(), kova::UrlForLog(cred->host).c_str(),
+                      static_cast<long>(cred->port), path.c_str());
             return false;
         }
         Json::Value params(Json::objectValue);

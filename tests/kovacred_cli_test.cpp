@@ -1,9 +1,16 @@
 // kovacred as a user runs it: against a kovasim process and a temporary database, every
 // command's text and --json output, the failure lines and exit statuses, the batch summary
 // and progress, streamed request bodies, the shell completion and the manual page.
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
 #include <algorithm>
+#include <chrono>
+#include <condition_variable>
 #include <fstream>
 #include <memory>
+#include <mutex>
 #include <regex>
 #include <set>
 #include <sstream>
@@ -19,10 +26,12 @@
 
 #include "kovacredential/kovacredential.h"
 #include "platform/json_text.h"
+#include "simlib/fault_server.h"
 #include "simlib/loopback_server.h"
 #include "store_fixture.h"
 #include "support/sim_process.h"
 #include "support/temp_dir.h"
+#include "support/tls_certs.h"
 
 namespace kova_test {
 namespace {
@@ -86,15 +95,18 @@ class KovacredTest : public ::testing::Test {
                "://127.0.0.1:" + std::to_string(https ? sim_->HttpsPort() : sim_->HttpPort()) +
                path;
     }
+    // Each credential gets an application tag of its own, so that add stores a new one.
     void Add(const std::string &account, const std::string &password, bool https = false) {
         Result r = Run("add --host 127.0.0.1 --port " +
                            std::to_string(https ? sim_->HttpsPort() : sim_->HttpPort()) +
-                           " --protocol " + (https ? "https" : "http") + " --account " + account,
+                           " --protocol " + (https ? "https" : "http") + " --account " + account +
+                           " --application app" + std::to_string(++added_),
                        password + "\n");
         ASSERT_EQ(r.status, 0) << r.err;
     }
 
     TempDatabase db_;
+    int added_ = 0;
     static inline TempDir *simDir_ = nullptr;
     static inline SimProcess *sim_ = nullptr;
 };
@@ -129,6 +141,21 @@ TEST_F(KovacredTest, StoreCommandsPrintTextOrJson) {
     ASSERT_EQ(KOVACredGetByID(2, &second), 0);
     EXPECT_EQ(second.remote_passwd, "pw");
     EXPECT_EQ(second.owner, -1);
+    // The same server, account and application again: updated, not duplicated.
+    r = Run("add --host 10.0.0.7 --port 5000 --protocol http --account ops --owner 7 --json",
+            "pw2\n");
+    EXPECT_EQ(ParseOut(r.out), ParseOut(R"({"id": 2, "updated": true})")) << r.err;
+    EXPECT_EQ(ParseOut(Run("add --host 10.0.0.7 --port 5000 --protocol http --account ops "
+                           "--application other --json",
+                           "pw\n")
+                           .out),
+              ParseOut(R"({"id": 3, "updated": false})"));
+    ASSERT_EQ(Run("remove 3").status, 0);
+    EXPECT_EQ(Run("passwd 2", "pw3\n").out, "changed the password of credential 2\n");
+    KOVA_CRED changed;
+    ASSERT_EQ(KOVACredGetByID(2, &changed), 0);
+    EXPECT_EQ(changed.remote_passwd, "pw3");
+    EXPECT_EQ(changed.owner, 7);
 
     // Rows oldest first, columns aligned.
     r = Run("list");
@@ -148,7 +175,8 @@ TEST_F(KovacredTest, StoreCommandsPrintTextOrJson) {
     EXPECT_NE(r.out.find("owner:        1026\n"), std::string::npos) << r.out;
     EXPECT_NE(r.out.find("session:      none\n"), std::string::npos) << r.out;
 
-    ASSERT_EQ(Run("session set 1 --sid SID-1 --token TOK-1 --extra e").out,
+    // The session id and token come from standard input, one line each.
+    ASSERT_EQ(Run("session set 1 --extra e", "SID-1\nTOK-1\n").out,
               "stored session of credential 1\n");
     EXPECT_EQ(Run("session show 1").out, "id:     1\nsid:    SID-1\ntoken:  TOK-1\nextra:  e\n");
     EXPECT_EQ(ParseOut(Run("session show 1 --json").out),
@@ -159,7 +187,10 @@ TEST_F(KovacredTest, StoreCommandsPrintTextOrJson) {
     EXPECT_EQ(shown["owner"], 1026);
 
     EXPECT_EQ(Run("session remove 1").out, "removed session of credential 1\n");
-    ASSERT_EQ(Run("session set 2 --sid s --token t").status, 0);
+    ASSERT_EQ(Run("session set 2", "s\n").status, 0);
+    EXPECT_EQ(store_test::RawQuery(db_.path(),
+                                   "SELECT access_token, csrf_token FROM credential_sessions;"),
+              (std::vector<store_test::Row>{{"s", ""}}));
     EXPECT_EQ(Run("remove 2").out, "removed credential 2\n");
     EXPECT_EQ(store_test::RawQuery(db_.path(), "SELECT id FROM credentials;"),
               (std::vector<store_test::Row>{{"1"}}));
@@ -168,6 +199,8 @@ TEST_F(KovacredTest, StoreCommandsPrintTextOrJson) {
 
 TEST_F(KovacredTest, FailuresPrintOneLineWithTheCodesNameAndExitNonZero) {
     Add("admin", "secret");
+    ASSERT_EQ(Run("add --host 127.0.0.1 --port 1 --protocol http --account down", "pw\n").status,
+              0);
     const struct {
         std::string args;
         int status;
@@ -179,45 +212,56 @@ TEST_F(KovacredTest, FailuresPrintOneLineWithTheCodesNameAndExitNonZero) {
          "kovacred: add: no password on standard input (give it as one line)\n"},
         {"session show 1", 1, "kovacred: session show: no session for credential 1\n"},
         {"session remove 1", 1, "kovacred: session remove: no session for credential 1\n"},
-        {"session set 9 --sid x", 1, "kovacred: session set: no credential with id 9\n"},
+        {"session set 9", 1, "kovacred: session set: no credential with id 9\n"},
+        {"session set 1", 1,
+         "kovacred: session set: no session id on standard input (give it as the first line)\n"},
         {"call 9 KOVA.Demo.Echo 1 echo", 1, "kovacred: call failed: no credential with id 9\n"},
         {"logout 1", 1, "kovacred: logout failed: no stored session for credential 1\n"},
         {"call 1 KOVA.No.Such 1 get", 6,
          "kovacred: call KOVA.No.Such failed (error 6 CRED_REQ_ERR_NO_SUCH_API: the server does "
          "not offer the API)\n"},
-        {"request " + Url("/missing"), 14,
+        {"request --fail " + Url("/missing"), 14,
          "kovacred: request failed (error 14 CRED_REQ_ERR_HTTP_CLIENT: HTTP status 400 to 499)\n"},
         {"probe " + Url("/missing"), 5,
          "kovacred: probe failed (error 5 CRED_REQ_ERR_QUERY_FAIL: a probe or API-description "
          "query failed)\n"},
         {"request http://127.0.0.1:1/", 20,
          "kovacred: request failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
-         "failed)\n"},
+         "failed): curl 7: Failed to connect to 127.0.0.1 port 1 "},
+        // Causes the tool finds before the library runs.
+        {"request ftp://127.0.0.1/", 1,
+         "kovacred: request failed: unsupported scheme \"ftp\" (http or https)\n"},
+        {"probe http://127.0.0.1:70000/", 1,
+         "kovacred: probe failed: bad port \"70000\" (1 to 65535)\n"},
+        {"request -F f=/nonexistent/x " + Url("/"), 1,
+         "kovacred: request failed: cannot read /nonexistent/x: No such file or directory\n"},
+        {"call 1 KOVA.Demo.Upload 1 put --file f=/nonexistent/x", 1,
+         "kovacred: call failed: cannot read /nonexistent/x: No such file or directory\n"},
+        // A server that is down is named by the description query of login, call and apis.
+        {"login 2", 20,
+         "kovacred: login failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
+         "failed): curl 7: "},
+        {"call 2 KOVA.Demo.Echo 1 echo", 20,
+         "kovacred: call KOVA.Demo.Echo failed (error 20 CRED_REQ_ERR_CONNECT: connecting or "
+         "receiving failed): curl 7: "},
+        {"apis 2", 20,
+         "kovacred: apis failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
+         "failed): curl 7: "},
     };
+    // One line each, which starts with (or, ending in a newline, is) the expected text.
     for (const auto &c : cases) {
         Result r = Run(c.args);
         EXPECT_EQ(r.status, c.status) << c.args << ": " << r.err;
-        EXPECT_EQ(r.err, c.err) << c.args;
+        EXPECT_EQ(r.err.substr(0, c.err.size()), c.err) << c.args;
+        EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
         EXPECT_EQ(r.out, "") << c.args;
     }
-    // The password is never taken from the command line, nor is a port out of range.
-    EXPECT_NE(Run("add --host h --port 1 --account a --password x", "pw\n").status, 0);
-    EXPECT_NE(Run("add --host h --port 70000 --account a", "pw\n").status, 0);
-    EXPECT_EQ(store_test::RawQuery(db_.path(), "SELECT id FROM credentials;").size(), 1u);
-
-    // A store code above 255 is named but exits 1; a file that is no database has no code.
-    std::string out;
-    EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --db " + db_.path() +
-                             "/sub/db.sqlite list" + " 2>&1",
-                         &out),
-              1);
-    EXPECT_EQ(out,
-              "kovacred: list credentials failed (error 2304 KOVA_ERR_DB_OPEN: the database "
-              "cannot be opened)\n");
-    std::ofstream(db_.path(), std::ios::trunc) << std::string(4096, 'J');
-    EXPECT_EQ(Run("show 1").err,
-              "kovacred: show: reading credential 1 failed: the database could not be used "
-              "(details in the system log)\n");
+    // -v copies the library's log records to standard error.
+    Result r = Run("-v request http://127.0.0.1:1/");
+    EXPECT_EQ(r.status, 20);
+    EXPECT_TRUE(
+        std::regex_search(r.err, std::regex("kovacred\\[[0-9]+\\]: cred_request[a-z_]*:[0-9]+ ")))
+        << r.err;
 }
 
 TEST_F(KovacredTest, WebApiCommandsLogInCallAndLogOut) {
@@ -246,14 +290,22 @@ TEST_F(KovacredTest, WebApiCommandsLogInCallAndLogOut) {
     Json::Value answer = ParseOut(r.out);
     EXPECT_EQ(answer["success"], true);
     EXPECT_EQ(answer["data"]["params"]["count"], 3);
+    std::ofstream(db_.dir().File("up.txt")) << "up";
+    r = Run("call 1 KOVA.Demo.Echo 1 echo --file f=" + db_.dir().File("up.txt") + " x=1");
+    EXPECT_EQ(ParseOut(r.out)["params"]["x"], "1") << r.err;
     // Over HTTPS, logging in first since no session is stored.
     EXPECT_EQ(ParseOut(Run("call 4 KOVA.Demo.Session 1 whoami").out)["account"], "admin");
 
     EXPECT_EQ(Run("logout 1").out, "logged out; session of credential 1 removed\n");
 
-    // The server's own codes are not the library's.
+    // The server's own codes are not the library's; a call's login names them as login does.
     EXPECT_EQ(Run("login 2").err,
               "kovacred: login failed (server error 400: wrong account or password)\n");
+    r = Run("call 2 KOVA.Demo.Echo 1 echo");
+    EXPECT_EQ(r.err,
+              "kovacred: call KOVA.Demo.Echo failed: login failed (server error 400: wrong "
+              "account or password)\n");
+    EXPECT_EQ(r.status, 1);  // 400 does not fit an exit status
     EXPECT_EQ(Run("login 3").err,
               "kovacred: login failed (server error 403: one-time code required)\n");
     EXPECT_EQ(Run("login 3 --otp 000000").err,
@@ -333,7 +385,7 @@ TEST_F(KovacredTest, BatchSummarisesEveryCallAndFailsWhenOneDoes) {
         EXPECT_TRUE(std::regex_match(lines[i], std::regex(expected[i]))) << lines[i];
     }
     EXPECT_EQ(r.err,
-              "kovacred: batch: call 3: cannot build the WebAPI request\n"
+              "kovacred: batch: call 3: no credential with id 42\n"
               "kovacred: batch: call 4: not an object\n"
               "kovacred: batch: 3 of 5 calls failed\n");
 
@@ -359,6 +411,10 @@ TEST_F(KovacredTest, BatchSummarisesEveryCallAndFailsWhenOneDoes) {
     EXPECT_EQ(r.err, "kovacred: batch: cannot read " + db_.dir().File("absent.json") + "\n");
     r = Run("batch -", "{\"url\": \"x\"}");
     EXPECT_EQ(r.err, "kovacred: batch: standard input must hold a JSON array of calls\n");
+    r = Run("batch -", "[{\"url\":\n");
+    EXPECT_TRUE(std::regex_match(r.err, std::regex("kovacred: batch: standard input is not JSON: "
+                                                   "Line 2, Column 1 [^\n]+\n")))
+        << r.err;
 }
 
 // Progress goes to standard error only on a terminal, and ends on the final counts. script(1)
@@ -415,22 +471,309 @@ TEST_F(KovacredTest, RequestSendsItsOptionsAndPrintsTextOrJson) {
     });
     ASSERT_TRUE(server.Start());
     const std::string url = server.BaseUrl() + "/echo";
+    // Options and the URL in any order; the body byte-exact, without a newline added.
     EXPECT_EQ(Run("request " + url + " -q a=1 -d b=x -H 'X-Test: t' -b id=S").out,
-              "POST /echo?a=1 b=x H=t C=id=S\n");
+              "POST /echo?a=1 b=x H=t C=id=S");
+    EXPECT_EQ(Run("request -H 'X-Test: t' " + url + " -d b=x").out, "POST /echo b=x H=t C=");
+    ASSERT_EQ(Run("request -d b=x " + url + " -o " + db_.dir().File("out")).status, 0);
+    EXPECT_EQ(ReadFile(db_.dir().File("out")), "POST /echo b=x H= C=");
     std::ofstream(db_.dir().File("body")) << "{\"k\":1}";
     Result r = Run("request --headers --body-file " + db_.dir().File("body") + " " + url);
     EXPECT_TRUE(std::regex_match(r.out, std::regex("\\{.*\"X-Answer\":\"42\".*\\}\n"
-                                                   "POST /echo \\{\"k\":1\\} H= C=\n")))
+                                                   "POST /echo \\{\"k\":1\\} H= C=")))
         << r.out;
-    Json::Value answer = ParseOut(Run("request --json " + url + " -d b=y").out);
+    Json::Value answer = ParseOut(Run("request " + url + " --json -d b=y").out);
     EXPECT_EQ(answer["url"], url);
     EXPECT_EQ(answer["status"], 200);
     EXPECT_EQ(answer["headers"]["X-Answer"], "42");
     EXPECT_EQ(answer["body"], "POST /echo b=y H= C=");
+    answer = ParseOut(Run("request --timing --json " + url).out);
+    EXPECT_GT(answer["timing"]["total"].asDouble(), 0) << answer.toStyledString();
+    EXPECT_EQ(answer["timing"]["reused"], false);
+    EXPECT_TRUE(std::regex_match(
+        Run("request --timing " + url).err,
+        std::regex("kovacred: timing: name lookup [0-9.]+ s, connect [0-9.]+ s, TLS [0-9.]+ s, "
+                   "first byte [0-9.]+ s, total [0-9.]+ s, reused no\n")));
 
     EXPECT_EQ(Run("probe " + url).out, "reachable\n");
     EXPECT_EQ(ParseOut(Run("probe --json " + url).out),
               ParseOut("{\"url\": \"" + url + "\", \"reachable\": true}"));
+}
+
+// -o replaces its file only when the request succeeds; like curl, the body of any HTTP answer
+// is the output unless --fail; a body past the in-memory cap needs -o; what cannot be written
+// exits 23.
+TEST_F(KovacredTest, RequestOutputReplacesItsFileOnlyOnSuccess) {
+    kovasim::LoopbackServer server;
+    server.Route("GET", "/text", [](const httplib::Request &, httplib::Response &res) {
+        res.set_content("no newline", "text/plain");
+    });
+    server.Route("GET", "/gone", [](const httplib::Request &, httplib::Response &res) {
+        res.status = 404;
+        res.set_content("gone body", "text/plain");
+    });
+    server.Route("GET", "/big", [](const httplib::Request &, httplib::Response &res) {
+        res.set_content(std::string((size_t{64} << 20) + 1, 'x'), "application/octet-stream");
+    });
+    ASSERT_TRUE(server.Start());
+    const std::string dir = db_.dir().File("out");
+    ASSERT_EQ(mkdir(dir.c_str(), 0700), 0);
+    const std::string file = dir + "/f";
+    const std::string notFound =
+        "kovacred: request: HTTP status 404 (error 14 CRED_REQ_ERR_HTTP_CLIENT: HTTP status 400 "
+        "to 499)\n";
+    const struct {
+        std::string args;
+        int status;
+        std::string file;
+        std::string err;
+    } cases[] = {
+        {"http://127.0.0.1:1/", 20, "keep\n",
+         "kovacred: request failed (error 20 CRED_REQ_ERR_CONNECT: connecting or receiving "
+         "failed): curl 7: Failed to connect to 127.0.0.1 port 1 "},
+        {"--fail " + server.BaseUrl() + "/gone", 14, "keep\n",
+         "kovacred: request failed (error 14 CRED_REQ_ERR_HTTP_CLIENT: HTTP status 400 to "
+         "499)\n"},
+        {server.BaseUrl() + "/gone", 0, "gone body", notFound},
+        {server.BaseUrl() + "/text", 0, "no newline", ""},
+    };
+    for (const auto &c : cases) {
+        std::ofstream(file) << "keep\n";
+        Result r = Run("request -o " + file + " " + c.args);
+        EXPECT_EQ(r.status, c.status) << c.args;
+        EXPECT_EQ(c.err.empty() ? r.err : r.err.substr(0, c.err.size()), c.err) << c.args;
+        EXPECT_EQ(ReadFile(file), c.file) << c.args;
+        std::string listing;
+        RunCommand("ls -A " + dir, &listing);
+        EXPECT_EQ(listing, "f\n") << c.args << ": a temporary file was left";
+    }
+    Result r = Run("request " + server.BaseUrl() + "/gone");
+    EXPECT_EQ(r.status, 0);
+    EXPECT_EQ(r.out, "gone body");
+    EXPECT_EQ(r.err, notFound);
+    r = Run("request " + server.BaseUrl() + "/big");
+    EXPECT_EQ(r.status, 12);
+    EXPECT_EQ(r.err,
+              "kovacred: request failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other libcurl "
+              "failure): the answer is larger than the 67108864 bytes held in memory; use -o "
+              "FILE\n");
+    EXPECT_TRUE(r.out.empty()) << r.out.size() << " bytes on standard output";
+
+    // Standard output that cannot be written.
+    Add("admin", "secret");
+    for (const std::string &args :
+         std::vector<std::string>{"list", "request " + server.BaseUrl() + "/text"}) {
+        std::string err;
+        EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --db " + db_.path() + " " +
+                                 args + " 2>&1 >/dev/full",
+                             &err),
+                  23)
+            << args;
+        EXPECT_EQ(err, "kovacred: writing standard output failed: No space left on device\n");
+    }
+}
+
+// Only add creates a database; no command adds tables to, or changes, a file that is not a
+// credential database.
+TEST_F(KovacredTest, DatabaseMistakesCreateAndChangeNothing) {
+    std::string out;
+    EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " list --db '' 2>&1", &out), 2);
+    EXPECT_EQ(out, "kovacred: --db needs a database path, not an empty one\n");
+
+    const std::string absent = db_.dir().File("sub") + "/absent.sqlite";
+    const std::string foreign = db_.dir().File("foreign.sqlite");
+    const std::string junk = db_.dir().File("junk");
+    {
+        sqlite3 *db = nullptr;
+        ASSERT_EQ(sqlite3_open(foreign.c_str(), &db), SQLITE_OK);
+        ASSERT_EQ(sqlite3_exec(db, "CREATE TABLE notes (text TEXT);", nullptr, nullptr, nullptr),
+                  SQLITE_OK);
+        sqlite3_close(db);
+    }
+    ASSERT_EQ(chmod(foreign.c_str(), 0644), 0);
+    std::ofstream(junk) << std::string(4096, 'J');
+    const std::string foreignBytes = ReadFile(foreign);
+    const std::pair<std::string, std::string> databases[] = {
+        {absent, "no credential database at " + absent},
+        {foreign, foreign + " is not a credential database (it has no credentials table)"},
+        {junk, junk + " is not a credential database (file is not a database)"},
+    };
+    for (const auto &database : databases) {
+        for (const std::string command :
+             {"list", "show 1", "remove 1", "passwd 1", "session show 1", "session set 1",
+              "session remove 1", "login 1", "logout 1", "call 1 A 1 m", "apis 1"}) {
+            Result r = Run(command + " --db " + database.first, "x\n");
+            EXPECT_EQ(r.status, 1) << command;
+            EXPECT_EQ(r.err, "kovacred: " + database.second + "\n") << command;
+        }
+    }
+    const std::string add = "add --host h --port 1 --account a --db ";
+    EXPECT_EQ(Run(add + foreign, "pw\n").err, "kovacred: " + databases[1].second + "\n");
+    EXPECT_FALSE(std::ifstream(absent).good()) << "a read-only command made a database";
+    EXPECT_TRUE(ReadFile(foreign) == foreignBytes) << "the foreign database was changed";
+    struct stat st;
+    ASSERT_EQ(stat(foreign.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0644u);
+    EXPECT_EQ(ReadFile(junk), std::string(4096, 'J'));
+    // add makes the database, and then the others use it.
+    EXPECT_EQ(Run(add + absent, "pw\n").out, "added credential 1\n");
+    EXPECT_EQ(Run("show 1 --json --db " + absent).status, 0);
+}
+
+// Usage errors exit 2 with one line that names the word at fault.
+TEST_F(KovacredTest, UsageErrorsExitTwoNamingTheWord) {
+    const std::pair<std::string, std::string> cases[] = {
+        {"bogus", "bogus"},
+        {"list --bogus", "--bogus"},
+        {"show 0", "a credential id is a whole number from 1 to 2147483647, not \"0\""},
+        {"call x A 1 m", "not \"x\""},
+        {"add --host h --port 1 --account a --owner abc", "abc"},
+        {"add --host h --port 0 --account a", "0 not in range 1 to 65535"},
+        {"add --host h --port 1 --account a --protocol ftp", "ftp"},
+        {"add --host '' --port 1 --account a", "add: --host must not be empty"},
+        {"add --host h --port 1 --account a --password x", "--password"},
+        {"session set 1 --sid S", "--sid"},
+        {"request", "url is required"},
+        {"request -d novalue http://127.0.0.1:1/", "bad --data novalue"},
+    };
+    for (const auto &c : cases) {
+        Result r = Run(c.first, "pw\n");
+        EXPECT_EQ(r.status, 2) << c.first << ": " << r.err;
+        EXPECT_EQ(r.err.rfind("kovacred: ", 0), 0u) << r.err;
+        EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
+        EXPECT_NE(r.err.find(c.second), std::string::npos) << c.first << ": " << r.err;
+    }
+    EXPECT_FALSE(std::ifstream(db_.path()).good()) << "a rejected command made a database";
+}
+
+// The first Ctrl-C during a batch ends it with the summary of what finished.
+TEST_F(KovacredTest, BatchInterruptedPrintsWhatFinished) {
+    kovasim::LoopbackServer server;
+    std::mutex mutex;
+    std::condition_variable changed;
+    bool entered = false;
+    bool release = false;
+    server.Route("GET", "/slow", [&](const httplib::Request &, httplib::Response &res) {
+        std::unique_lock<std::mutex> lock(mutex);
+        entered = true;
+        changed.notify_all();
+        changed.wait_for(lock, std::chrono::seconds(60), [&] { return release; });
+        res.set_content("late", "text/plain");
+    });
+    ASSERT_TRUE(server.Start());
+    const std::string file = db_.dir().File("calls.json");
+    std::ofstream(file) << "[{\"url\": \"" << server.BaseUrl() << "/slow\"}]";
+    const std::string out = db_.dir().File("stdout");
+    const std::string err = db_.dir().File("stderr");
+    const pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+        execl("/bin/sh", "sh", "-c",
+              (kova_test::ToolCommand(KOVACRED_BIN) + " batch " + file + " >" + out + " 2>" + err)
+                  .insert(0, "exec ")
+                  .c_str(),
+              static_cast<char *>(nullptr));
+        _exit(127);
+    }
+    {
+        std::unique_lock<std::mutex> lock(mutex);
+        EXPECT_TRUE(changed.wait_for(lock, std::chrono::seconds(60), [&] { return entered; }));
+    }
+    kill(pid, SIGINT);
+    int status = 0;
+    ASSERT_EQ(waitpid(pid, &status, 0), pid);
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        release = true;
+        changed.notify_all();
+    }
+    ASSERT_TRUE(WIFEXITED(status)) << "ended by signal " << WTERMSIG(status);
+    EXPECT_EQ(WEXITSTATUS(status), 130);
+    EXPECT_TRUE(
+        std::regex_search(ReadFile(out), std::regex("\n0 +http://[^ ]+/slow +cancelled +- +-\n")))
+        << ReadFile(out);
+    EXPECT_EQ(ReadFile(err), "kovacred: batch: interrupted: 0 of 1 calls finished, 1 cancelled\n");
+}
+
+// --verify, --cacert and --pin check the server of request, login, call, apis and batch (the
+// library's default checks nothing); --max-time bounds them; a failure names libcurl's cause.
+TEST_F(KovacredTest, TransportOptionsCheckTheServerAndBoundTheTime) {
+    kova_test::TestCa ca;
+    const kova_test::TlsIdentity identity = ca.Issue("IP:127.0.0.1");
+    kova_test::TlsServer tls(identity);
+    ASSERT_TRUE(tls.Start());
+    const std::string caFile = db_.dir().File("ca.pem");
+    std::ofstream(caFile) << ca.CertPem();
+    const std::string known = db_.dir().File("known_servers");
+    const std::string server = tls.Url().substr(8, tls.Url().find("/ok") - 8);
+    const std::string unverified =
+        "failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other libcurl failure): curl 60: ";
+
+    Result r = Run("request " + tls.Url());
+    EXPECT_EQ(r.out, "secure") << r.err;
+    r = Run("request --verify " + tls.Url());
+    EXPECT_EQ(r.status, 12);
+    EXPECT_EQ(r.err.rfind("kovacred: request " + unverified, 0), 0u) << r.err;
+    EXPECT_EQ(Run("request --cacert " + caFile + " " + tls.Url()).out, "secure");
+
+    // Trust on first use: the key is recorded, then required.
+    r = Run("request --pin " + tls.Url());
+    EXPECT_EQ(r.out, "secure");
+    EXPECT_EQ(r.err, "kovacred: pinned the public key of " + server + " (" + identity.pin +
+                         ") in " + known + "\n");
+    EXPECT_EQ(ReadFile(known), server + " " + identity.pin + "\n");
+    struct stat st;
+    ASSERT_EQ(stat(known.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0600u);
+    r = Run("request --pin " + tls.Url());
+    EXPECT_EQ(r.out, "secure");
+    EXPECT_EQ(r.err, "");
+    const std::string other = ca.Issue("IP:127.0.0.1").pin;
+    std::ofstream(known) << server << " " << other << "\n";
+    const int served = tls.Requests();
+    r = Run("request --pin " + tls.Url());
+    EXPECT_EQ(r.status, 12);
+    EXPECT_EQ(r.err,
+              "kovacred: request failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other "
+              "libcurl failure): the public key of " +
+                  server + " has changed: known " + other + ", now " + identity.pin +
+                  "; if the change is expected, delete the line of " + server + " from " + known +
+                  " and run again\n");
+    EXPECT_EQ(tls.Requests(), served) << "the request reached a server with another key";
+
+    // The WebAPI commands against the simulator's self-signed certificate.
+    Add("admin", "secret", true);
+    for (const std::string command : {"login 1", "apis 1", "call 1 KOVA.Demo.Echo 1 echo"}) {
+        r = Run(command + " --verify");
+        EXPECT_EQ(r.status, 12) << command;
+        EXPECT_NE(r.err.find(unverified), std::string::npos) << command << ": " << r.err;
+    }
+    EXPECT_TRUE(std::regex_search(
+        Run("batch - --verify", R"([{"cred": 1, "api": "KOVA.Demo.Echo", "version": 1,
+                                    "method": "echo"}])")
+            .err,
+        std::regex("call 0: the API description \\(error 12 [^\n]*curl 60: ")));
+    r = Run("login 1 --pin");
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_NE(ReadFile(known).find("127.0.0.1:" + std::to_string(sim_->HttpsPort()) + " sha256//"),
+              std::string::npos);
+
+    // A server that never answers.
+    kovasim::FaultServer silent(kovasim::Fault::kSilent);
+    ASSERT_TRUE(silent.Start());
+    r = Run("request --max-time 0.5 " + silent.BaseUrl() + "/");
+    EXPECT_EQ(r.status, 10);
+    EXPECT_NE(r.err.find("(error 10 CRED_REQ_ERR_TIMEOUT: operation timed out): curl 28: "),
+              std::string::npos)
+        << r.err;
+    ASSERT_EQ(Run("add --host 127.0.0.1 --port " + std::to_string(silent.Port()) +
+                      " --protocol http --account a",
+                  "pw\n")
+                  .status,
+              0);
+    r = Run("login 2 --max-time 0.5");
+    EXPECT_EQ(r.status, 10) << r.err;
+    EXPECT_EQ(r.err.rfind("kovacred: login failed (error 10 CRED_REQ_ERR_TIMEOUT", 0), 0u) << r.err;
 }
 
 // The completion function run in bash, as bash-completion runs it.
@@ -525,7 +868,7 @@ TEST(KovacredManualTest, PageAndCompletionNameEveryCommandAndOption) {
             }
         }
     }
-    EXPECT_EQ(commands.size(), 17u);  // "" and 13 commands, session's three
+    EXPECT_EQ(commands.size(), 18u);  // "" and 14 commands, session's three
     EXPECT_GT(checked, 40u);
 }
 

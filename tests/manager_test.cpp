@@ -2,12 +2,15 @@
 // concurrent runs, set-up failures, silent and refusing servers, and the socket callback.
 
 #include <arpa/inet.h>
+#include <dlfcn.h>
 #include <fcntl.h>
+#include <netdb.h>
 #include <netinet/in.h>
 #include <signal.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
+#include <string.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -28,6 +31,33 @@
 #include "simlib/relay_sim.h"
 #include "support/child.h"
 #include "support/interpose.h"
+
+// Name resolution of kStalledHost hangs (up to 30 s, or until released), as with a DNS server
+// that never answers; every other name resolves as usual. The test program's definition takes
+// the place of libc's for libcurl's resolver thread too.
+namespace {
+
+constexpr char kStalledHost[] = "stalled.invalid";
+std::atomic<bool> gResolverStalled{false};
+std::atomic<bool> gReleaseResolver{false};
+
+}  // namespace
+
+extern "C" int getaddrinfo(const char *node, const char *service, const struct addrinfo *hints,
+                           struct addrinfo **res) {
+    using Real = int (*)(const char *, const char *, const struct addrinfo *, struct addrinfo **);
+    if (node != nullptr && strcmp(node, kStalledHost) == 0) {
+        gResolverStalled = true;
+        const struct timespec step = {0, 10 * 1000 * 1000};
+        for (int i = 0; i < 3000 && !gReleaseResolver; ++i) {
+            nanosleep(&step, nullptr);
+        }
+        gResolverStalled = false;
+        return EAI_AGAIN;
+    }
+    static const Real real = reinterpret_cast<Real>(dlsym(RTLD_NEXT, "getaddrinfo"));
+    return real(node, service, hints, res);
+}
 
 namespace {
 
@@ -322,8 +352,8 @@ TEST_F(ManagerTest, ResponsesPastTheInMemoryCapFailTheirRequest) {
 }
 
 // A deadline for the whole run stops a transfer that trickles on (a byte a second keeps it
-// inside every quiet wait, and the manager lifts the low-speed limit) with the time-out, while
-// a request that answered in time keeps its answer.
+// inside every quiet wait, and the manager lifts the low-speed limit) and one whose host name
+// never resolves with the time-out, while a request that answered in time keeps its answer.
 TEST_F(ManagerTest, DeadlineStopsTheRunAndItsUnfinishedRequests) {
     constexpr int kDripBytes = 60;
     kovasim::RawServer drip([](kovasim::RawServer::Connection &c) {
@@ -339,6 +369,7 @@ TEST_F(ManagerTest, DeadlineStopsTheRunAndItsUnfinishedRequests) {
     CredRequestMgr mgr;
     ASSERT_EQ(0, mgr.AddCredRequest(NewRequest(drip.BaseUrl() + "/drip")));
     ASSERT_EQ(1, mgr.AddCredRequest(NewRequest(Url("/hello"))));
+    ASSERT_EQ(2, mgr.AddCredRequest(NewRequest(std::string("http://") + kStalledHost + "/")));
     EXPECT_FALSE(mgr.Run(-1));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_BAD_PARAM, mgr.GetError());
     EXPECT_EQ(0u, server_->RequestCount());
@@ -350,6 +381,10 @@ TEST_F(ManagerTest, DeadlineStopsTheRunAndItsUnfinishedRequests) {
     EXPECT_LT(mgr.GetResponse(0).size(), static_cast<size_t>(kDripBytes));
     EXPECT_EQ("hello", mgr.GetResponse(1));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, mgr.GetRequest(1)->GetError());
+    // The run did not wait for the resolver that never answers.
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, mgr.GetRequest(2)->GetError());
+    EXPECT_TRUE(gResolverStalled);
+    gReleaseResolver = true;
 }
 
 // A large raw body makes libcurl ask for "100 Continue"; a server that never sends it is waited
@@ -402,6 +437,27 @@ TEST_F(ManagerTest, DescriptorsBeyondTheSelectLimit) {
 
 void IgnoreSignal(int) {}
 
+// Forks a process that sends `sig` to this one every `ms` milliseconds, at most `count` times
+// and only while this process lives.
+pid_t StartSignaller(int sig, long ms, int count) {
+    const pid_t runner = getpid();
+    const pid_t signaller = fork();
+    if (signaller == 0) {
+        const struct timespec pause = {0, ms * 1000 * 1000};
+        for (int i = 0; i < count && getppid() == runner; ++i) {
+            kill(runner, sig);
+            nanosleep(&pause, nullptr);
+        }
+        _exit(0);
+    }
+    return signaller;
+}
+
+void StopSignaller(pid_t signaller) {
+    kill(signaller, SIGKILL);
+    waitpid(signaller, nullptr, 0);
+}
+
 // A signal that interrupts the wait does not end the run. A process of its own sends them, so
 // that the runner stays the only thread (under qemu-user on i386 a thread that signalled
 // another can no longer be joined).
@@ -411,21 +467,11 @@ TEST_F(ManagerTest, SignalsDuringTheWaitAreRidden) {
         struct sigaction action = {};
         action.sa_handler = IgnoreSignal;  // no SA_RESTART
         sigaction(SIGUSR1, &action, nullptr);
-        const pid_t runner = getpid();
-        const pid_t signaller = fork();
-        if (signaller == 0) {
-            const struct timespec pause = {0, 50 * 1000 * 1000};
-            for (int i = 0; i < 600 && getppid() == runner; ++i) {
-                nanosleep(&pause, nullptr);
-                kill(runner, SIGUSR1);
-            }
-            _exit(0);
-        }
         CredRequestMgr mgr;
         mgr.AddCredRequest(NewRequest(slow));
+        const pid_t signaller = StartSignaller(SIGUSR1, 50, 600);
         const bool ok = mgr.Run();
-        kill(signaller, SIGKILL);
-        waitpid(signaller, nullptr, 0);
+        StopSignaller(signaller);
         fprintf(stderr, "run %d error %d response %s\n", ok, mgr.GetError(),
                 mgr.GetResponse(0).c_str());
         return ok && mgr.GetResponse(0) == "slow 1" ? 0 : 1;
@@ -527,19 +573,9 @@ TEST_F(ManagerTest, CancelEndsTheRunFromAnotherThreadOrASignalHandler) {
         CredRequestMgr signalled;
         signalled.AddCredRequest(NewRequest(never, 30));
         gCancelTarget = &signalled;
-        const pid_t runner = getpid();
-        const pid_t signaller = fork();
-        if (signaller == 0) {
-            const struct timespec pause = {0, 100 * 1000 * 1000};
-            for (int i = 0; i < 300 && getppid() == runner; ++i) {
-                kill(runner, SIGUSR2);
-                nanosleep(&pause, nullptr);
-            }
-            _exit(0);
-        }
+        const pid_t signaller = StartSignaller(SIGUSR2, 100, 300);
         const bool ok = signalled.Run();
-        kill(signaller, SIGKILL);
-        waitpid(signaller, nullptr, 0);
+        StopSignaller(signaller);
         gCancelTarget = nullptr;
         fprintf(stderr, "run %d error %d request error %d\n", ok, signalled.GetError(),
                 signalled.GetRequest(0)->GetError());

@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <future>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -115,7 +116,7 @@ TEST_F(RelayCandidatesTest, DirectThenRelayCandidatesAreProbedInOrder) {
 
 // The LAN addresses are probed only on the service's port, the external address and the DDNS
 // name only on its external port. The first address probed answers as another server.
-TEST_F(RelayProbeTest, EachPortReachesItsOwnAddresses) {
+TEST_F(RelayProbeTest, EachPortReachesItsOwnAddressesAndIncompleteInformationIs402) {
     for (const bool external : {false, true}) {
         SCOPED_TRACE(external ? "external port" : "LAN port");
         ProbeTargets targets;
@@ -139,6 +140,15 @@ TEST_F(RelayProbeTest, EachPortReachesItsOwnAddresses) {
         EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NONE);
         EXPECT_EQ(client.GetServerIdMd5(), kovasim::Md5Hex("S1"));
     }
+    // Server information without both parts is 402.
+    CredRequestFarlink client;
+    Json::Value candidate;
+    for (const Json::Value &info :
+         {Json::Value("text"), ParseJson(R"({"server": {}})"), ParseJson(R"({"service": {}})")}) {
+        EXPECT_FALSE(client.GetAvailableConnInfo(info, candidate)) << info;
+        EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_CONN_INFO) << info;
+        EXPECT_EQ(client.GetErrors()["error"], info) << info;
+    }
 }
 
 TEST_F(RelayCandidatesTest, NoPortMeans405WithoutProbesAndTheTunnelIsAsked) {
@@ -161,17 +171,6 @@ TEST_F(RelayCandidatesTest, NoPortMeans405WithoutProbesAndTheTunnelIsAsked) {
     EXPECT_EQ(candidate, Candidate("http", Addr(4), relayPort));
     EXPECT_EQ(Sim().Hits("request_tunnel").size(), 1u);
     EXPECT_EQ(targets_.Order(), Names{"relay"});
-}
-
-TEST_F(RelayProbeTest, UnusableServerInformationIs402) {
-    CredRequestFarlink client;
-    Json::Value candidate;
-    for (const Json::Value &info :
-         {Json::Value("text"), ParseJson(R"({"server": {}})"), ParseJson(R"({"service": {}})")}) {
-        EXPECT_FALSE(client.GetAvailableConnInfo(info, candidate)) << info;
-        EXPECT_EQ(client.GetError(), KOVA::CRED_REQ_ERR_NO_CONN_INFO) << info;
-        EXPECT_EQ(client.GetErrors()["error"], info) << info;
-    }
 }
 
 TEST_F(RelayProbeTest, DeadSilentAndImpostorHostsAreSkipped) {
@@ -202,6 +201,67 @@ TEST_F(RelayProbeTest, DeadSilentAndImpostorHostsAreSkipped) {
     }
     EXPECT_EQ(silent.ConnectionCount(), 1);
     EXPECT_EQ(probeHungUp, 1);
+}
+
+// With a deadline, hosts that accept and never answer end each operation as soon as the
+// deadline has passed, with error 10 and nothing tried after it: six LAN addresses (probes of
+// 5 s each without a deadline), a relay endpoint (probed with libcurl's 120 s), and a directory
+// host asked without a response time-out. Each call runs on a thread of its own so that the
+// test's wait for it is bounded.
+TEST_F(RelayCandidatesTest, DeadlineEndsEachOperationOverSilentHosts) {
+    const auto stall = [](kovasim::RawServer::Connection &c) { c.WaitForClose(30000); };
+    kovasim::RawServer silent(stall, Addr(1));
+    ASSERT_TRUE(silent.Start());
+    const std::string port = std::to_string(silent.Port());
+    const std::string interfaces = kova_test::Fill(
+        R"([{"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}, {"ip": "$0"}])",
+        {Addr(1)});
+    // The HTTPS service has no port, so its look-up goes on to the (silent) relay.
+    Serve(ParseJson(R"({"serverID": "S1", "interface": $0, "services": {
+                        "zon_https": {"relay_ip": "$1", "relay_port": $2}, "zon": {"port": $2}}})",
+                    {interfaces, Addr(1), port}));
+    const auto finishes = [](std::future<bool> &call) {
+        return call.wait_for(std::chrono::seconds(20)) == std::future_status::ready;
+    };
+
+    CredRequestFarlink client;
+    client.SetTotalTimeout(1500);
+    Json::Value candidate;
+    const Json::Value info =
+        ParseJson(R"({"server": {"serverID": "S1", "interface": $0}, "service": {"port": $1}})",
+                  {interfaces, port});
+    auto probes = std::async(std::launch::async,
+                             [&] { return client.GetAvailableConnInfo(info, candidate); });
+    ASSERT_TRUE(finishes(probes));
+    EXPECT_FALSE(probes.get());
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":10})"));
+    EXPECT_TRUE(Sim().Hits("request_tunnel").empty());
+    EXPECT_EQ(silent.ConnectionCount(), 1);
+    // Each operation has the whole deadline again.
+    EXPECT_TRUE(client.GetSiteList(candidate));
+
+    Json::Value errors;
+    auto lookUp = std::async(std::launch::async, [&] {
+        return CredRequestFarlink::GetConnInfo("S1", candidate, &errors, 1500);
+    });
+    ASSERT_TRUE(finishes(lookUp));
+    EXPECT_FALSE(lookUp.get());
+    EXPECT_EQ(errors, ParseJson(R"({"code":10})"));
+    EXPECT_EQ(ServiceIdsAsked("get_server_info"), Names{"zon_https"});
+    EXPECT_EQ(ServiceIdsAsked("request_tunnel"), Names{"zon_https"});
+    EXPECT_EQ(silent.ConnectionCount(), 2);
+
+    kovasim::RawServer silentDirectory(stall, Addr(2), true, 80);
+    ASSERT_TRUE(silentDirectory.Start());
+    client.SetServerName(Addr(2));
+    client.SetServerId("S1");
+    client.SetTimeout(0);
+    auto directory =
+        std::async(std::launch::async, [&] { return client.GetServerInfo(candidate); });
+    ASSERT_TRUE(finishes(directory));
+    EXPECT_FALSE(directory.get());
+    EXPECT_EQ(client.GetErrors(), ParseJson(R"({"code":10})"));
+    EXPECT_EQ(silentDirectory.ConnectionCount(), 1);
 }
 
 TEST_F(RelayProbeTest, RelayAddressComesBeforeItsNameOnTheSamePort) {

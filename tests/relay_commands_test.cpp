@@ -251,12 +251,11 @@ TEST_F(RelayCommandsTest, UnusableAnswersGiveTheirErrorDocuments) {
     }
 
     // An otherwise usable answer nested deeper than the parser allows is unparsable like any
-    // other; a long one is detailed by its first 4096 bytes, cut before a split character.
+    // other; a long one is detailed by its whole text.
     const std::string deep =
         "{\"errno\":0,\"server\":" + std::string(1000, '[') + std::string(1000, ']') + "}";
-    const std::string longText = std::string(4095, 'x') + "\xc3\xa9" + std::string(9000, 'y');
-    const std::pair<std::string, std::string> answers[] = {{deep, deep},
-                                                           {longText, std::string(4095, 'x')}};
+    const std::string longText = std::string(4095, 'x') + "\xc3\xa9" + std::string(200000, 'y');
+    const std::pair<std::string, std::string> answers[] = {{deep, deep}, {longText, longText}};
     for (const auto &a : answers) {
         SCOPED_TRACE(a.first.substr(0, 20));
         Json::Value config(Json::objectValue);

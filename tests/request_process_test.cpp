@@ -39,6 +39,7 @@
 namespace {
 
 using kova_test::File;
+using kova_test::Pattern;
 using kova_test::ReadAll;
 using kova_test::StreamWith;
 
@@ -65,7 +66,7 @@ class ProcessTest : public ::testing::Test {
 };
 
 // A set-up-only run makes the handle without a transfer; every later run reuses it as it was
-// set up, so settings changed afterwards do not reach the wire.
+// set up, so settings changed afterwards do not reach the wire. Without a URL nothing runs.
 TEST_F(ProcessTest, SetUpOnlyThenOkTwiceOnTheSameHandle) {
     KOVA::CredRequest req;
     ASSERT_TRUE(req.SetURL(Url("/ok")));
@@ -104,6 +105,17 @@ TEST_F(ProcessTest, SetUpOnlyThenOkTwiceOnTheSameHandle) {
     info = req.GetTransferInfo();
     EXPECT_EQ(info["reused"], true);
     EXPECT_EQ(info["connects"], 0);
+
+    // Without a URL the set-up itself fails; an empty one is handed to libcurl, which refuses it.
+    KOVA::CredRequest none, empty;
+    EXPECT_FALSE(none.Process(false, 0));
+    ASSERT_TRUE(empty.SetURL(""));
+    EXPECT_FALSE(empty.Process(true, 0));
+    EXPECT_EQ((std::vector<int>{none.GetError(), empty.GetError()}),
+              (std::vector<int>{KOVA::CRED_REQ_ERR_NO_URL, KOVA::CRED_REQ_ERR_CURL_OTHER}));
+    EXPECT_EQ(kova_test::LogRecords().size(), 2u) << kova_test::LogDump();
+    EXPECT_TRUE(kova_test::LogHas("InitCurlHandler failed") && kova_test::LogHas("CURL Error(3)"));
+    EXPECT_EQ(server_.CountPath("/ok"), 2u);
 }
 
 TEST_F(ProcessTest, MapsStatusToErrorWhenRedirectsAreNotFollowed) {
@@ -157,24 +169,6 @@ TEST_F(ProcessTest, FollowedRedirectKeepsPostAndItsBody) {
             EXPECT_EQ(requests[1].body, raw ? "{\"user\":\"alice\"}" : "user=alice");
         }
     }
-}
-
-// Without a URL the set-up itself fails; an empty one is handed to libcurl, which refuses it.
-TEST_F(ProcessTest, MissingOrEmptyUrl) {
-    for (bool empty : {false, true}) {
-        SCOPED_TRACE(empty);
-        kova_test::ClearLog();
-        KOVA::CredRequest req;
-        if (empty) {
-            ASSERT_TRUE(req.SetURL(""));
-        }
-        EXPECT_FALSE(req.Process(empty, 0));
-        EXPECT_EQ(req.GetError(),
-                  empty ? KOVA::CRED_REQ_ERR_CURL_OTHER : KOVA::CRED_REQ_ERR_NO_URL);
-        EXPECT_TRUE(kova_test::LogHas(empty ? "CURL Error(3)" : "InitCurlHandler failed"))
-            << kova_test::LogDump();
-    }
-    EXPECT_EQ(server_.RequestCount(), 0u);
 }
 
 // A refused connection is retried at once and logged; a host or proxy name that does not
@@ -350,14 +344,6 @@ class BodyServer {
     std::string requestLine_;
     kovasim::RawServer raw_;
 };
-
-std::string Pattern(size_t size) {
-    std::string text(size, '\0');
-    for (size_t i = 0; i < size; ++i) {
-        text[i] = static_cast<char>('a' + (i * 7 + i / 251) % 26);
-    }
-    return text;
-}
 
 // A request stream is sent from its start in every attempt (with the shared size limit as it
 // was), and again for a redirect that keeps the POST. A pipe cannot be sent twice: once part of

@@ -61,7 +61,7 @@ class SettingsTest : public ::testing::Test {
     const Json::Value null_;
 };
 
-TEST_F(SettingsTest, HeadersMergeAndReplace) {
+TEST_F(SettingsTest, HeadersMergeAndRawDataRefusesEmptyValues) {
     ASSERT_TRUE(p_.SetData("Header", "X-A", "1"));
     Json::Value more;
     more["X-A"] = "2";
@@ -73,9 +73,8 @@ TEST_F(SettingsTest, HeadersMergeAndReplace) {
     EXPECT_EQ(p_.GetData("Header", "X-A", null_).asString(), "2");
     EXPECT_TRUE(p_.GetData("Header", "X-C", null_).isNull());
     EXPECT_TRUE(p_.GetData("", "", null_).isMember("Header"));
-}
 
-TEST_F(SettingsTest, RawDataRejectsEmptyValuesOnly) {
+    // Raw data refuses empty values only.
     for (const Json::Value &empty :
          {Json::Value(), Json::Value(Json::objectValue), Json::Value(Json::arrayValue)}) {
         EXPECT_FALSE(p_.SetRawData("K", empty));

@@ -1,7 +1,9 @@
 // Sharing the database: the retry of locked statements, the seed of its pauses, writers killed
 // at random moments and several processes working at once.
+#include <errno.h>
 #include <signal.h>
 #include <sys/mman.h>
+#include <sys/time.h>
 #include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
@@ -26,30 +28,6 @@ namespace {
 
 using namespace store_test;
 using LockTest = StoreTest;
-
-// Forks a child that runs `body` and that an alarm ends after `seconds`, so that a crash or a
-// hang fails one test; the child exits with 1 when one of its expectations failed.
-template <typename Body>
-pid_t StartChild(Body body, unsigned seconds) {
-    fflush(nullptr);
-    const pid_t pid = fork();
-    if (pid == 0) {
-        alarm(seconds);
-        body();
-        fflush(nullptr);
-        _exit(::testing::Test::HasFailure() ? 1 : 0);
-    }
-    return pid;
-}
-
-// The exit status of a child, or 128 + the signal that ended it.
-int WaitChild(pid_t pid) {
-    int status = 0;
-    if (pid < 0 || waitpid(pid, &status, 0) != pid) {
-        return -1;
-    }
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-}
 
 // Counts the executions of statements that begin with a prefix on one connection.
 struct StatementCounter {
@@ -134,6 +112,48 @@ TEST_F(LockTest, LockedWriteIsTried101TimesThenLoggedOnce) {
     EXPECT_EQ(KOVACredDBRecordAdd(conn.get(), cred.get(), &id), 0);
     EXPECT_EQ(id, 1);
     EXPECT_TRUE(kova_test::UsleepCalls().empty());
+}
+
+TEST_F(LockTest, PausesAreSleptOutWhateverSignalsArrive) {
+    ASSERT_NE(DbPtr(KOVACredDBInit()), nullptr);
+    int ready[2];
+    ASSERT_EQ(pipe(ready), 0);
+    // Another process holds the lock for 1.5 s, far less than the retries' pauses add up to.
+    const pid_t holder = StartChild(
+        [&] {
+            sqlite3 *raw = nullptr;
+            ASSERT_EQ(sqlite3_open(DbPath().c_str(), &raw), SQLITE_OK);
+            const DbPtr db(raw);
+            ASSERT_EQ(sqlite3_exec(raw, "BEGIN EXCLUSIVE;", nullptr, nullptr, nullptr), SQLITE_OK);
+            ASSERT_EQ(write(ready[1], "x", 1), 1);
+            struct timespec hold = {1, 500000000};
+            while (nanosleep(&hold, &hold) != 0 && errno == EINTR) {
+            }
+            EXPECT_EQ(sqlite3_exec(raw, "COMMIT;", nullptr, nullptr, nullptr), SQLITE_OK);
+        },
+        30);
+    char byte = 0;
+    ASSERT_EQ(read(ready[0], &byte, 1), 1);
+    close(ready[0]);
+    close(ready[1]);
+
+    // A signal every millisecond in the caller, each ending a real usleep early as libc's does.
+    struct sigaction onAlarm = {}, old = {};
+    onAlarm.sa_handler = [](int) {};
+    ASSERT_EQ(sigaction(SIGALRM, &onAlarm, &old), 0);
+    const itimerval every1ms = {{0, 1000}, {0, 1000}}, off = {};
+    kova_test::SetSleepInterruptible(true);
+    ASSERT_EQ(setitimer(ITIMER_REAL, &every1ms, nullptr), 0);
+    CredPtr cred = MakeCred("patient");
+    const int added = KOVACredAdd(cred.get());
+    setitimer(ITIMER_REAL, &off, nullptr);
+    kova_test::SetSleepInterruptible(false);
+    sigaction(SIGALRM, &old, nullptr);
+
+    EXPECT_EQ(WaitChild(holder), 0);
+    EXPECT_EQ(added, 0) << kova_test::LogDump();
+    EXPECT_EQ(Query("SELECT host FROM credentials;"), (std::vector<Row>{{"patient"}}));
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
 }
 
 // ---- Several processes and threads

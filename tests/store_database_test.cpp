@@ -2,11 +2,18 @@
 // connection; their argument and statement errors (logged without secrets); hostile text; a
 // hostile or broken environment.
 #include <fcntl.h>
+#include <string.h>
+#include <sched.h>
+#include <sys/mount.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
 #include <functional>
+#include <memory>
 #include <string>
 #include <utility>
 #include <vector>
@@ -16,17 +23,46 @@
 #include "store_fixture.h"
 #include "support/child.h"
 
-// While set, chmod renames the first file over the second right after setting the mode, as
-// another process could between the library's checks and SQLite's open.
-std::pair<std::string, std::string> gSwapAfterChmod;
+// While set, fchmod moves the first file over the second right after setting the mode, as
+// another process could between the library's checks and SQLite's open; with `swapBack` the
+// two are exchanged instead, and exchanged back right after SQLite opened the path.
+struct Swap {
+    std::string impostor, path;
+    bool swapBack = false;
+} gSwap;
+bool gSwapBackAfterSqliteOpen = false;
 
-extern "C" int chmod(const char *path, mode_t mode) {
-    const int rc = static_cast<int>(syscall(SYS_fchmodat, AT_FDCWD, path, mode));
-    if (!gSwapAfterChmod.first.empty()) {
-        rename(gSwapAfterChmod.first.c_str(), gSwapAfterChmod.second.c_str());
-        gSwapAfterChmod = {};
+int Exchange(const std::string &a, const std::string &b) {
+    return static_cast<int>(
+        syscall(SYS_renameat2, AT_FDCWD, a.c_str(), AT_FDCWD, b.c_str(), RENAME_EXCHANGE));
+}
+
+extern "C" int fchmod(int fd, mode_t mode) {
+    const int rc = static_cast<int>(syscall(SYS_fchmod, fd, mode));
+    if (!gSwap.path.empty()) {
+        if (gSwap.swapBack) {
+            gSwapBackAfterSqliteOpen = Exchange(gSwap.impostor, gSwap.path) == 0;
+        } else {
+            rename(gSwap.impostor.c_str(), gSwap.path.c_str());
+            gSwap = {};
+        }
     }
     return rc;
+}
+
+// The open of SQLite's unix VFS, for the exchange back.
+sqlite3_syscall_ptr gSqliteOpen = nullptr;
+
+int SqliteOpenThenSwapBack(const char *path, int flags, int mode) {
+    // At the connection's open, SQLite opens the database file alone.
+    const int fd =
+        reinterpret_cast<int (*)(const char *, int, int)>(gSqliteOpen)(path, flags, mode);
+    if (gSwapBackAfterSqliteOpen) {
+        Exchange(gSwap.impostor, gSwap.path);
+        gSwapBackAfterSqliteOpen = false;
+        gSwap = {};
+    }
+    return fd;
 }
 
 namespace {
@@ -86,9 +122,25 @@ TEST_F(DatabaseTest, CreatesFoldersFileAndTablesAndRestoresTheMode) {
 
     // Opening again keeps the rows and sets the mode back, even one that allows no reading.
     ASSERT_EQ(chmod(path.c_str(), 0), 0);
-    DbPtr db = Open();
+    { DbPtr db = Open(); }
     EXPECT_EQ(ModeOf(path), 0600u);
     EXPECT_EQ(RawQuery(path, "SELECT host FROM credentials;"), (std::vector<Row>{{"a.example"}}));
+
+    // A link to the file, as deployments that keep it elsewhere have: the file it leads to is
+    // opened and gets the mode; the link stays.
+    const std::string link = db_.dir().File("link.sqlite");
+    ASSERT_EQ(symlink(path.c_str(), link.c_str()), 0);
+    ASSERT_EQ(chmod(path.c_str(), 0644), 0);
+    setenv("kovacredential_db", link.c_str(), 1);
+    DbPtr db = Open();
+    ASSERT_NE(db, nullptr);
+    Add(db.get(), *MakeCred("b.example"));
+    EXPECT_EQ(ModeOf(path), 0600u);
+    struct stat st;
+    EXPECT_TRUE(lstat(link.c_str(), &st) == 0 && S_ISLNK(st.st_mode));
+    EXPECT_EQ(RawQuery(path, "SELECT host FROM credentials ORDER BY id;"),
+              (std::vector<Row>{{"a.example"}, {"b.example"}}));
+    EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
 }
 
 TEST_F(DatabaseTest, AddWritesEveryColumnAndGetReadsTheRow) {
@@ -432,10 +484,24 @@ struct PathCase {
     std::function<std::string(const std::string &base)> make;  // the path, empty on failure
 };
 
+// A socket bound at `path`, left in the file system when its descriptor closes.
+bool BindSocket(const std::string &path) {
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    if (path.size() >= sizeof(addr.sun_path)) {
+        return false;
+    }
+    memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+    const int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+    const bool bound = fd >= 0 && bind(fd, reinterpret_cast<sockaddr *>(&addr), sizeof(addr)) == 0;
+    close(fd);
+    return bound;
+}
+
 TEST_F(DatabaseTest, PathsThatAreNotOpened) {
-    const std::string victim = db_.dir().File("victim");
     const std::string missing = db_.dir().File("missing");
-    ASSERT_TRUE(WriteFile(victim, "victim data", 0644));
+    const std::string fifo = db_.dir().File("fifo");
+    ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
     const std::string link = "cred_db:167 {path} is a symbolic link, not opened.\n";
     const std::string kind = "cred_db:167 {path} is not a regular file, not opened.\n";
     const int open = KOVA_ERR_DB_OPEN;
@@ -445,10 +511,13 @@ TEST_F(DatabaseTest, PathsThatAreNotOpened) {
     // Opening a FIFO could block: every case runs in a child bounded in time. SQLite reads a
     // file only at the first statement that needs the schema.
     const std::vector<PathCase> cases = {
-        {"link to a file", open, {link}, linkTo(victim)},
         {"dangling link", open, {link}, linkTo(missing)},
         {"folder", open, {kind}, [](auto &p) { return mkdir(p.c_str(), 0700) ? "" : p; }},
         {"FIFO", open, {kind}, [](auto &p) { return mkfifo(p.c_str(), 0600) ? "" : p; }},
+        {"link to a FIFO", open, {kind}, linkTo(fifo)},
+        {"link to a device", open, {kind}, linkTo("/dev/null")},
+        {"link to a folder", open, {kind}, linkTo(db_.dir().path())},
+        {"socket", open, {kind}, [](auto &p) { return BindSocket(p) ? p : ""; }},
         {"folder that cannot be made",
          open,
          {"cred_db:165 {path} chmod failed. errno=[0x0014]",  // ENOTDIR
@@ -485,25 +554,216 @@ TEST_F(DatabaseTest, PathsThatAreNotOpened) {
         };
         EXPECT_EQ(kova_test::RunInChild(60, refused), "exit 0");
     }
-    EXPECT_EQ(ModeOf(victim), 0644u);
-    EXPECT_EQ(ReadFile(victim), "victim data");
     EXPECT_NE(access(missing.c_str(), F_OK), 0);
-    EXPECT_EQ(ReadFile(db_.dir().File("case5")), std::string(8192, 'J'));
+    EXPECT_EQ(ModeOf(fifo), 0600u);
+    EXPECT_EQ(ReadFile(db_.dir().File("case" + std::to_string(cases.size() - 1))),
+              std::string(8192, 'J'));
 }
 
 TEST_F(DatabaseTest, FileSwappedInBeforeSQLiteOpensIsRefused) {
     { DbPtr db = Open(); }
     const std::string impostor = db_.dir().File("impostor");
+    const std::string replaced =
+        "cred_db:167 " + DbPath() + " was replaced while being opened, not opened.\n";
+    // The file SQLite holds is compared, not the one the path names afterwards: a file swapped
+    // in and back again once SQLite opened it is refused too.
+    sqlite3_vfs *unixVfs = sqlite3_vfs_find("unix");
+    ASSERT_NE(unixVfs, nullptr);
+    gSqliteOpen = unixVfs->xGetSystemCall(unixVfs, "open");
+    ASSERT_EQ(unixVfs->xSetSystemCall(
+                  unixVfs, "open", reinterpret_cast<sqlite3_syscall_ptr>(SqliteOpenThenSwapBack)),
+              SQLITE_OK);
     ASSERT_TRUE(WriteFile(impostor, "", 0644));
-    gSwapAfterChmod = {impostor, DbPath()};
+    gSwap = {impostor, DbPath(), true};
     EXPECT_EQ(KOVACredDBInit(), nullptr);
-    EXPECT_TRUE(gSwapAfterChmod.first.empty()) << "the library set no mode";
+    unixVfs->xSetSystemCall(unixVfs, "open", gSqliteOpen);
+    EXPECT_TRUE(gSwap.path.empty()) << "not swapped back";
     EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_OPEN, "cred_db", 169));
-    EXPECT_EQ(kova_test::LogRecords(), (Texts{"cred_db:167 " + DbPath() +
-                                              " was replaced while being opened, not opened.\n"}));
+    EXPECT_EQ(kova_test::LogRecords(), Texts{replaced});
+    EXPECT_EQ(ModeOf(impostor), 0644u);
+    EXPECT_EQ(ReadFile(impostor), "");
+
+    // A file swapped in for good.
+    kova_test::ClearLog();
+    gSwap = {impostor, DbPath(), false};
+    EXPECT_EQ(KOVACredDBInit(), nullptr);
+    EXPECT_TRUE(gSwap.path.empty()) << "the library set no mode";
+    EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_OPEN, "cred_db", 169));
+    EXPECT_EQ(kova_test::LogRecords(), Texts{replaced});
     // The impostor got neither the mode nor the tables.
     EXPECT_EQ(ModeOf(DbPath()), 0644u);
     EXPECT_EQ(ReadFile(DbPath()), "");
+}
+
+// ---- Whose file it is and what its mode can be. These need root: files of other users, user
+// ids taken in a forked child, private mounts.
+
+// Creates an empty file owned by `uid` with `mode`.
+bool MakeFileOf(const std::string &path, uid_t uid, mode_t mode) {
+    const int fd = ::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
+    const bool made = fd >= 0 && fchown(fd, uid, uid) == 0 && fchmod(fd, mode) == 0;
+    if (fd >= 0) {
+        close(fd);
+    }
+    return made;
+}
+
+uid_t OwnerOf(const std::string &path) {
+    struct stat st;
+    return stat(path.c_str(), &st) == 0 ? st.st_uid : static_cast<uid_t>(-1);
+}
+
+class PrivilegedDatabaseTest : public DatabaseTest {
+  protected:
+    void SetUp() override {
+        DatabaseTest::SetUp();
+        if (geteuid() != 0) {
+            GTEST_SKIP() << "needs root, as CI runs it";
+        }
+    }
+};
+
+TEST_F(PrivilegedDatabaseTest, FileOfAnotherUserIsRefusedAndOwnFilesGetTheirMode) {
+    constexpr uid_t kOther = 1000;
+    constexpr uid_t kNobody = 65534;
+    ASSERT_EQ(chmod(db_.dir().path().c_str(), 0711), 0);
+    const std::string shared = db_.dir().File("shared");
+    ASSERT_EQ(mkdir(shared.c_str(), 0700), 0);
+    ASSERT_EQ(chmod(shared.c_str(), 01777), 0);
+    const std::string victim = shared + "/victim.sqlite";
+    const std::string own = shared + "/own.sqlite";
+    const std::string unreadable = shared + "/unreadable.sqlite";
+    ASSERT_TRUE(MakeFileOf(victim, kOther, 0666));
+    ASSERT_TRUE(MakeFileOf(own, kNobody, 0644));
+    ASSERT_TRUE(MakeFileOf(unreadable, kNobody, 0));
+    auto refused = [&](uid_t euid) {
+        return Texts{"cred_db:166 " + victim + " belongs to uid 1000, not to the effective uid " +
+                     std::to_string(euid) + ", not opened.\n"};
+    };
+    // Another user's file, however open its mode, is refused to root and to a third user.
+    setenv("kovacredential_db", victim.c_str(), 1);
+    EXPECT_EQ(KOVACredAdd(MakeCred("h").get()), -1);
+    EXPECT_EQ(LogCountPrefix(refused(0)[0]), 1u) << kova_test::LogDump();
+    const pid_t child = StartChild(
+        [&] {
+            ASSERT_EQ(setresgid(kNobody, kNobody, kNobody), 0);
+            ASSERT_EQ(setresuid(kNobody, kNobody, kNobody), 0);
+            kova_test::ClearLog();
+            EXPECT_EQ(KOVACredDBInit(), nullptr);
+            EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_OPEN, "cred_db", 169));
+            EXPECT_EQ(kova_test::LogRecords(), refused(kNobody));
+            // The user's own files are used and get mode 0600, one without any permission too.
+            for (const std::string &path : {own, unreadable}) {
+                setenv("kovacredential_db", path.c_str(), 1);
+                CredPtr cred = MakeCred("h");
+                EXPECT_EQ(KOVACredAdd(cred.get()), 0) << path << kova_test::LogDump();
+                EXPECT_EQ(ModeOf(path), 0600u) << path;
+            }
+        },
+        60);
+    EXPECT_EQ(WaitChild(child), 0);
+    EXPECT_EQ((std::vector<long>{OwnerOf(victim), ModeOf(victim)}),
+              (std::vector<long>{1000, 0666}));
+    EXPECT_EQ(ReadFile(victim), "");
+    EXPECT_EQ(RawQuery(own, "SELECT host FROM credentials;"), (std::vector<Row>{{"h"}}));
+}
+
+TEST_F(PrivilegedDatabaseTest, ModeIsSetWithoutProcAndAModeThatCannotBeSetIsRefused) {
+    const std::string mount = db_.dir().File("mount");
+    ASSERT_EQ(mkdir(mount.c_str(), 0700), 0);
+    const std::string wide = mount + "/wide.sqlite";
+    const std::string tight = mount + "/tight.sqlite";
+    const pid_t child = StartChild(
+        [&] {
+            // A private mount namespace: an empty /proc, and a file system that turns read-only.
+            ASSERT_EQ(unshare(CLONE_NEWNS), 0) << strerror(errno);
+            ASSERT_EQ(::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr), 0);
+            ASSERT_EQ(::mount("none", "/proc", "tmpfs", 0, nullptr), 0);
+            ASSERT_EQ(::mount("none", mount.c_str(), "tmpfs", 0, "mode=0700"), 0);
+            ASSERT_NE(access("/proc/self/fd", F_OK), 0);
+            ASSERT_TRUE(WriteFile(DbPath(), "", 0644));
+            AddCred("h");
+            EXPECT_EQ(ModeOf(DbPath()), 0600u);
+            EXPECT_EQ(kova_test::LogRecords(), Texts{});
+
+            for (const std::string &path : {wide, tight}) {
+                setenv("kovacredential_db", path.c_str(), 1);
+                AddCred("ro");
+            }
+            ASSERT_EQ(chmod(wide.c_str(), 0644), 0);
+            ASSERT_EQ(::mount(nullptr, mount.c_str(), nullptr, MS_REMOUNT | MS_RDONLY, nullptr), 0);
+            // On a read-only mount a file that is at 0600 already is read; a wider one is
+            // refused.
+            kova_test::ClearLog();
+            KOVA_CRED *list = nullptr;
+            EXPECT_EQ(KOVACredListGet(&list, nullptr, nullptr), 1) << kova_test::LogDump();
+            KOVACredListFree(&list);
+            EXPECT_EQ(kova_test::LogRecords(),
+                      Texts{"cred_db:165 " + tight + " chmod failed. errno=[0x001E]"});  // EROFS
+            kova_test::ClearLog();
+            setenv("kovacredential_db", wide.c_str(), 1);
+            EXPECT_EQ(KOVACredDBInit(), nullptr);
+            EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_OPEN, "cred_db", 169));
+            EXPECT_EQ(kova_test::LogRecords(),
+                      (Texts{"cred_db:165 " + wide + " chmod failed. errno=[0x001E]",
+                             "cred_db:168 " + wide + " cannot be given mode 0600, not opened.\n"}));
+        },
+        60);
+    EXPECT_EQ(WaitChild(child), 0);
+}
+
+// ---- The environment rule: a process in secure-execution mode ignores the variables, and says
+// so once per variable.
+
+// A copy of the program at `from` at `to` with `mode`, owned by root and group `gid`.
+bool CopyProgram(const std::string &from, const std::string &to, gid_t gid, mode_t mode) {
+    const std::string bytes = ReadFile(from);
+    return !bytes.empty() && WriteFile(to, bytes, 0700) && chown(to.c_str(), 0, gid) == 0 &&
+           chmod(to.c_str(), mode) == 0;
+}
+
+TEST_F(PrivilegedDatabaseTest, SetGroupIdProgramIgnoresTheVariablesAndLogsThem) {
+    if (getenv("KOVA_TEST_LAUNCHER") != nullptr) {
+        GTEST_SKIP() << "an emulator runs the program as a plain file: no secure-execution mode";
+    }
+    // A set-group-ID bit takes effect only where the file system is not mounted nosuid.
+    auto dir = std::make_unique<kova_test::TempDir>();
+    struct statvfs fs;
+    if (statvfs(dir->path().c_str(), &fs) != 0 || (fs.f_flag & ST_NOSUID) != 0) {
+        dir = std::make_unique<kova_test::TempDir>(KOVA_BINARY_DIR);
+    }
+    ASSERT_EQ(statvfs(dir->path().c_str(), &fs), 0);
+    ASSERT_EQ(fs.f_flag & ST_NOSUID, 0u) << dir->path();
+    const gid_t group = getgid() == 65534 ? 1 : 65534;
+    const std::string setgid = dir->File("probe-setgid");
+    const std::string plain = dir->File("probe-plain");
+    ASSERT_TRUE(CopyProgram(STORE_ENV_PROBE_BIN, setgid, group, 02755));
+    ASSERT_TRUE(CopyProgram(STORE_ENV_PROBE_BIN, plain, getgid(), 0755));
+    const std::string named = dir->File("named.sqlite");
+    auto run = [&](const std::string &program) {
+        std::string out;
+        EXPECT_EQ(kova_test::RunCommand("env kovacredential_db='" + named +
+                                            "' kovacredential_debug=1 "
+                                            "kovacredential_farlink_server=dir.example "
+                                            "kovacredential_farlink_global=global.example '" +
+                                            program + "'",
+                                        &out),
+                  0);
+        return out;
+    };
+    std::string expected = "secure 1\npath /usr/kova/etc/private/credentials.sqlite\n";
+    for (const char *name : {"kovacredential_db", "kovacredential_debug",
+                             "kovacredential_farlink_server", "kovacredential_farlink_global"}) {
+        expected += std::string("log kova_env:21 ") + name +
+                    " is set but ignored: the process runs in secure-execution mode "
+                    "(set-user-ID, set-group-ID or file capabilities)\n";
+    }
+    EXPECT_EQ(run(setgid), expected);
+    EXPECT_NE(access(named.c_str(), F_OK), 0) << "the set-group-ID program used the variable";
+
+    // The same program without the bit takes the variables, and nothing is logged.
+    EXPECT_EQ(run(plain), "secure 0\npath " + named + "\n");
+    EXPECT_EQ(ModeOf(named), 0600u);
 }
 
 }  // namespace

@@ -5,6 +5,9 @@
 #define KOVA_TESTS_STORE_FIXTURE_H
 
 #include <sqlite3.h>
+#include <stdio.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <functional>
@@ -146,6 +149,30 @@ inline void ExpectArgErrors(const std::vector<ArgCase> &cases) {
         EXPECT_EQ(c.call(), -1);
         EXPECT_TRUE(ArgErrorReported(c.file, c.line, c.check));
     }
+}
+
+// Forks a child that runs `body` and that an alarm ends after `seconds`, so that a crash or a
+// hang fails one test; the child exits with 1 when one of its expectations failed.
+template <typename Body>
+pid_t StartChild(Body body, unsigned seconds) {
+    fflush(nullptr);
+    const pid_t pid = fork();
+    if (pid == 0) {
+        alarm(seconds);
+        body();
+        fflush(nullptr);
+        _exit(::testing::Test::HasFailure() ? 1 : 0);
+    }
+    return pid;
+}
+
+// The exit status of a child, or 128 + the signal that ended it.
+inline int WaitChild(pid_t pid) {
+    int status = 0;
+    if (pid < 0 || waitpid(pid, &status, 0) != pid) {
+        return -1;
+    }
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
 inline size_t LogCountPrefix(const std::string &prefix) {

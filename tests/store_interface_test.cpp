@@ -85,13 +85,15 @@ TEST_F(InterfaceTest, StatementFailuresOfAnOpenDatabaseAreLogged) {
     AddCred("h");
     // Views under the tables' names survive the schema statements (IF NOT EXISTS) but read a
     // table that is gone or lack the id column, and take no writes: every step fails on a
-    // database that opened. The inner steps record no code: the lines carry the empty slot.
+    // database that opened. The inner steps record no code: the error slot keeps what an
+    // earlier failure left there, and the lines carry that.
     ASSERT_TRUE(Query("DROP TABLE credential_sessions; DROP TABLE credentials; CREATE VIEW "
                       "credentials AS SELECT * FROM gone; CREATE VIEW credential_sessions AS "
                       "SELECT 1 AS x, 2 AS y;")
                     .empty());
     CredPtr cred = MakeCred("h");
     SessPtr sess = NewSess();
+    VLIBCErrSetEx(KOVA_ERR_DB_READBACK, "earlier", 7);
     ExpectFailuresLogged(
         {
             {[&] { return KOVACredGetByID(1, cred.get()); },
@@ -104,7 +106,8 @@ TEST_F(InterfaceTest, StatementFailuresOfAnOpenDatabaseAreLogged) {
             {[&] { return KOVACredSessRemoveByID(1); },
              "cred_sess_remove:18 Remove Cred record failed. id:[1]"},
         },
-        "[0x0000 :0]");
+        "[0x0B00 earlier:7]");
+    EXPECT_TRUE(ErrorIs(KOVA_ERR_DB_READBACK, "earlier", 7));
     // A failed read of the table looks like an empty one, to the look-up by application too.
     kova_test::ClearLog();
     KOVA_CRED *list = nullptr;

@@ -3,6 +3,7 @@
 #include <string.h>
 
 #include <functional>
+#include <iterator>
 #include <string>
 
 #include "kovacredential/kovaplatform.h"
@@ -236,12 +237,26 @@ TEST_F(WebApiAuthTest, LogoutSendsSidAndCookieAndEndsTheSession) {
     EXPECT_TRUE(LogHas("Logout response is invalid")) << LogDump();
 }
 
-// Login and logout answers that cannot be used.
-class WebApiBadAnswerTest : public WebApiAuthTest,
-                            public ::testing::WithParamInterface<const char *> {};
+// A usable answer but for a member nested deeper than the parser allows.
+const std::string kDeepAnswer =
+    "{\"success\":true,\"data\":{\"sid\":\"S\",\"x\":" + std::string(1000, '[') +
+    std::string(1000, ']') + "}}";
+
+// Login and logout answers that cannot be used. The parameter is an index into this table, so
+// that test names stay short.
+const std::string kBadAnswers[] = {kDeepAnswer,
+                                   "<html>login</html>",
+                                   "{\"success\":false}",
+                                   "{\"success\":true}",
+                                   "{\"success\":\"yes\"}",
+                                   "{\"success\":true,\"data\":\"sid\"}",
+                                   "[1,2]",
+                                   ""};
+
+class WebApiBadAnswerTest : public WebApiAuthTest, public ::testing::WithParamInterface<size_t> {};
 
 TEST_P(WebApiBadAnswerTest, IsAnInvalidResponse) {
-    const std::string body = GetParam();
+    const std::string body = kBadAnswers[GetParam()];
     auto bad = FixedAnswer("/webapi/auth.cgi", body, true);
     KOVA_CRED cred = Cred(bad->Port());
     cred.id = 99;  // not stored: nothing to write back
@@ -261,16 +276,8 @@ TEST_P(WebApiBadAnswerTest, IsAnInvalidResponse) {
     EXPECT_EQ(!logoutUsable, LogHas("Logout response is invalid")) << LogDump();
 }
 
-// A usable answer but for a member nested deeper than the parser allows.
-const std::string kDeepAnswer =
-    "{\"success\":true,\"data\":{\"sid\":\"S\",\"x\":" + std::string(1000, '[') +
-    std::string(1000, ']') + "}}";
-
 INSTANTIATE_TEST_SUITE_P(Answers, WebApiBadAnswerTest,
-                         ::testing::Values(kDeepAnswer.c_str(), "<html>login</html>",
-                                           "{\"success\":false}", "{\"success\":true}",
-                                           "{\"success\":\"yes\"}",
-                                           "{\"success\":true,\"data\":\"sid\"}", "[1,2]", ""));
+                         ::testing::Range(size_t{0}, std::size(kBadAnswers)));
 
 TEST_F(WebApiAuthTest, LoginAnswerIsReadLenientlyButLogoutAnswerMustBeWhole) {
     auto lenient = FixedAnswer(

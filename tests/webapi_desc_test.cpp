@@ -95,19 +95,34 @@ TEST_F(WebApiDescTest, UnknownApiSetsErrorSixAndIsQueriedAgain) {
     EXPECT_EQ("", format);
 }
 
+// "0,0,...,0" with `count` zeros.
+std::string ZeroList(size_t count) {
+    std::string list(2 * count - 1, ',');
+    for (size_t i = 0; i < list.size(); i += 2) {
+        list[i] = '0';
+    }
+    return list;
+}
+
 TEST_F(WebApiDescTest, UnusableAnswersAreNotCached) {
     const struct {
         std::string body;
         const char *log;
-    } cases[] = {{"<html><body>It works</body></html>", "Query response is invalid"},
-                 {"{\"success\":false,\"error\":{\"code\":105}}", "Query request fail!"},
-                 {"[\"success\"]", "Query request fail!"},
-                 {"{\"success\":true,\"data\":{\"x\":" + std::string(1000, '[') +
-                      std::string(1000, ']') + "}}",
-                  "Query response is invalid"}};
+    } cases[] = {
+        {"<html><body>It works</body></html>", "Query response is invalid"},
+        {"{\"success\":false,\"error\":{\"code\":105}}", "Query request fail!"},
+        {"[\"success\"]", "Query request fail!"},
+        {"{\"success\":true,\"data\":{\"x\":" + std::string(1000, '[') + std::string(1000, ']') +
+             "}}",
+         "Query response is invalid"},
+        // Values that would take far more memory than their text (about 100 bytes
+        // for each "0,"), and a description too large to keep for the process's life.
+        {"{\"success\":true,\"data\":[" + ZeroList(500000) + "]}", "Query response is invalid"},
+        {"{\"success\":true,\"data\":{\"x\":{\"path\":\"" + std::string(17000000, 'p') + "\"}}}",
+         "Query response is invalid"}};
     int id = 7;
     for (const auto &c : cases) {
-        SCOPED_TRACE(c.body);
+        SCOPED_TRACE(c.body.substr(0, 80));
         ClearLog();
         KOVA_CRED cred;
         auto server = FixedQuery(c.body, cred, ++id);
@@ -136,18 +151,8 @@ TEST_F(WebApiDescTest, UnusableAnswersAreNotCached) {
     EXPECT_EQ("", format);
 }
 
-TEST_F(WebApiDescTest, FailedTransferSetsErrorFive) {
-    kovasim::RefusedPort closed;
-    KOVA_CRED cred = Cred(closed.Port());
-    cred.id = 11;
-    EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, CredRequestUtil::m_errCode);
-    EXPECT_TRUE(LogHas("Cred Error:[http://127.0.0.1:" + std::to_string(cred.port) +
-                       "/webapi/query.cgi][20]"))
-        << LogDump();
-}
-
-TEST_F(WebApiDescTest, BadArgumentsAndUnknownIdsAreRefusedWithoutTraffic) {
+// Bad arguments and unknown ids are refused without traffic; a failed transfer sets error 5.
+TEST_F(WebApiDescTest, BadArgumentsUnknownIdsAndFailedTransfers) {
     EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(nullptr));
     EXPECT_EQ("", CredRequestUtil::GetWebAPIPath(nullptr, "KOVA.Demo.Echo"));
     std::string format;
@@ -161,6 +166,15 @@ TEST_F(WebApiDescTest, BadArgumentsAndUnknownIdsAreRefusedWithoutTraffic) {
     EXPECT_TRUE(LogHas("Cannot find id[999] in database")) << LogDump();
     EXPECT_EQ(0u, Server().RequestCount());
     EXPECT_FALSE(CredRequestUtil::IsCredIdCached(999));
+
+    kovasim::RefusedPort closed;
+    KOVA_CRED cred = Cred(closed.Port());
+    cred.id = 11;
+    EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, CredRequestUtil::m_errCode);
+    EXPECT_TRUE(LogHas("Cred Error:[http://127.0.0.1:" + std::to_string(cred.port) +
+                       "/webapi/query.cgi][20]"))
+        << LogDump();
 }
 
 }  // namespace

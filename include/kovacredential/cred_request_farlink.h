@@ -48,7 +48,9 @@ class KOVA_EXPORT CredRequestFarlink {
     // A deadline for each whole operation of this client (a command, GetAvailableServerInfo,
     // GetAvailableConnInfo with all its probes and the tunnel), in milliseconds: what is left
     // of it bounds every request the operation makes, and an operation that runs out fails
-    // with CRED_REQ_ERR_TIMEOUT. 0 (the default) sets none.
+    // with CRED_REQ_ERR_TIMEOUT and no detail. Each operation has the whole of it again; a
+    // request prepared by GetServerInfo() carries what was left when it was made. 0 (the
+    // default) or less sets none.
     void SetTotalTimeout(long milliseconds);
     // The server to look up; its MD5 (what the server's probe answer must carry) is kept with
     // it. An empty id sets 401.
@@ -97,8 +99,9 @@ class KOVA_EXPORT CredRequestFarlink {
                             Json::Value *errors);
     static bool GetConnInfoPortal(const std::string &serverId, Json::Value &candidate,
                                   Json::Value *errors);
-    // The same look-ups ending within `timeoutMilliseconds` (0: no deadline); one that runs out
-    // fails with CRED_REQ_ERR_TIMEOUT in `errors`.
+    // The same look-ups ending within `timeoutMilliseconds` (0 or less: no deadline), both
+    // services together; one that runs out fails with {"code": CRED_REQ_ERR_TIMEOUT} in
+    // `errors` and tries no further service.
     static bool GetConnInfo(const std::string &serverId, Json::Value &candidate,
                             Json::Value *errors, long timeoutMilliseconds);
     static bool GetConnInfoPortal(const std::string &serverId, Json::Value &candidate,

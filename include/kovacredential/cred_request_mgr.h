@@ -79,7 +79,8 @@ class KOVA_EXPORT CredRequestMgr {
     // Run with a deadline for the whole run, in milliseconds from the call (0: none, as Run();
     // negative: CRED_REQ_ERR_BAD_PARAM and false, nothing run). When it passes, every
     // unfinished request is stopped with CRED_REQ_ERR_TIMEOUT, the manager's error becomes
-    // CRED_REQ_ERR_TIMEOUT and the result is false.
+    // CRED_REQ_ERR_TIMEOUT and the result is false; a host name still being resolved is not
+    // waited for.
     bool Run(long timeoutMilliseconds);
     // Makes a Run of this manager in progress return false at its next wake-up with
     // CRED_REQ_ERR_SELECT (logged as an interrupted wait), its unfinished requests stopped with

@@ -9,8 +9,8 @@
 // log; the step that detected it records a code in the error slot (VLIBCErrGet,
 // kovaplatform.h): 3328 invalid argument, 2304 database cannot be opened, 2816 written row
 // not found on read-back, 512 out of memory. A statement SQLite rejects is logged with its
-// message and records no code. A failure caused by an inner step records nothing new; its log
-// line carries the inner code, file and line.
+// message and records no code (the slot keeps what it held). A failure caused by an inner step
+// records nothing new; its log line carries the inner code, file and line.
 //
 // Concurrency: every function may run on several threads and in several processes at once
 // (the error slot is per thread; the database is shared through SQLite's lock). A record or

@@ -18,11 +18,14 @@ struct sqlite3;
 // first call. Safe to call from several threads at once.
 KOVA_EXPORT void KOVACredRandInit(void);
 
-// Opens the database (creating the file, its missing folders and both tables), sets mode 0600
-// and turns foreign keys on. Null on failure: error 2304 when SQLite cannot open it, and also
-// when the path names a symbolic link or anything but a regular file (logged with the reason;
-// the mode of a link's target is never changed). The caller closes the connection with
-// sqlite3_close.
+// Opens the database named by $kovacredential_db (ignored in secure-execution mode) or the
+// default one, creating the file, its missing folders and both tables; sets mode 0600 on the
+// file (through a symbolic link to it too) and turns foreign keys on. Null on failure: error
+// 2304 when SQLite cannot open it, and also, logged with the reason, when the path leads to
+// anything but a regular file or to none (a dangling link), when the file belongs to another
+// user than the effective one, when its mode cannot be made 0600 (a file at 0600 already is
+// used), or when another file took its place while it was being opened. The caller closes
+// the connection with sqlite3_close.
 KOVA_EXPORT sqlite3 *KOVACredDBInit(void);
 
 // Inserts the record; stores the new row id in *pId when pId is not null.

@@ -18,6 +18,7 @@ std::vector<unsigned> gUsleeps;
 std::vector<unsigned> gSleeps;
 std::atomic<bool> gFakeSleep{false};
 std::atomic<unsigned> gSleepDivisor{1};
+std::atomic<bool> gInterruptible{false};
 
 void Capture(const char *fmt, va_list ap) {
     const int saved = errno;  // the caller's errno survives, and %m reads it
@@ -31,19 +32,24 @@ void Capture(const char *fmt, va_list ap) {
     errno = saved;
 }
 
-void Pause(std::vector<unsigned> &calls, unsigned asked, unsigned long micros) {
+// 0, or -1 with errno EINTR when a signal ended the pause while interruptible sleeps are on.
+int Pause(std::vector<unsigned> &calls, unsigned asked, unsigned long micros) {
     {
         std::lock_guard<std::mutex> lock(gMutex);
         calls.push_back(asked);
     }
     if (gFakeSleep) {
-        return;
+        return 0;
     }
     micros /= gSleepDivisor;
     struct timespec ts = {static_cast<time_t>(micros / 1000000),
                           static_cast<long>((micros % 1000000) * 1000)};
     while (nanosleep(&ts, &ts) != 0 && errno == EINTR) {
+        if (gInterruptible) {
+            return -1;
+        }
     }
+    return 0;
 }
 
 template <typename T>
@@ -79,8 +85,7 @@ void __syslog_chk(int, int, const char *fmt, ...) {
 }
 
 int usleep(useconds_t usec) {
-    Pause(gUsleeps, usec, usec);
-    return 0;
+    return Pause(gUsleeps, usec, usec);
 }
 
 unsigned int sleep(unsigned int seconds) {
@@ -120,6 +125,10 @@ void SetFakeSleep(bool on) {
     gFakeSleep = on;
 }
 
+void SetSleepInterruptible(bool on) {
+    gInterruptible = on;
+}
+
 void SetSleepDivisor(unsigned divisor) {
     gSleepDivisor = divisor == 0 ? 1 : divisor;
 }
@@ -136,6 +145,14 @@ void ClearSleeps() {
     std::lock_guard<std::mutex> lock(gMutex);
     gUsleeps.clear();
     gSleeps.clear();
+}
+
+std::string Pattern(size_t size) {
+    std::string text(size, '\0');
+    for (size_t i = 0; i < size; ++i) {
+        text[i] = static_cast<char>('a' + (i * 7 + i / 251) % 26);
+    }
+    return text;
 }
 
 File StreamWith(const std::string &text, bool atEnd) {

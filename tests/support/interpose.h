@@ -30,6 +30,9 @@ void SetFakeSleep(bool on);
 // Real sleeps last 1/divisor of what was asked (1, the default, is the full time); a long run
 // keeps its pauses and their order in less time.
 void SetSleepDivisor(unsigned divisor);
+// While on, a signal ends a real usleep early with -1 and errno EINTR, as libc's does
+// (otherwise the pause is resumed, so that tests need not care about signals).
+void SetSleepInterruptible(bool on);
 std::vector<unsigned> UsleepCalls();  // microseconds of each usleep call
 std::vector<unsigned> SleepCalls();   // seconds of each sleep call
 void ClearSleeps();
@@ -48,6 +51,9 @@ class FakeSleepScope {
 File StreamWith(const std::string &text, bool atEnd = false);
 // Everything `f` holds (after flushing it), from its start.
 std::string ReadAll(FILE *f);
+// `size` letters in a pattern that does not repeat within a few kilobytes, so that a body cut,
+// doubled or shifted anywhere shows.
+std::string Pattern(size_t size);
 
 }  // namespace kova_test
 

@@ -2,6 +2,9 @@
 // call's outcome. The request manager builds (logging in where needed) and owns the requests;
 // their transfers run together over one libcurl multi handle driven here, so that each
 // transfer's end is seen as it happens: for the progress line and each call's own time.
+#include <signal.h>
+#include <stdlib.h>
+#include <stdint.h>
 #include <stdio.h>
 #include <unistd.h>
 
@@ -22,6 +25,7 @@
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_mgr.h"
 #include "kovacredential/cred_request_util.h"
+#include "kovacredential/kovacredential.h"
 
 namespace kovacred {
 namespace {
@@ -34,7 +38,8 @@ struct Call {
     int index = -1;       // slot in the manager; -1 when the call could not be built
     std::string problem;  // why a call could not be built
     bool finished = false;
-    long code = 0;  // the library's error code; 0 for success
+    bool cancelled = false;  // still running when the batch was interrupted
+    long code = 0;           // the library's error code; 0 for success
     double seconds = -1;
 };
 
@@ -58,7 +63,20 @@ bool ReadCalls(const std::string &path, Json::Value &calls, std::string &problem
     builder["collectComments"] = false;
     std::string errors;
     if (!Json::parseFromStream(builder, *in, &calls, &errors)) {
-        problem = (path == "-" ? std::string("standard input") : path) + " is not JSON: " + errors;
+        // jsoncpp's report spans lines ("* Line 1, Column 2\n  Syntax error ..."); one is kept.
+        std::string reason;
+        for (char c : errors) {
+            if (c == '\n') {
+                c = ' ';
+            }
+            if (c != '*' && !(c == ' ' && (reason.empty() || reason.back() == ' '))) {
+                reason += c;
+            }
+        }
+        while (!reason.empty() && reason.back() == ' ') {
+            reason.pop_back();
+        }
+        problem = (path == "-" ? std::string("standard input") : path) + " is not JSON: " + reason;
         return false;
     }
     if (!calls.isArray()) {
@@ -69,8 +87,31 @@ bool ReadCalls(const std::string &path, Json::Value &calls, std::string &problem
     return true;
 }
 
+// The transport for the server at scheme://host:port, readied on its first use; null with
+// the reason in `call` when it cannot be.
+const Transport *ServerTransport(const Transport &options,
+                                 std::map<std::string, Transport> &servers,
+                                 const std::string &scheme, const std::string &host, int port,
+                                 Call &call) {
+    const std::string key = scheme + "://" + host + ":" + std::to_string(port);
+    auto found = servers.find(key);
+    if (found != servers.end()) {
+        return &found->second;
+    }
+    Transport transport = options;
+    const int exitCode = gExitCode;
+    if (!PrepareTransport("batch", transport, scheme, host, port)) {
+        gExitCode = exitCode;
+        call.problem = "the transport options cannot be used for " + key;
+        return nullptr;
+    }
+    return &servers.emplace(key, transport).first->second;
+}
+
 // Adds one call to the manager; on failure leaves the reason and the error code in `call`.
-void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call) {
+// Each server's transport is readied once (`servers`, by "scheme://host:port").
+void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call,
+             const Transport &options, std::map<std::string, Transport> &servers) {
     call.code = KOVA::CRED_REQ_ERR_BAD_PARAM;
     if (!item.isObject()) {
         call.problem = "not an object";
@@ -83,7 +124,17 @@ void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call) {
             return;
         }
         call.target = item["url"].asString();
+        std::string scheme;
+        std::string host;
+        std::string port;
+        KOVA::CredRequestUtil::ParseURL(call.target, scheme, host, port);
+        const Transport *transport =
+            ServerTransport(options, servers, scheme, host, atoi(port.c_str()), call);
+        if (transport == nullptr) {
+            return;
+        }
         std::unique_ptr<KOVA::CredRequest> request(new KOVA::CredRequest());
+        ApplyTransport(*transport, *request);
         if (!request->SetURL(call.target)) {
             call.problem = "bad url";
             call.code = request->GetError();
@@ -112,10 +163,37 @@ void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call) {
     call.credId = static_cast<long>(item["cred"].asInt64());
     call.target = "cred " + std::to_string(call.credId) + " " + item["api"].asString() + " " +
                   std::to_string(item["version"].asInt()) + " " + item["method"].asString();
+    KOVA_CRED cred;
+    if (call.credId < 1 || call.credId > INT32_MAX || KOVACredGetByID(call.credId, &cred) < 0 ||
+        cred.filled == 0) {
+        call.problem = "no credential with id " + std::to_string(call.credId);
+        return;
+    }
+    // The description query and the login the manager would make are made here, so that the
+    // transport options apply to the query and a failure is named as login names it.
+    const Transport *transport =
+        ServerTransport(options, servers, cred.protocol, cred.host, cred.port, call);
+    if (transport == nullptr) {
+        return;
+    }
+    Json::Value desc;
+    std::string failure;
+    if (!KOVA::CredRequestUtil::IsCredIdCached(call.credId) &&
+        !FetchDescription(cred, *transport, desc, failure, call.code)) {
+        call.problem = "the API description " + failure;
+        return;
+    }
+    KOVA_CRED_SESS sess;
+    if ((KOVACredSessGetByID(call.credId, &sess) < 0 || sess.filled == 0) &&
+        !LogIn(cred, "", failure, call.code)) {
+        call.problem = "login failed (" + failure + ")";
+        return;
+    }
     KOVA::CredRequestUtil::m_errCode = 0;
     call.index = mgr.AddWebAPIRequest(call.credId, item["api"].asString(), item["version"].asInt(),
                                       item["method"].asString(), params);
     if (call.index >= 0) {
+        ApplyTransport(*transport, *mgr.GetRequest(call.index));
         call.code = 0;
         return;
     }
@@ -155,7 +233,34 @@ class Progress {
     size_t shownDone_ = static_cast<size_t>(-1);
 };
 
-// Runs every built call's transfer together until all have finished.
+// Set by the first SIGINT; the handler then gives way to the default one, so that a second
+// Ctrl-C ends the process at once.
+volatile sig_atomic_t gInterrupted = 0;
+
+void OnInterrupt(int) {
+    gInterrupted = 1;
+}
+
+// While it lives, the first SIGINT sets gInterrupted instead of ending the process.
+class InterruptCatcher {
+  public:
+    InterruptCatcher() {
+        struct sigaction action = {};
+        action.sa_handler = OnInterrupt;
+        action.sa_flags = SA_RESETHAND;  // no SA_RESTART: a wait ends at once
+        sigemptyset(&action.sa_mask);
+        sigaction(SIGINT, &action, &saved_);
+    }
+    ~InterruptCatcher() { sigaction(SIGINT, &saved_, nullptr); }
+    InterruptCatcher(const InterruptCatcher &) = delete;
+    InterruptCatcher &operator=(const InterruptCatcher &) = delete;
+
+  private:
+    struct sigaction saved_;
+};
+
+// Runs every built call's transfer together until all have finished, or until SIGINT, which
+// leaves the unfinished ones cancelled.
 void RunTransfers(KOVA::CredRequestMgr &mgr, std::vector<Call> &calls) {
     size_t done = 0;
     size_t failed = 0;
@@ -166,7 +271,7 @@ void RunTransfers(KOVA::CredRequestMgr &mgr, std::vector<Call> &calls) {
         failed += code != 0 ? 1 : 0;
     };
     for (Call &call : calls) {
-        if (call.index < 0) {
+        if (call.index < 0 && !call.cancelled) {
             finish(call, call.code);
         }
     }
@@ -174,7 +279,7 @@ void RunTransfers(KOVA::CredRequestMgr &mgr, std::vector<Call> &calls) {
     Multi multi(curl_multi_init());
     std::map<CURL *, Call *> running;
     for (Call &call : calls) {
-        if (call.index < 0) {
+        if (call.index < 0 || gInterrupted) {
             continue;
         }
         KOVA::CredRequest *request = mgr.GetRequest(call.index);
@@ -192,7 +297,7 @@ void RunTransfers(KOVA::CredRequestMgr &mgr, std::vector<Call> &calls) {
         running[easy] = &call;
     }
     // Each transfer is bounded by its request's connect and low-speed time-outs.
-    while (!running.empty()) {
+    while (!running.empty() && !gInterrupted) {
         progress.Show(done, failed);
         int active = 0;
         if (curl_multi_perform(multi.get(), &active) != CURLM_OK) {
@@ -223,12 +328,22 @@ void RunTransfers(KOVA::CredRequestMgr &mgr, std::vector<Call> &calls) {
     }
     for (auto &entry : running) {
         curl_multi_remove_handle(multi.get(), entry.first);
-        finish(*entry.second, KOVA::CRED_REQ_ERR_CURL_INTERNAL);
+        if (gInterrupted) {
+            entry.second->cancelled = true;
+        } else {
+            finish(*entry.second, KOVA::CRED_REQ_ERR_CURL_INTERNAL);
+        }
+    }
+    for (Call &call : calls) {
+        call.cancelled = call.cancelled || (gInterrupted && !call.finished);
     }
     progress.Show(done, failed, true);
 }
 
 std::string ResultText(const Call &call) {
+    if (call.cancelled) {
+        return "cancelled";
+    }
     return call.index < 0 ? "not run" : call.code == 0 ? "ok" : "failed";
 }
 
@@ -237,7 +352,7 @@ void PrintSummary(const std::vector<Call> &calls) {
     for (size_t i = 0; i < calls.size(); ++i) {
         const Call &call = calls[i];
         std::string error = "-";
-        if (call.code != 0) {
+        if (call.code != 0 && !call.cancelled) {
             error = std::to_string(call.code) + " " + ErrorName(call.code);
         }
         char time[32] = "-";
@@ -256,17 +371,35 @@ Json::Value Answer(const std::string &body) {
     return ParseJson(body, value) ? value : Json::Value(body);
 }
 
-void RunBatch(const std::string &path, bool json) {
-    Json::Value specs;
+bool UsesCredentials(const Json::Value &items) {
+    for (const Json::Value &item : items) {
+        if (item.isObject() && !item.isMember("url")) {
+            return true;
+        }
+    }
+    return false;
+}
+
+void RunBatch(const std::string &path, bool json, const Transport &options) {
+    Json::Value items;
     std::string problem;
-    if (!ReadCalls(path, specs, problem)) {
+    if (!ReadCalls(path, items, problem)) {
         FailText("batch: " + problem);
         return;
     }
+    if (UsesCredentials(items) && !CheckDatabase(DatabaseUse::kExisting)) {
+        return;
+    }
+    const InterruptCatcher catcher;
+    std::map<std::string, Transport> servers;
     KOVA::CredRequestMgr mgr;
-    std::vector<Call> calls(specs.size());
-    for (Json::ArrayIndex i = 0; i < specs.size(); ++i) {
-        AddCall(mgr, specs[i], calls[i]);
+    std::vector<Call> calls(items.size());
+    for (Json::ArrayIndex i = 0; i < items.size(); ++i) {
+        if (gInterrupted) {
+            calls[i].cancelled = true;
+            continue;
+        }
+        AddCall(mgr, items[i], calls[i], options, servers);
         if (calls[i].index < 0) {
             fprintf(stderr, "kovacred: batch: call %u: %s\n", i, calls[i].problem.c_str());
         }
@@ -276,11 +409,15 @@ void RunBatch(const std::string &path, bool json) {
     // Answers may echo a session's id or token, or a password.
     Secrets secrets;
     size_t failed = 0;
+    size_t finished = 0;
+    size_t cancelled = 0;
     for (const Call &call : calls) {
         if (call.credId != 0) {
             secrets.AddCredential(call.credId);
         }
-        failed += call.code != 0 ? 1 : 0;
+        failed += call.code != 0 && !call.cancelled ? 1 : 0;
+        finished += call.finished ? 1 : 0;
+        cancelled += call.cancelled ? 1 : 0;
     }
     if (json) {
         Json::Value out(Json::arrayValue);
@@ -290,13 +427,14 @@ void RunBatch(const std::string &path, bool json) {
             entry["index"] = static_cast<Json::UInt>(i);
             entry["target"] = call.target;
             entry["result"] = ResultText(call);
-            entry["code"] = static_cast<Json::Int64>(call.code);
-            entry["name"] = ErrorName(call.code);
+            entry["code"] = static_cast<Json::Int64>(call.cancelled ? 0 : call.code);
+            entry["name"] = call.cancelled ? "" : ErrorName(call.code);
             entry["ms"] =
                 call.seconds >= 0
                     ? Json::Value(static_cast<Json::Int64>(std::llround(call.seconds * 1000)))
                     : Json::Value();
-            entry["answer"] = call.index >= 0 ? Answer(mgr.GetResponse(call.index)) : Json::Value();
+            entry["answer"] = call.index >= 0 && call.finished ? Answer(mgr.GetResponse(call.index))
+                                                               : Json::Value();
             out.append(entry);
         }
         printf("%s\n", JsonText(secrets.Hide(out), false).c_str());
@@ -304,7 +442,12 @@ void RunBatch(const std::string &path, bool json) {
         PrintSummary(calls);
     }
     fflush(stdout);
-    if (failed > 0) {
+    if (gInterrupted) {
+        FailText("batch: interrupted: " + std::to_string(finished) + " of " +
+                 std::to_string(calls.size()) + " calls finished, " + std::to_string(cancelled) +
+                 " cancelled");
+        gExitCode = kExitInterrupted;
+    } else if (failed > 0) {
         FailText("batch: " + std::to_string(failed) + " of " + std::to_string(calls.size()) +
                  " calls failed");
     }
@@ -315,14 +458,16 @@ const Registrar registrar([](CLI::App &app) {
         "batch", "run a JSON array of calls together and summarise their outcomes");
     auto path = std::make_shared<std::string>();
     auto json = std::make_shared<bool>(false);
+    auto transport = std::make_shared<Transport>();
     cmd->add_option("FILE", *path,
                     "JSON array of {\"cred\", \"api\", \"version\", \"method\", \"params\"} "
                     "or {\"url\"} calls; - reads standard input")
         ->required();
     AddJsonFlag(cmd, json.get());
-    cmd->callback([path, json] {
+    AddTransportOptions(cmd, transport.get());
+    cmd->callback([path, json, transport] {
         try {
-            RunBatch(*path, *json);
+            RunBatch(*path, *json, *transport);
         } catch (const std::exception &e) {
             FailText(std::string("batch: ") + e.what());
         }

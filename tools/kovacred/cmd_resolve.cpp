@@ -19,6 +19,7 @@ struct ResolveOptions {
     std::string serverId;
     bool portal = false;
     bool json = false;
+    Transport transport;  // only --max-time applies to the directory's requests
 };
 
 // Which of the server information's addresses the candidate is, by host and port: the LAN
@@ -67,8 +68,14 @@ bool Resolve(const ResolveOptions &options, Json::Value &candidate, std::string 
                                    ? std::vector<const char *>{"zon_portal_https", "zon_portal"}
                                    : std::vector<const char *>{"zon_https", "zon"}) {
         client.SetServiceId(service);
+        // Each operation of the client has its deadline afresh: it is given what is left.
+        auto bounded = [&] {
+            client.SetTotalTimeout(options.transport.MaxTimeMs());
+            return true;
+        };
         Json::Value info;
-        if (client.GetAvailableServerInfo(info) && client.GetAvailableConnInfo(info, candidate)) {
+        if (bounded() && client.GetAvailableServerInfo(info) && bounded() &&
+            client.GetAvailableConnInfo(info, candidate)) {
             kind = CandidateKind(info, candidate);
             return true;
         }
@@ -108,6 +115,9 @@ Registrar registerResolve([](CLI::App &app) {
     resolve->add_flag("--portal", options->portal,
                       "look up the portal service instead of the WebAPI service");
     AddJsonFlag(resolve, &options->json);
+    resolve
+        ->add_option("--max-time", options->transport.maxTime, "seconds the whole look-up may take")
+        ->check(CLI::PositiveNumber);
     resolve->callback([options] { RunResolve(*options); });
 });
 

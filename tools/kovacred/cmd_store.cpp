@@ -1,6 +1,6 @@
-// kovacred commands over the credential store: add, list, show, remove and session show, set,
-// remove. Passwords are read from standard input (never from the command line) and are never
-// printed.
+// kovacred commands over the credential store: add, passwd, list, show, remove and session
+// show, set, remove. Passwords, session ids and tokens are read from standard input (never from
+// the command line); passwords are never printed.
 #include <stdio.h>
 #include <termios.h>
 #include <time.h>
@@ -34,17 +34,6 @@ void ResetError() {
     VLIBCErrSetEx(0, "", 0);
 }
 
-// Reports a failed library call with the code it left in the error slot. Statement failures
-// leave no code; their cause is only in the system log.
-void FailStore(const std::string &what) {
-    const int code = VLIBCErrGet();
-    if (code == 0) {
-        FailText(what + " failed: the database could not be used (details in the system log)");
-    } else {
-        Fail(what, code);
-    }
-}
-
 std::string TimeText(int32_t seconds) {
     if (seconds <= 0) {
         return "-";
@@ -57,12 +46,13 @@ std::string TimeText(int32_t seconds) {
     return buf;
 }
 
-// One line from standard input; on a terminal, after a prompt and without echo.
-bool ReadPassword(std::string *password) {
+// One line from standard input; on a terminal, after `prompt` and without echo. The line's
+// end (and a carriage return) is not part of it. False at the end of the input.
+bool ReadSecret(const char *prompt, std::string *secret) {
     const bool terminal = isatty(STDIN_FILENO) != 0;
     struct termios saved;
     if (terminal) {
-        fprintf(stderr, "Password: ");
+        fprintf(stderr, "%s: ", prompt);
         fflush(stderr);
         if (tcgetattr(STDIN_FILENO, &saved) == 0) {
             struct termios quiet = saved;
@@ -70,13 +60,13 @@ bool ReadPassword(std::string *password) {
             tcsetattr(STDIN_FILENO, TCSANOW, &quiet);
         }
     }
-    const bool got = static_cast<bool>(std::getline(std::cin, *password));
+    const bool got = static_cast<bool>(std::getline(std::cin, *secret));
     if (terminal) {
         tcsetattr(STDIN_FILENO, TCSANOW, &saved);
         fprintf(stderr, "\n");
     }
-    if (!password->empty() && password->back() == '\r') {
-        password->pop_back();
+    if (!secret->empty() && secret->back() == '\r') {
+        secret->pop_back();
     }
     return got;
 }
@@ -126,11 +116,39 @@ struct AddOptions {
     std::string application;
     std::string extra;
     int owner = -1;
+    bool json = false;
 };
 
+// The stored credential for the same server, account and application, 0 when there is none.
+int FindSameCredential(const AddOptions &opts) {
+    KOVA_CRED *list = nullptr;
+    if (KOVACredListGet(&list, nullptr, nullptr) < 0) {
+        return -1;
+    }
+    int id = 0;
+    for (KOVA_CRED *p = list; p != nullptr && id == 0; p = KOVACredNext(p)) {
+        if (p->host == opts.host && p->port == opts.port && p->protocol == opts.protocol &&
+            p->remote_account == opts.account && p->application == opts.application) {
+            id = p->id;
+        }
+    }
+    KOVACredListFree(&list);
+    return id;
+}
+
+// Stores a credential, or replaces the one stored for the same server, account and
+// application (a second row would never be chosen by a look-up by application).
 void RunAdd(const AddOptions &opts) {
+    if (opts.host.empty() || opts.account.empty()) {
+        FailUsage(std::string("add: --") + (opts.host.empty() ? "host" : "account") +
+                  " must not be empty");
+        return;
+    }
+    if (!CheckDatabase(DatabaseUse::kCreate)) {
+        return;
+    }
     std::string password;
-    if (!ReadPassword(&password)) {
+    if (!ReadSecret("Password", &password)) {
         FailText("add: no password on standard input (give it as one line)");
         return;
     }
@@ -148,11 +166,54 @@ void RunAdd(const AddOptions &opts) {
     cred->extra_info = opts.extra;
     cred->owner = opts.owner;
     ResetError();
-    if (KOVACredAdd(cred.get()) != 0) {
+    // A database that does not exist yet holds nothing to replace.
+    const int same = access(DatabasePath().c_str(), F_OK) == 0 ? FindSameCredential(opts) : 0;
+    if (same < 0) {
         FailStore("add credential");
         return;
     }
-    printf("added credential %d\n", cred->id);
+    const bool updated = same > 0;
+    if (updated) {
+        cred->id = same;
+        if (KOVACredSetByID(same, cred.get()) != 0) {
+            FailStore("update credential " + std::to_string(same));
+            return;
+        }
+    } else if (KOVACredAdd(cred.get()) != 0) {
+        FailStore("add credential");
+        return;
+    }
+    if (opts.json) {
+        Json::Value out(Json::objectValue);
+        out["id"] = cred->id;
+        out["updated"] = updated;
+        PrintJson(out);
+    } else {
+        printf("%s credential %d\n", updated ? "updated" : "added", cred->id);
+    }
+}
+
+// Replaces the stored password of credential `id` with one read as add reads it.
+void RunPasswd(int id) {
+    if (!CheckDatabase(DatabaseUse::kExisting)) {
+        return;
+    }
+    Cred cred = LoadCredential("passwd", id);
+    if (!cred) {
+        return;
+    }
+    std::string password;
+    if (!ReadSecret("New password", &password)) {
+        FailText("passwd: no password on standard input (give it as one line)");
+        return;
+    }
+    cred->remote_passwd = password;
+    ResetError();
+    if (KOVACredSetByID(id, cred.get()) != 0) {
+        FailStore("passwd: storing the password of credential " + std::to_string(id));
+        return;
+    }
+    printf("changed the password of credential %d\n", id);
 }
 
 Json::Value CredentialJson(const KOVA_CRED &cred) {
@@ -171,6 +232,9 @@ Json::Value CredentialJson(const KOVA_CRED &cred) {
 }
 
 void RunList(bool json) {
+    if (!CheckDatabase(DatabaseUse::kExisting)) {
+        return;
+    }
     KOVA_CRED *list = nullptr;
     ResetError();
     const int count = KOVACredListGet(&list, nullptr, nullptr);
@@ -206,6 +270,9 @@ void RunList(bool json) {
 }
 
 void RunShow(int id, bool json) {
+    if (!CheckDatabase(DatabaseUse::kExisting)) {
+        return;
+    }
     Cred cred = LoadCredential("show", id);
     if (!cred) {
         return;
@@ -235,6 +302,9 @@ void RunShow(int id, bool json) {
 }
 
 void RunRemove(int id) {
+    if (!CheckDatabase(DatabaseUse::kExisting)) {
+        return;
+    }
     if (!LoadCredential("remove", id)) {
         return;
     }
@@ -248,6 +318,9 @@ void RunRemove(int id) {
 
 // The one place that prints a session id and token: the user asked for them by name.
 void RunSessionShow(int id, bool json) {
+    if (!CheckDatabase(DatabaseUse::kExisting)) {
+        return;
+    }
     Sess sess = LoadSession("session show", id);
     if (!sess) {
         return;
@@ -271,12 +344,15 @@ void RunSessionShow(int id, bool json) {
 
 struct SessionSetOptions {
     int id = 0;
-    std::string sid;
-    std::string token;
     std::string extra;
 };
 
+// The session id and token are secrets: they are read as add reads a password, never taken
+// from the command line (where ps and the shell's history would show them).
 void RunSessionSet(const SessionSetOptions &opts) {
+    if (!CheckDatabase(DatabaseUse::kExisting)) {
+        return;
+    }
     if (!LoadCredential("session set", opts.id)) {
         return;
     }
@@ -285,9 +361,14 @@ void RunSessionSet(const SessionSetOptions &opts) {
         FailStore("session set");
         return;
     }
+    if (!ReadSecret("Session id", &sess->access_token) || sess->access_token.empty()) {
+        FailText("session set: no session id on standard input (give it as the first line)");
+        return;
+    }
+    if (!ReadSecret("Token", &sess->csrf_token)) {
+        sess->csrf_token.clear();  // a session without a token
+    }
     sess->id = opts.id;
-    sess->access_token = opts.sid;
-    sess->csrf_token = opts.token;
     sess->extra_info = opts.extra;
     ResetError();
     if (KOVACredSessSetByID(opts.id, sess.get()) != 0) {
@@ -298,6 +379,9 @@ void RunSessionSet(const SessionSetOptions &opts) {
 }
 
 void RunSessionRemove(int id) {
+    if (!CheckDatabase(DatabaseUse::kExisting)) {
+        return;
+    }
     if (!LoadSession("session remove", id)) {
         return;
     }
@@ -314,24 +398,30 @@ struct IdOptions {
     bool json = false;
 };
 
-CLI::Option *AddIdArgument(CLI::App *cmd, int *id) {
-    return cmd->add_option("id", *id, "credential id")->required()->check(CLI::PositiveNumber);
-}
-
 void RegisterStore(CLI::App &app) {
     auto addOpts = std::make_shared<AddOptions>();
     CLI::App *add = app.add_subcommand(
-        "add", "store a credential; the password is read from standard input (one line)");
+        "add",
+        "store a credential, or update the one for the same server, account and application; "
+        "the password is read from standard input (one line)");
     add->add_option("--host", addOpts->host, "remote host")->required();
-    add->add_option("--port", addOpts->port, "remote port")
+    add->add_option("--port", addOpts->port, "remote port (1 to 65535)")
         ->required()
         ->check(CLI::Range(1, 65535));
-    add->add_option("--protocol", addOpts->protocol, "protocol (default https)");
+    add->add_option("--protocol", addOpts->protocol, "http or https (default https)")
+        ->check(CLI::IsMember({"http", "https"}));
     add->add_option("--account", addOpts->account, "remote account")->required();
     add->add_option("--application", addOpts->application, "application tag");
     add->add_option("--extra", addOpts->extra, "free-form extra information");
     add->add_option("--owner", addOpts->owner, "owning user id (default -1: none)");
+    AddJsonFlag(add, &addOpts->json);
     add->callback([addOpts] { RunAdd(*addOpts); });
+
+    auto passwdId = std::make_shared<int>(0);
+    CLI::App *passwd = app.add_subcommand(
+        "passwd", "change a credential's stored password (read from standard input)");
+    AddIdArgument(passwd, passwdId.get());
+    passwd->callback([passwdId] { RunPasswd(*passwdId); });
 
     auto json = std::make_shared<bool>(false);
     CLI::App *list = app.add_subcommand("list", "list the stored credentials (no passwords)");
@@ -360,10 +450,11 @@ void RegisterStore(CLI::App &app) {
     sessShow->callback([sessShowOpts] { RunSessionShow(sessShowOpts->id, sessShowOpts->json); });
 
     auto setOpts = std::make_shared<SessionSetOptions>();
-    CLI::App *sessSet = session->add_subcommand("set", "store (replace) a credential's session");
+    CLI::App *sessSet = session->add_subcommand(
+        "set",
+        "store (replace) a credential's session; the session id and the token are read from "
+        "standard input (one line each)");
     AddIdArgument(sessSet, &setOpts->id);
-    sessSet->add_option("--sid", setOpts->sid, "session id")->required();
-    sessSet->add_option("--token", setOpts->token, "CSRF token");
     sessSet->add_option("--extra", setOpts->extra, "free-form extra information");
     sessSet->callback([setOpts] { RunSessionSet(*setOpts); });
 

@@ -1,6 +1,9 @@
 // kovacred commands over the WebAPI layer: login, logout, call and apis, each for a stored
 // credential.
+#include <errno.h>
 #include <stdio.h>
+#include <string.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <map>
@@ -39,10 +42,36 @@ int ErrorCodeOf(const Json::Value &answer) {
     return 0;
 }
 
-// Loads credential `id`; prints the failure line when there is none.
+// Loads credential `id`; prints the failure line when there is no database or no such
+// credential.
 bool LoadCred(const std::string &what, int id, KOVA_CRED &cred) {
-    if (KOVACredGetByID(id, &cred) < 0 || cred.filled == 0) {
+    if (!CheckDatabase(DatabaseUse::kExisting)) {
+        return false;
+    }
+    VLIBCErrSetEx(0, "", 0);
+    if (KOVACredGetByID(id, &cred) < 0) {
+        FailStore(what + ": reading credential " + std::to_string(id));
+        return false;
+    }
+    if (cred.filled == 0) {
         FailText(what + " failed: no credential with id " + std::to_string(id));
+        return false;
+    }
+    return true;
+}
+
+// The credential's API description for a command (see the other FetchDescription), after
+// readying the transport for its server; false after the failure line.
+bool FetchDescription(const std::string &what, const KOVA_CRED &cred, Transport &transport,
+                      Json::Value &desc) {
+    std::string failure;
+    long code = 0;
+    if (!PrepareTransport(what, transport, cred.protocol, cred.host, cred.port)) {
+        return false;
+    }
+    if (!FetchDescription(cred, transport, desc, failure, code)) {
+        fprintf(stderr, "kovacred: %s failed %s\n", what.c_str(), failure.c_str());
+        gExitCode = code >= 1 && code <= 255 ? static_cast<int>(code) : 1;
         return false;
     }
     return true;
@@ -51,26 +80,97 @@ bool LoadCred(const std::string &what, int id, KOVA_CRED &cred) {
 struct LoginOptions {
     int id = 0;
     std::string otp;
+    Transport transport;
 };
 
-void RunLogin(const LoginOptions &opts) {
+}  // namespace
+
+bool LogIn(KOVA_CRED &cred, const std::string &otp, std::string &failure, long &code) {
+    KOVA_CRED_SESS sess;
+    Json::Value answer;
+    CredRequestUtil::m_errCode = 0;
+    if (CredRequestUtil::LoginWithOTP(&cred, otp, &sess, &answer)) {
+        return true;
+    }
+    code = ErrorCodeOf(answer);
+    if (code != 0) {
+        const std::string text = LoginCodeText(static_cast<int>(code));
+        failure = "server error " + std::to_string(code) + (text.empty() ? "" : ": " + text);
+        return false;
+    }
+    code = answer.isObject()                 ? KOVA::CRED_REQ_ERR_INVALID_RESPONSE
+           : CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
+                                             : KOVA::CRED_REQ_ERR_LOGIN_SESSION;
+    failure = ErrorText(code);
+    return false;
+}
+
+bool FetchDescription(const KOVA_CRED &cred, const Transport &transport, Json::Value &desc,
+                      std::string &failure, long &code) {
+    CredRequest request;
+    if (!request.SetURL(cred.protocol, cred.host, cred.port, "webapi/query.cgi")) {
+        code = request.GetError();
+        failure = TransferFailure(request);
+        return false;
+    }
+    Json::Value params(Json::objectValue);
+    params["api"] = "KOVA.API.Info";
+    params["version"] = 1;
+    params["method"] = "query";
+    request.AddPostParam(params);
+    request.SetResponseTimeout(30);
+    request.SetEncoding(true);
+    ApplyTransport(transport, request);
+    if (!request.Process(true, 0)) {
+        code = request.GetError();
+        failure = TransferFailure(request, &transport);
+        return false;
+    }
+    Json::Value answer;
+    if (!ParseJson(request.GetResponse(), answer) || !answer.isObject() ||
+        !answer["success"].isBool() || !answer["success"].asBool() || !answer["data"].isObject()) {
+        code = KOVA::CRED_REQ_ERR_QUERY_FAIL;
+        failure = "(" + ErrorText(code) + "): the server's API description is not usable";
+        return false;
+    }
+    desc = answer["data"];
+    CredRequestUtil::m_jsData["webapiDesc"][std::to_string(cred.id)] = desc;
+    return true;
+}
+
+namespace {
+
+// The session of credential `id` the library's factory will use: the stored one, or one a
+// login gets now (a failed login is reported as "login" reports it). False after the line.
+bool HaveSession(const std::string &what, KOVA_CRED &cred) {
+    KOVA_CRED_SESS sess;
+    if (KOVACredSessGetByID(cred.id, &sess) == 0 && sess.filled != 0) {
+        return true;
+    }
+    std::string failure;
+    long code = 0;
+    if (LogIn(cred, "", failure, code)) {
+        return true;
+    }
+    fprintf(stderr, "kovacred: %s failed: login failed (%s)\n", what.c_str(), failure.c_str());
+    gExitCode = code >= 1 && code <= 255 ? static_cast<int>(code) : 1;
+    return false;
+}
+
+void RunLogin(LoginOptions &opts) {
     KOVA_CRED cred;
     if (!LoadCred("login", opts.id, cred)) {
         return;
     }
-    KOVA_CRED_SESS sess;
-    Json::Value answer;
-    CredRequestUtil::m_errCode = 0;
-    if (!CredRequestUtil::LoginWithOTP(&cred, opts.otp, &sess, &answer)) {
-        const int code = ErrorCodeOf(answer);
-        if (code != 0) {
-            FailServer("login", code, LoginCodeText(code));
-        } else if (answer.isObject()) {
-            Fail("login", KOVA::CRED_REQ_ERR_INVALID_RESPONSE);
-        } else {
-            Fail("login", CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
-                                                          : KOVA::CRED_REQ_ERR_QUERY_FAIL);
-        }
+    Json::Value desc;
+    if (!FetchDescription("login", cred, opts.transport, desc)) {
+        return;
+    }
+    std::string failure;
+    long code = 0;
+    if (!LogIn(cred, opts.otp, failure, code)) {
+        fprintf(stderr, "kovacred: login failed (%s)\n", failure.c_str());
+        gExitCode = code >= 1 && code <= 255 ? static_cast<int>(code) : 1;
         return;
     }
     printf("logged in to %s://%s:%d as %s; session stored for credential %d\n",
@@ -78,14 +178,24 @@ void RunLogin(const LoginOptions &opts) {
            opts.id);
 }
 
-void RunLogout(int id) {
+struct LogoutOptions {
+    int id = 0;
+    Transport transport;
+};
+
+void RunLogout(LogoutOptions &opts) {
+    const int id = opts.id;
     KOVA_CRED cred;
+    Json::Value desc;
     if (!LoadCred("logout", id, cred)) {
         return;
     }
     KOVA_CRED_SESS sess;
     if (KOVACredSessGetByID(id, &sess) < 0 || sess.filled == 0) {
         FailText("logout failed: no stored session for credential " + std::to_string(id));
+        return;
+    }
+    if (!FetchDescription("logout", cred, opts.transport, desc)) {
         return;
     }
     if (!CredRequestUtil::Logout(&cred, &sess)) {
@@ -105,9 +215,11 @@ struct CallOptions {
     std::string params;
     std::vector<std::string> files;
     bool json = false;
+    bool timing = false;
+    Transport transport;
 };
 
-void RunCall(const CallOptions &opts) {
+void RunCall(CallOptions &opts) {
     Json::Value params(Json::objectValue);
     if (!opts.params.empty()) {
         if (!ParseJson(opts.params, params) || !params.isObject()) {
@@ -127,14 +239,32 @@ void RunCall(const CallOptions &opts) {
     if (!LoadCred("call", opts.id, cred)) {
         return;
     }
-    CredRequestUtil::m_errCode = 0;
-    std::unique_ptr<CredRequest> request(
-        CredRequest::CreateWebAPIRequest(opts.id, opts.api, opts.version, opts.method, params));
-    if (!request) {
-        Fail("call " + opts.api, CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
-                                                                 : KOVA::CRED_REQ_ERR_UNKNOWN);
+    for (const auto &file : opts.files) {
+        const size_t eq = file.find('=');
+        if (eq != std::string::npos && access(file.c_str() + eq + 1, R_OK) != 0) {
+            FailText("call failed: cannot read " + file.substr(eq + 1) + ": " + strerror(errno));
+            return;
+        }
+    }
+    const std::string what = "call " + opts.api;
+    Json::Value desc;
+    if (!FetchDescription(what, cred, opts.transport, desc) || !HaveSession(what, cred)) {
         return;
     }
+    KOVA_CRED_SESS sess;
+    if (KOVACredSessGetByID(opts.id, &sess) < 0 || sess.filled == 0) {
+        FailText(what + " failed: no session for credential " + std::to_string(opts.id));
+        return;
+    }
+    CredRequestUtil::m_errCode = 0;
+    std::unique_ptr<CredRequest> request(new CredRequest());
+    if (!CredRequest::CreateWebAPIRequest(request.get(), &cred, &sess, opts.api, opts.version,
+                                          opts.method, params)) {
+        Fail(what, CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
+                                                   : static_cast<long>(request->GetError()));
+        return;
+    }
+    ApplyTransport(opts.transport, *request);
     for (const auto &file : opts.files) {
         size_t eq = file.find('=');
         if (eq == std::string::npos || eq == 0 ||
@@ -143,8 +273,12 @@ void RunCall(const CallOptions &opts) {
             return;
         }
     }
-    if (!request->Process(true, 0)) {
-        Fail("call " + opts.api, request->GetError());
+    const bool done = request->Process(true, 0);
+    if (opts.timing) {
+        PrintTiming(*request);
+    }
+    if (!done) {
+        FailTransfer(what, *request, &opts.transport);
         return;
     }
     Json::Value answer;
@@ -167,18 +301,22 @@ void RunCall(const CallOptions &opts) {
     }
 }
 
-void RunApis(int id, bool json) {
+struct ApisOptions {
+    int id = 0;
+    bool json = false;
+    Transport transport;
+};
+
+void RunApis(ApisOptions &opts) {
     KOVA_CRED cred;
-    if (!LoadCred("apis", id, cred)) {
+    if (!LoadCred("apis", opts.id, cred)) {
         return;
     }
-    CredRequestUtil::m_errCode = 0;
-    if (!CredRequestUtil::GetWebAPIDesc(&cred)) {
-        Fail("apis", CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
-                                                     : KOVA::CRED_REQ_ERR_QUERY_FAIL);
+    Json::Value desc;
+    if (!FetchDescription("apis", cred, opts.transport, desc)) {
         return;
     }
-    const Json::Value &desc = CredRequestUtil::m_jsData["webapiDesc"][std::to_string(id)];
+    const bool json = opts.json;
     if (!desc.isObject()) {
         FailText("apis failed: the server's description is not an object");
         return;
@@ -205,28 +343,26 @@ void RunApis(int id, bool json) {
     }
 }
 
-CLI::Option *AddId(CLI::App *cmd, int *id) {
-    return cmd->add_option("id", *id, "credential id")->required()->check(CLI::PositiveNumber);
-}
-
 void RegisterWebApi(CLI::App &app) {
     auto login = std::make_shared<LoginOptions>();
     CLI::App *loginCmd = app.add_subcommand(
         "login", "log in with a stored credential and store the session it gets");
-    AddId(loginCmd, &login->id);
+    AddIdArgument(loginCmd, &login->id);
     loginCmd->add_option("--otp", login->otp, "one-time code");
+    AddTransportOptions(loginCmd, &login->transport);
     loginCmd->callback([login] { RunLogin(*login); });
 
-    auto logoutId = std::make_shared<int>(0);
+    auto logout = std::make_shared<LogoutOptions>();
     CLI::App *logoutCmd =
         app.add_subcommand("logout", "log the stored session out and remove it from the store");
-    AddId(logoutCmd, logoutId.get());
-    logoutCmd->callback([logoutId] { RunLogout(*logoutId); });
+    AddIdArgument(logoutCmd, &logout->id);
+    AddTransportOptions(logoutCmd, &logout->transport);
+    logoutCmd->callback([logout] { RunLogout(*logout); });
 
     auto call = std::make_shared<CallOptions>();
     CLI::App *callCmd = app.add_subcommand(
         "call", "call a WebAPI method with a stored credential and print the JSON answer");
-    AddId(callCmd, &call->id);
+    AddIdArgument(callCmd, &call->id);
     callCmd->add_option("api", call->api, "API name, e.g. KOVA.API.Info")->required();
     callCmd->add_option("version", call->version, "API version")
         ->required()
@@ -234,15 +370,19 @@ void RegisterWebApi(CLI::App &app) {
     callCmd->add_option("method", call->method, "method name")->required();
     callCmd->add_option("params", call->pairs, "parameters as name=value");
     callCmd->add_option("--params", call->params, "parameters as a JSON object");
-    callCmd->add_option("--file", call->files, "upload a file as FIELD=PATH");
+    callCmd->add_option("--file", call->files, "upload a file as FIELD=PATH")
+        ->allow_extra_args(false);
     AddJsonFlag(callCmd, &call->json);
+    callCmd->add_flag("--timing", call->timing, "show the call's timing on standard error");
+    AddTransportOptions(callCmd, &call->transport);
     callCmd->callback([call] { RunCall(*call); });
 
-    auto apis = std::make_shared<std::pair<int, bool>>(0, false);
+    auto apis = std::make_shared<ApisOptions>();
     CLI::App *apisCmd = app.add_subcommand("apis", "list the APIs the credential's server offers");
-    AddId(apisCmd, &apis->first);
-    AddJsonFlag(apisCmd, &apis->second);
-    apisCmd->callback([apis] { RunApis(apis->first, apis->second); });
+    AddIdArgument(apisCmd, &apis->id);
+    AddJsonFlag(apisCmd, &apis->json);
+    AddTransportOptions(apisCmd, &apis->transport);
+    apisCmd->callback([apis] { RunApis(*apis); });
 }
 
 const Registrar kWebApiCommands(RegisterWebApi);

@@ -2,9 +2,12 @@
 
 # Options that take a value, so that their value is not counted as an argument.
 _kovacred_value_opts='--db --host --port --protocol --account --application --extra --owner
-    --sid --token --otp --params --file -q --query -d --data -H --header -b --cookie -F --upload
+    --otp --params --file -q --query -d --data -H --header -b --cookie -F --upload
     --body-file -T --upload-file -o --output --format -r --retries --connect-timeout
-    --response-timeout'
+    --response-timeout --cacert --max-time'
+
+# The options of every command that makes requests.
+_kovacred_transfer_opts='--verify --cacert --pin --max-time'
 
 # The ids `kovacred list` prints for the database the command line (or kovacredential_db)
 # names. A database that does not exist yet is not created for this.
@@ -42,7 +45,7 @@ _kovacred() {
     done
 
     case $prev in
-        --db | --body-file | -T | --upload-file | -o | --output)
+        --db | --body-file | -T | --upload-file | -o | --output | --cacert)
             _filedir
             return
             ;;
@@ -61,26 +64,29 @@ _kovacred() {
             fi
             return
             ;;
-        --host | --port | --account | --application | --extra | --owner | --sid | --token | \
+        --host | --port | --account | --application | --extra | --owner | \
             --otp | --params | -q | --query | -d | --data | -H | --header | -b | --cookie | \
-            --format | -r | --retries | --connect-timeout | --response-timeout)
+            --format | -r | --retries | --connect-timeout | --response-timeout | --max-time)
             return
             ;;
     esac
 
     local opts=""
     case $command/$sub in
-        /) opts='--db --version --help' ;;
-        add/) opts='--host --port --protocol --account --application --extra --owner' ;;
-        list/ | show/ | probe/ | apis/ | batch/ | session/show) opts='--json' ;;
-        session/set) opts='--sid --token --extra' ;;
-        login/) opts='--otp' ;;
-        call/) opts='--params --file --json' ;;
-        resolve/) opts='--portal --json' ;;
+        /) opts='--db --verbose --version --help' ;;
+        add/) opts='--host --port --protocol --account --application --extra --owner --json' ;;
+        list/ | show/ | session/show) opts='--json' ;;
+        probe/ | batch/) opts="--json $_kovacred_transfer_opts" ;;
+        logout/) opts="$_kovacred_transfer_opts" ;;
+        session/set) opts='--extra' ;;
+        login/) opts="--otp $_kovacred_transfer_opts" ;;
+        apis/) opts="--json $_kovacred_transfer_opts" ;;
+        call/) opts="--params --file --json --timing $_kovacred_transfer_opts" ;;
+        resolve/) opts='--portal --json --max-time' ;;
         request/)
             opts='--query --data --header --cookie --upload --body-file --upload-file --output
-                --format --retries --connect-timeout --response-timeout --headers --verify
-                --no-follow --json'
+                --format --retries --connect-timeout --response-timeout --headers --no-follow
+                --fail --timing --json '"$_kovacred_transfer_opts"
             ;;
     esac
     if [[ $cur == -* ]]; then
@@ -90,13 +96,13 @@ _kovacred() {
 
     case $command/$sub in
         /)
-            COMPREPLY=($(compgen -W 'add list show remove session request probe login logout
-                call apis batch resolve' -- "$cur"))
+            COMPREPLY=($(compgen -W 'add passwd list show remove session request probe login
+                logout call apis batch resolve' -- "$cur"))
             ;;
         session/)
             COMPREPLY=($(compgen -W 'show set remove' -- "$cur"))
             ;;
-        show/ | remove/ | login/ | logout/ | call/ | apis/ | session/?*)
+        show/ | passwd/ | remove/ | login/ | logout/ | call/ | apis/ | session/?*)
             ((args == 0)) && COMPREPLY=($(compgen -W "$(_kovacred_ids)" -- "$cur"))
             ;;
         batch/)

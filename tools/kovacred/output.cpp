@@ -1,6 +1,10 @@
 // kovacred's shared helpers: failure lines naming error codes, JSON and table output, and the
 // masking of secrets.
+#include <errno.h>
+#include <stdint.h>
 #include <stdio.h>
+#include <stdlib.h>
+#include <strings.h>
 
 #include <algorithm>
 #include <memory>
@@ -75,6 +79,59 @@ int FailText(const std::string &message) {
     fprintf(stderr, "kovacred: %s\n", message.c_str());
     gExitCode = 1;
     return gExitCode;
+}
+
+int FailUsage(const std::string &message) {
+    fprintf(stderr, "kovacred: %s\n", message.c_str());
+    gExitCode = kExitUsage;
+    return gExitCode;
+}
+
+CLI::Option *AddIdArgument(CLI::App *cmd, int *id) {
+    return cmd->add_option("id", *id, "credential id")
+        ->required()
+        ->check(CLI::Validator(
+            [](std::string &text) -> std::string {
+                char *end = nullptr;
+                errno = 0;
+                const long value = strtol(text.c_str(), &end, 10);
+                if (text.empty() || *end != '\0' || errno != 0 || value < 1 || value > INT32_MAX) {
+                    return "a credential id is a whole number from 1 to 2147483647, not \"" + text +
+                           "\"";
+                }
+                return "";
+            },
+            "ID"));
+}
+
+bool CheckURL(const std::string &command, const std::string &url) {
+    const size_t sep = url.find("://");
+    const std::string scheme = sep == std::string::npos ? "http" : url.substr(0, sep);
+    if (strcasecmp(scheme.c_str(), "http") != 0 && strcasecmp(scheme.c_str(), "https") != 0) {
+        FailText(command + " failed: unsupported scheme \"" + scheme + "\" (http or https)");
+        return false;
+    }
+    // The authority ends at the path, query or fragment; its port follows the last ':' behind
+    // the userinfo and any IPv6 literal.
+    const size_t start = sep == std::string::npos ? 0 : sep + 3;
+    std::string authority = url.substr(start, url.find_first_of("/?#", start) - start);
+    authority.erase(0, authority.rfind('@') + 1);
+    const size_t bracket = authority.rfind(']');
+    const size_t colon = authority.rfind(':');
+    if (authority.empty() || authority[0] == ':') {
+        FailText(command + " failed: no host in \"" + url + "\"");
+        return false;
+    }
+    if (colon != std::string::npos && (bracket == std::string::npos || colon > bracket)) {
+        const std::string port = authority.substr(colon + 1);
+        char *end = nullptr;
+        const long value = strtol(port.c_str(), &end, 10);
+        if (!port.empty() && (*end != '\0' || value < 1 || value > 65535)) {
+            FailText(command + " failed: bad port \"" + port + "\" (1 to 65535)");
+            return false;
+        }
+    }
+    return true;
 }
 
 void AddJsonFlag(CLI::App *cmd, bool *json) {
