@@ -15,7 +15,8 @@ constexpr int kLineIgnored = 21;
 
 // Whether the ignored variable of the same index has been logged in this process; the last
 // entry stands for any other name.
-constexpr const char *kNames[] = {kEnvDatabase, kEnvDebug, kEnvFarlinkServer, kEnvFarlinkGlobal};
+constexpr const char *kNames[] = {kEnvDatabase, kEnvDebug, kEnvFarlinkServer, kEnvFarlinkGlobal,
+                                  kEnvNoReuse};
 constexpr size_t kNameCount = sizeof(kNames) / sizeof(kNames[0]);
 std::atomic<bool> gLogged[kNameCount + 1];
 

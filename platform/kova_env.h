@@ -9,6 +9,7 @@ constexpr const char kEnvDatabase[] = "kovacredential_db";
 constexpr const char kEnvDebug[] = "kovacredential_debug";
 constexpr const char kEnvFarlinkServer[] = "kovacredential_farlink_server";
 constexpr const char kEnvFarlinkGlobal[] = "kovacredential_farlink_global";
+constexpr const char kEnvNoReuse[] = "kovacredential_no_reuse";
 
 // The value of the environment variable `name`, read with secure_getenv: null when it is not
 // set, and also when the process runs in secure-execution mode (AT_SECURE: it was started

@@ -6,6 +6,7 @@
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
 #include "request/cred_request_p.h"
+#include "request/cred_request_pool.h"
 
 namespace KOVA {
 
@@ -36,7 +37,7 @@ CredRequestPrivate::~CredRequestPrivate() {
         headers = nullptr;
     }
     if (curl != nullptr) {
-        curl_easy_cleanup(curl);
+        CredRequestPool::Release(curl, poolKey, poolGeneration);
         curl = nullptr;
     }
     if (form != nullptr) {
@@ -428,6 +429,10 @@ void CredRequest::SetError(KOVA::_tag_CRED_REQ_ERR error) {
     if (d != nullptr) {
         d->error = error;
     }
+}
+
+void CredRequest::CloseIdleConnections() {
+    CredRequestPool::CloseIdle();
 }
 
 CURL *CredRequest::GetCurlHandler() {

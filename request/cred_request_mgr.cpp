@@ -12,12 +12,18 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <deque>
+#include <map>
 #include <memory>
 #include <new>
+#include <string>
 #include <vector>
+
+#include <openssl/ssl.h>
 
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
+#include "request/cred_request_pool.h"
 #include "request/cred_request_util_p.h"
 
 namespace KOVA {
@@ -293,16 +299,129 @@ class RunRegistration {
     int pipe_[2] = {-1, -1};
 };
 
+// Transfers to one HTTPS server. A server that speaks HTTP/2 carries many transfers over one
+// connection, but libcurl learns that only once a connection's TLS handshake is done: until
+// then each transfer added opens a connection of its own, and even with CURLOPT_PIPEWAIT the
+// transfers beyond one connection's streams open one each. So the first transfer goes alone
+// (the probe); once it has sent its request (or ended) the protocol is known: over HTTP/2 at
+// most kStreamsPerServer transfers run at once, so that all fit into the probe's connection;
+// over HTTP/1.1 all the rest start at once, as many connections as transfers.
+struct ServerAdmission {
+    enum State { kProbing, kMultiplexed, kParallel };
+    State state = kProbing;
+    CURL *probe = nullptr;
+    std::deque<CredRequest *> waiting;  // set up, not yet added to the multi handle
+    int running = 0;                    // added and unfinished
+};
+
+// libcurl's default of concurrent streams on one HTTP/2 connection.
+constexpr int kStreamsPerServer = 100;
+
 // What Run adds to the transfer loop: the transfers it started, its deadline and its
 // registration for Cancel.
 struct RunControl {
     std::vector<CredRequest *> active;  // requests whose transfers are unfinished
+    std::vector<CURL *> added;          // handles added to the multi handle
+    std::map<std::string, ServerAdmission> servers;
+    std::map<CURL *, ServerAdmission *> serverOf;
     bool hasDeadline = false;
     Clock::time_point deadline;
     const RunRegistration *registration = nullptr;
 };
 
 bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunControl *control);
+
+// Adds a set-up request's transfer to the multi handle; a handle libcurl will not take leaves
+// its request out, like one whose set-up failed.
+bool AddTransfer(CURLM *multi, CredRequest *request, RunControl &control) {
+    CURL *easy = request->GetCurlHandler();
+    const CURLMcode code = curl_multi_add_handle(multi, easy);
+    if (code != CURLM_OK) {
+        request->SetError(CRED_REQ_ERR_CURL_INTERNAL);
+        LogMultiError(kLineAddHandleFail, code);
+        auto &active = control.active;
+        active.erase(std::remove(active.begin(), active.end(), request), active.end());
+        return false;
+    }
+    control.added.push_back(easy);
+    return true;
+}
+
+// Whether the connection of `easy` carries HTTP/2: from its answer when one came, else from
+// the protocol its TLS handshake agreed on.
+bool Multiplexes(CURL *easy) {
+    long version = 0;
+    if (curl_easy_getinfo(easy, CURLINFO_HTTP_VERSION, &version) == CURLE_OK && version != 0) {
+        return version >= CURL_HTTP_VERSION_2_0;
+    }
+    struct curl_tlssessioninfo *tls = nullptr;
+    if (curl_easy_getinfo(easy, CURLINFO_TLS_SSL_PTR, &tls) != CURLE_OK || tls == nullptr ||
+        tls->backend != CURLSSLBACKEND_OPENSSL || tls->internals == nullptr) {
+        return false;
+    }
+    const unsigned char *alpn = nullptr;
+    unsigned int length = 0;
+    SSL_get0_alpn_selected(static_cast<SSL *>(tls->internals), &alpn, &length);
+    return length == 2 && memcmp(alpn, "h2", 2) == 0;
+}
+
+// Starts the waiting transfers their servers admit now; returns how many it started.
+int Admit(CURLM *multi, RunControl &control) {
+    int started = 0;
+    for (auto &entry : control.servers) {
+        ServerAdmission &server = entry.second;
+        if (server.state == ServerAdmission::kProbing) {
+            curl_off_t sent = 0;
+            const bool probeDone = control.serverOf.count(server.probe) == 0;
+            if (!probeDone &&
+                (curl_easy_getinfo(server.probe, CURLINFO_PRETRANSFER_TIME_T, &sent) != CURLE_OK ||
+                 sent == 0)) {
+                continue;
+            }
+            server.state = Multiplexes(server.probe) ? ServerAdmission::kMultiplexed
+                                                     : ServerAdmission::kParallel;
+        }
+        while (!server.waiting.empty() &&
+               (server.state == ServerAdmission::kParallel || server.running < kStreamsPerServer)) {
+            CredRequest *request = server.waiting.front();
+            server.waiting.pop_front();
+            if (AddTransfer(multi, request, control)) {
+                control.serverOf[request->GetCurlHandler()] = &server;
+                ++server.running;
+                ++started;
+            }
+        }
+    }
+    return started;
+}
+
+// Starts a set-up request's transfer, or queues it behind its server's probe (see
+// ServerAdmission). Plain HTTP, and every transfer while reuse is off, starts at once.
+void StartOrQueue(CURLM *multi, CredRequest *request, RunControl &control) {
+    control.active.push_back(request);
+    CURL *easy = request->GetCurlHandler();
+    const char *url = nullptr;
+    std::string server;
+    if (CredRequestPool::ReuseEnabled() &&
+        curl_easy_getinfo(easy, CURLINFO_EFFECTIVE_URL, &url) == CURLE_OK && url != nullptr) {
+        server = CredRequestPool::ServerOf(url);
+    }
+    if (server.compare(0, 8, "https://") != 0) {
+        AddTransfer(multi, request, control);
+        return;
+    }
+    curl_easy_setopt(easy, CURLOPT_PIPEWAIT, 1L);
+    ServerAdmission &admission = control.servers[server];
+    if (admission.probe == nullptr) {
+        if (AddTransfer(multi, request, control)) {
+            admission.probe = easy;
+            control.serverOf[easy] = &admission;
+            admission.running = 1;
+        }
+        return;
+    }
+    admission.waiting.push_back(request);
+}
 
 }  // namespace
 
@@ -316,19 +435,36 @@ bool CredRequestMgr::Run(long timeoutMilliseconds) {
         return false;
     }
     const Clock::time_point start = Clock::now();
-    MultiPtr multi(curl_multi_init());
-    if (!multi) {
+    // The thread's multi handle keeps the connections of earlier runs (see
+    // CredRequestPool::ThreadMulti).
+    bool ownedMulti = false;
+    CURLM *const multi = CredRequestPool::ThreadMulti(&ownedMulti);
+    const MultiPtr owner(ownedMulti ? multi : nullptr);
+    if (multi == nullptr) {
         SetError(CRED_REQ_ERR_CURL_INTERNAL);
         return false;
     }
+    // Whatever the run's end, the multi handle afterwards holds none of its transfers and
+    // calls back no manager.
+    RunControl control;
+    struct Detach {
+        CURLM *multi;
+        const RunControl &control;
+        ~Detach() {
+            curl_multi_setopt(multi, CURLMOPT_SOCKETDATA, nullptr);
+            for (CURL *easy : control.added) {
+                curl_multi_remove_handle(multi, easy);
+            }
+        }
+    } detach{multi, control};
     CURLMcode code =
-        curl_multi_setopt(multi.get(), CURLMOPT_SOCKETFUNCTION, &CredRequestMgr::SocketCallback);
+        curl_multi_setopt(multi, CURLMOPT_SOCKETFUNCTION, &CredRequestMgr::SocketCallback);
     if (code != CURLM_OK) {
         SetError(CRED_REQ_ERR_CURL_INTERNAL);
         LogMultiError(kLineSocketFunctionFail, code);
         return false;
     }
-    code = curl_multi_setopt(multi.get(), CURLMOPT_SOCKETDATA, this);
+    code = curl_multi_setopt(multi, CURLMOPT_SOCKETDATA, this);
     if (code != CURLM_OK) {
         SetError(CRED_REQ_ERR_CURL_INTERNAL);
         LogMultiError(kLineSocketDataFail, code);
@@ -340,7 +476,6 @@ bool CredRequestMgr::Run(long timeoutMilliseconds) {
 
     return kova::Guarded(kUnit, kLineMgrException, false, [&] {
         const RunRegistration registration(this);
-        RunControl control;
         control.registration = &registration;
         if (timeoutMilliseconds > 0) {
             control.hasDeadline = true;
@@ -362,17 +497,10 @@ bool CredRequestMgr::Run(long timeoutMilliseconds) {
                 // A run that stops early (its deadline, Cancel) leaves a resolver thread that
                 // has not answered to finish on its own instead of waiting for it.
                 curl_easy_setopt(request->GetCurlHandler(), CURLOPT_QUICK_EXIT, 1L);
-                code = curl_multi_add_handle(multi.get(), request->GetCurlHandler());
-                if (code != CURLM_OK) {
-                    // The request is left out, like one whose set-up failed.
-                    request->SetError(CRED_REQ_ERR_CURL_INTERNAL);
-                    LogMultiError(kLineAddHandleFail, code);
-                } else {
-                    control.active.push_back(request);
-                }
+                StartOrQueue(multi, request, control);
             }
         }
-        return DriveTransfers(*this, multi.get(),
+        return DriveTransfers(*this, multi,
                               longestTimeout > 0 ? longestTimeout : kDefaultWaitSeconds, &control);
     });
 }
@@ -492,11 +620,34 @@ void CollectFinished(CredRequestMgr &mgr, CURLM *multi, RunControl *control) {
             request->SetError(CredRequest::ErrorOf(message->data.result, 0));
         }
         if (control != nullptr) {
+            auto server = control->serverOf.find(easy);
+            if (server != control->serverOf.end()) {
+                --server->second->running;
+                control->serverOf.erase(server);
+            }
             auto &active = control->active;
             active.erase(
                 std::remove_if(active.begin(), active.end(),
                                [easy](CredRequest *r) { return r->GetCurlHandler() == easy; }),
                 active.end());
+        }
+    }
+}
+
+// After libcurl advanced: reads the finished transfers, then starts those their servers now
+// admit (a run's transfers to an HTTPS server, see ServerAdmission) and lets libcurl take them
+// up, until no more start.
+CURLMcode Advance(CURLM *multi, int *running, CredRequestMgr &mgr, RunControl *control) {
+    // Transfers started here may finish at once, leaving none running: their servers may then
+    // admit more, so the run is over only once nothing more starts.
+    for (;;) {
+        CollectFinished(mgr, multi, control);
+        if (control == nullptr || Admit(multi, *control) == 0) {
+            return CURLM_OK;
+        }
+        const CURLMcode code = curl_multi_perform(multi, running);
+        if (code != CURLM_OK) {
+            return code;
         }
     }
 }
@@ -523,7 +674,12 @@ bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunCont
         LogMultiError(kLineFirstPerformFail, code);
         return false;
     }
-    CollectFinished(mgr, multi, control);
+    code = Advance(multi, &running, mgr, control);
+    if (code != CURLM_OK) {
+        mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
+        LogMultiError(kLineFirstPerformFail, code);
+        return false;
+    }
     // The run ends with a time-out once no socket has been ready for a whole wait. The wait is
     // polled (descriptors of any number); libcurl cuts it short for its own timer, and so does
     // a signal. Each wake-up lets libcurl advance, and the quiet time is counted by the clock,
@@ -607,7 +763,12 @@ bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunCont
                 return false;
             }
         }
-        CollectFinished(mgr, multi, control);
+        code = Advance(multi, &running, mgr, control);
+        if (code != CURLM_OK) {
+            mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
+            LogMultiError(kLineReadyPerformFail, code);
+            return false;
+        }
     }
     return true;
 }

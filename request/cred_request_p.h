@@ -139,6 +139,10 @@ class CredRequestPrivate {
     KOVA_CRED_SESS *sess;
     CredRequest *owner;
     CURL *curl = nullptr;
+    // Where `curl` goes back to (request/cred_request_pool.h): its pool key (empty: not
+    // pooled) and the pool generation it was taken in.
+    std::string poolKey;
+    unsigned poolGeneration = 0;
     struct curl_slist *headers = nullptr;
     FILE *reqStream = nullptr;
     FILE *respStream = nullptr;

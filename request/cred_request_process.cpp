@@ -11,6 +11,7 @@
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
 #include "request/cred_request_p.h"
+#include "request/cred_request_pool.h"
 
 namespace KOVA {
 
@@ -120,6 +121,15 @@ bool CredRequest::Process(bool perform, int retries) {
         return false;
     }
     try {
+        // In a child after fork, a handle the request holds from the parent is swapped for a
+        // copy of its options: the parent's connections stay untouched.
+        if (d->curl != nullptr) {
+            d->curl = CredRequestPool::FreshIfInherited(d->curl, &d->poolKey, &d->poolGeneration);
+            if (d->curl == nullptr) {
+                d->error = CRED_REQ_ERR_CURL_INTERNAL;
+                return false;
+            }
+        }
         d->StartDeadline();
         if (!d->InitCurlHandler()) {
             kova::Log("%s:%d (pid=%d)InitCurlHandler failed", kUnit, kLineInitFailed,

@@ -13,6 +13,7 @@
 #include "platform/kova_env.h"
 #include "platform/kova_log.h"
 #include "request/cred_request_p.h"
+#include "request/cred_request_pool.h"
 
 namespace KOVA {
 
@@ -99,14 +100,29 @@ bool CredRequestPrivate::InitCurlHandler() {
         return true;
     }
     InitCurlGlobal(secureProcess);
-    curl = curl_easy_init();
-    if (curl == nullptr) {
-        error = CRED_REQ_ERR_CURL_INTERNAL;
-        return false;
-    }
     const Json::Value &urlValue = GetData("URL", "", kNull);
+    // The handle comes from the pool of the server and TLS settings; a request with a TLS
+    // context callback, or without a URL, gets one of its own.
+    auto takeHandle = [&] {
+        CredRequestPool::Tls tls;
+        const Json::Value &verifySetting = GetData("VerifySSL", "", kNull);
+        tls.verify = verifySetting.isBool() && verifySetting.asBool();
+        tls.caFile = caFile;
+        tls.pinnedKey = pinnedPublicKey;
+        poolKey = urlValue.isString() && sslCtxFn == nullptr
+                      ? CredRequestPool::KeyOf(urlValue.asString(), tls)
+                      : std::string();
+        curl = CredRequestPool::Acquire(poolKey, &poolGeneration);
+        if (curl == nullptr) {
+            error = CRED_REQ_ERR_CURL_INTERNAL;
+            return false;
+        }
+        return true;
+    };
     if (!urlValue.isString()) {
-        error = CRED_REQ_ERR_NO_URL;
+        if (takeHandle()) {
+            error = CRED_REQ_ERR_NO_URL;
+        }
         return false;
     }
     std::string url = urlValue.asString();
@@ -115,6 +131,7 @@ bool CredRequestPrivate::InitCurlHandler() {
     if (HasData("File") && HasData("PostParam", "_sid")) {
         std::string sid = ValueText(settings["PostParam"]["_sid"]);
         if (!SetData("GetParam", "_sid", sid)) {
+            takeHandle();
             return false;
         }
         settings["PostParam"].removeMember("_sid");
@@ -122,6 +139,22 @@ bool CredRequestPrivate::InitCurlHandler() {
     if (HasData("GetParam")) {
         url += url.find('?') == std::string::npos ? "?" : "&";
         url += GetParamString(settings["GetParam"]);
+    }
+    // Parameters are encoded before the handle is taken: encoding may fetch the server's
+    // encryption information with a request of its own, which then finds the kept connection
+    // to the server free.
+    const Json::Value &fileObj = GetData("File", "", kNull);
+    const bool rawBody = HasData("RawParam");
+    const Json::Value formFields =
+        !rawBody && fileObj.isObject()
+            ? GetParamJsonObj(HasData("PostParam") ? settings["PostParam"] : kNull)
+            : Json::Value();
+    const std::string postBody =
+        !rawBody && !fileObj.isObject() && reqStream == nullptr && HasData("PostParam")
+            ? GetParamString(settings["PostParam"])
+            : std::string();
+    if (!takeHandle()) {
+        return false;
     }
 
     if (!SetOption(CURLOPT_URL, url.c_str()) ||
@@ -151,13 +184,17 @@ bool CredRequestPrivate::InitCurlHandler() {
         return false;
     }
 
-    // Certificate and host checks are off unless asked for; a TLS context callback forces them.
+    // Certificate and host checks are off unless asked for; a TLS context callback forces them
+    // and its own handshake on every transfer (a fresh connection, closed after it, no TLS
+    // session resumed), so that the callback sees each one.
     const Json::Value &verify = GetData("VerifySSL", "", kNull);
     if (sslCtxFn != nullptr) {
         if (!SetOption(CURLOPT_SSL_VERIFYPEER, 1L) ||
             !SetOption(CURLOPT_SSL_VERIFYHOST, kVerifyHostName) ||
             !SetOption(CURLOPT_SSL_CTX_FUNCTION, &SslCtxAdapter) ||
-            !SetOption(CURLOPT_SSL_CTX_DATA, static_cast<void *>(this))) {
+            !SetOption(CURLOPT_SSL_CTX_DATA, static_cast<void *>(this)) ||
+            !SetOption(CURLOPT_FRESH_CONNECT, 1L) || !SetOption(CURLOPT_FORBID_REUSE, 1L) ||
+            !SetOption(CURLOPT_SSL_SESSIONID_CACHE, 0L)) {
             return false;
         }
     } else if (verify.isBool() && verify.asBool()) {
@@ -221,8 +258,7 @@ bool CredRequestPrivate::InitCurlHandler() {
 
     // Request body: raw text, else a multipart upload, else the request stream, else the form
     // parameters; without any of them the request is a GET.
-    const Json::Value &fileObj = GetData("File", "", kNull);
-    if (HasData("RawParam")) {
+    if (rawBody) {
         const std::string body = ValueText(settings["RawParam"]);
         if (!SetOption(CURLOPT_POST, 1L) || !SetOption(CURLOPT_COPYPOSTFIELDS, body.c_str())) {
             return false;
@@ -233,10 +269,8 @@ bool CredRequestPrivate::InitCurlHandler() {
 #pragma GCC diagnostic ignored "-Wdeprecated-declarations"
         // The multipart form is built with the form API, which the servers' upload handling
         // was written against.
-        const Json::Value fields =
-            GetParamJsonObj(HasData("PostParam") ? settings["PostParam"] : kNull);
-        if (fields.isObject()) {
-            for (auto it = fields.begin(); it != fields.end(); ++it) {
+        if (formFields.isObject()) {
+            for (auto it = formFields.begin(); it != formFields.end(); ++it) {
                 const std::string name = it.name();
                 const std::string value = ValueText(*it);
                 CURLFORMcode rc = curl_formadd(&form, &last, CURLFORM_COPYNAME, name.c_str(),
@@ -275,8 +309,7 @@ bool CredRequestPrivate::InitCurlHandler() {
             return false;
         }
     } else if (HasData("PostParam")) {
-        const std::string body = GetParamString(settings["PostParam"]);
-        if (!SetOption(CURLOPT_POST, 1L) || !SetOption(CURLOPT_COPYPOSTFIELDS, body.c_str())) {
+        if (!SetOption(CURLOPT_POST, 1L) || !SetOption(CURLOPT_COPYPOSTFIELDS, postBody.c_str())) {
             return false;
         }
     }

@@ -8,6 +8,14 @@
 // Concurrency: separate requests may be used on separate threads at once; one request is used
 // by one thread at a time. The request-stream limit (SetReqStreamSize) is shared by the whole
 // process.
+//
+// Connections: a request takes its libcurl handle from a process-wide pool of idle handles for
+// the same scheme, host, port and TLS settings, keeps it for its lifetime and gives it back
+// when destroyed, so a later request to the same server, on any thread, reuses its kept-alive
+// connection and TLS session. A handle serves one request at a time; options, headers and
+// cookies never carry over. Requests with a TLS context callback (SetSSLVerify) always make
+// their own connection. A child process after fork starts with an empty pool. Setting the
+// environment variable kovacredential_no_reuse turns reuse off.
 #ifndef KOVACREDENTIAL_CRED_REQUEST_H
 #define KOVACREDENTIAL_CRED_REQUEST_H
 
@@ -163,8 +171,13 @@ class KOVA_EXPORT CredRequest {
     // ---- Results.
     KOVA::_tag_CRED_REQ_ERR GetError();
     void SetError(KOVA::_tag_CRED_REQ_ERR error);
-    // The libcurl easy handle; null before the first transfer set-up. Owned by the request.
+    // The libcurl easy handle; null before the first transfer set-up. Owned by the request;
+    // remove it from any multi handle of the caller's before the request is destroyed, since
+    // the handle then goes back to the process's pool of idle handles (see below).
     CURL *GetCurlHandler();
+    // Closes every connection kept alive in the process's pool of idle handles. Requests in
+    // use keep theirs. Safe on any thread at any time.
+    static void CloseIdleConnections();
     // The response body held in memory when no response stream is set: at most
     // GetMaxResponseSize() bytes (64 MiB unless set), the transfer failing with
     // CRED_REQ_ERR_CURL_OTHER past that.

@@ -5,6 +5,11 @@
 // Concurrency: separate managers may run on separate threads at once; one manager, with the
 // requests it holds, is used by one thread at a time; only Cancel may be called while another
 // thread runs it.
+//
+// Connections: the runs of one thread share a multi handle kept between runs, so a later run
+// reuses the connections of an earlier one (CredRequest::CloseIdleConnections on that thread
+// closes them; they close when the thread ends). Transfers to an HTTPS server that speaks
+// HTTP/2 share one connection, up to 100 at a time; HTTP/1.1 servers get all transfers at once.
 #ifndef KOVACREDENTIAL_CRED_REQUEST_MGR_H
 #define KOVACREDENTIAL_CRED_REQUEST_MGR_H
 

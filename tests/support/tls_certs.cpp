@@ -10,6 +10,8 @@
 
 #include <httplib.h>
 
+#include "kovacredential/cred_request.h"
+
 namespace kova_test {
 
 namespace {
@@ -166,6 +168,9 @@ TlsServer::~TlsServer() {
         for (int i = 0; i < 500 && !server_->is_running(); ++i) {
             std::this_thread::sleep_for(std::chrono::milliseconds(10));
         }
+        // The test's own kept-alive connections would hold stop() for the server's keep-alive
+        // time.
+        KOVA::CredRequest::CloseIdleConnections();
         server_->stop();
         thread_.join();
     }

@@ -12,6 +12,7 @@
 #include <algorithm>
 #include <chrono>
 #include <limits>
+#include <set>
 
 #include <openssl/bn.h>
 #include <openssl/evp.h>
@@ -50,6 +51,38 @@ void WidenBacklog(int port) {
                         : ntohs(reinterpret_cast<struct sockaddr_in6 *>(&addr)->sin6_port);
         if (bound == port) {
             listen(fd, 1024);
+        }
+    }
+}
+
+// Ends the connections a server on `port` of `host` has accepted (found by their local
+// address among the process's descriptors), so that its workers stop waiting for another
+// request on them.
+void ShutdownAccepted(const std::string &host, int port) {
+    for (int fd = 3; fd < 4096; ++fd) {
+        int listening = 0;
+        socklen_t len = sizeof(listening);
+        if (getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &listening, &len) != 0 || listening) {
+            continue;
+        }
+        struct sockaddr_storage addr;
+        socklen_t alen = sizeof(addr);
+        if (getsockname(fd, reinterpret_cast<struct sockaddr *>(&addr), &alen) != 0) {
+            continue;
+        }
+        char text[INET6_ADDRSTRLEN] = "";
+        int bound = 0;
+        if (addr.ss_family == AF_INET) {
+            const auto *in = reinterpret_cast<struct sockaddr_in *>(&addr);
+            inet_ntop(AF_INET, &in->sin_addr, text, sizeof(text));
+            bound = ntohs(in->sin_port);
+        } else if (addr.ss_family == AF_INET6) {
+            const auto *in6 = reinterpret_cast<struct sockaddr_in6 *>(&addr);
+            inet_ntop(AF_INET6, &in6->sin6_addr, text, sizeof(text));
+            bound = ntohs(in6->sin6_port);
+        }
+        if (bound == port && host == text) {
+            shutdown(fd, SHUT_RDWR);
         }
     }
 }
@@ -236,6 +269,7 @@ bool LoopbackServer::Start() {
 void LoopbackServer::Stop() {
     if (running_) {
         server_->stop();
+        ShutdownAccepted(options_.host, port_);
         if (thread_.joinable()) {
             thread_.join();
         }
@@ -284,6 +318,7 @@ void LoopbackServer::Record(const httplib::Request &req) {
         }
     }
     r.remoteAddr = req.remote_addr;
+    r.remotePort = req.remote_port;
     std::lock_guard<std::mutex> lock(mutex_);
     records_.push_back(std::move(r));
 }
@@ -305,6 +340,15 @@ size_t LoopbackServer::CountPath(const std::string &path) const {
         n += r.path == path ? 1 : 0;
     }
     return n;
+}
+
+size_t LoopbackServer::ConnectionCount() const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    std::set<int> ports;
+    for (const auto &r : records_) {
+        ports.insert(r.remotePort);
+    }
+    return ports.size();
 }
 
 RecordedRequest LoopbackServer::Last() const {

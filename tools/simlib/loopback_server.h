@@ -35,6 +35,7 @@ struct RecordedRequest {
     std::string body;                                 // raw body (empty for multipart)
     std::vector<RecordedPart> parts;
     std::string remoteAddr;
+    int remotePort = 0;  // the client's port: requests with the same one shared a connection
 
     // First header with that name, compared without regard to case; "" when absent.
     std::string Header(const std::string &name) const;
@@ -70,6 +71,8 @@ class LoopbackServer {
     // Binds and starts serving on a thread of its own. False when the address cannot be bound
     // (for example port 80 without the right to bind it); Error() says why.
     bool Start();
+    // Stops serving. Connections a client keeps alive are ended first, so that stopping does
+    // not wait out their keep-alive time.
     void Stop();
     bool Running() const { return running_; }
     const std::string &Error() const { return error_; }
@@ -87,6 +90,8 @@ class LoopbackServer {
     size_t RequestCount() const;
     // Requests whose path equals `path`.
     size_t CountPath(const std::string &path) const;
+    // Distinct client ports the requests so far came from: the connections they used.
+    size_t ConnectionCount() const;
     RecordedRequest Last() const;
     void ClearRecords();
 
