@@ -37,7 +37,7 @@ CredRequestPrivate::~CredRequestPrivate() {
         headers = nullptr;
     }
     if (curl != nullptr) {
-        CredRequestPool::Release(curl, poolKey, poolGeneration);
+        CredRequestPool::Release(curl, handleLent ? std::string() : poolKey, poolGeneration);
         curl = nullptr;
     }
     if (form != nullptr) {
@@ -436,7 +436,11 @@ void CredRequest::CloseIdleConnections() {
 }
 
 CURL *CredRequest::GetCurlHandler() {
-    return d != nullptr ? d->curl : nullptr;
+    if (d == nullptr) {
+        return nullptr;
+    }
+    d->handleLent = d->handleLent || d->curl != nullptr;
+    return d->curl;
 }
 
 std::string CredRequest::GetResponse() {

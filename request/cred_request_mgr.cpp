@@ -23,12 +23,21 @@
 
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
+#include "request/cred_request_p.h"
 #include "request/cred_request_pool.h"
 #include "request/cred_request_util_p.h"
 
 namespace KOVA {
 
 namespace {
+
+// The easy handle of a request the manager drives. Read through the private object, so that
+// the manager's own use does not count as the caller taking the handle (which keeps it out of
+// the pool).
+CURL *HandleOf(CredRequest *request) {
+    CredRequestPrivate *p = CredRequestPrivate::Of(request);
+    return p != nullptr ? p->curl : nullptr;
+}
 
 constexpr char kUnit[] = "cred_request_mgr";
 constexpr char kLoopName[] = "curlHandlerProcess";
@@ -334,7 +343,7 @@ bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunCont
 // Adds a set-up request's transfer to the multi handle; a handle libcurl will not take leaves
 // its request out, like one whose set-up failed.
 bool AddTransfer(CURLM *multi, CredRequest *request, RunControl &control) {
-    CURL *easy = request->GetCurlHandler();
+    CURL *easy = HandleOf(request);
     const CURLMcode code = curl_multi_add_handle(multi, easy);
     if (code != CURLM_OK) {
         request->SetError(CRED_REQ_ERR_CURL_INTERNAL);
@@ -386,7 +395,7 @@ int Admit(CURLM *multi, RunControl &control) {
             CredRequest *request = server.waiting.front();
             server.waiting.pop_front();
             if (AddTransfer(multi, request, control)) {
-                control.serverOf[request->GetCurlHandler()] = &server;
+                control.serverOf[HandleOf(request)] = &server;
                 ++server.running;
                 ++started;
             }
@@ -399,7 +408,7 @@ int Admit(CURLM *multi, RunControl &control) {
 // ServerAdmission). Plain HTTP, and every transfer while reuse is off, starts at once.
 void StartOrQueue(CURLM *multi, CredRequest *request, RunControl &control) {
     control.active.push_back(request);
-    CURL *easy = request->GetCurlHandler();
+    CURL *easy = HandleOf(request);
     const char *url = nullptr;
     std::string server;
     if (CredRequestPool::ReuseEnabled() &&
@@ -496,7 +505,7 @@ bool CredRequestMgr::Run(long timeoutMilliseconds) {
             if (request->Process(false, 0)) {
                 // A run that stops early (its deadline, Cancel) leaves a resolver thread that
                 // has not answered to finish on its own instead of waiting for it.
-                curl_easy_setopt(request->GetCurlHandler(), CURLOPT_QUICK_EXIT, 1L);
+                curl_easy_setopt(HandleOf(request), CURLOPT_QUICK_EXIT, 1L);
                 StartOrQueue(multi, request, control);
             }
         }
@@ -549,7 +558,7 @@ int CredRequestMgr::SocketCallback(CURL *easy, curl_socket_t, int what, void *us
     }
     auto *mgr = static_cast<CredRequestMgr *>(userp);
     for (CredRequest *request : mgr->requests) {
-        if (request != nullptr && request->GetCurlHandler() == easy) {
+        if (request != nullptr && HandleOf(request) == easy) {
             request->SetError(CRED_REQ_ERR_TIMEOUT);
             break;
         }
@@ -598,7 +607,7 @@ bool IsPollFailure(CURLMcode code) {
 CredRequest *RequestOf(CredRequestMgr &mgr, CURL *easy) {
     for (int i = 0; i < mgr.Size(); ++i) {
         CredRequest *request = mgr.GetRequest(i);
-        if (request != nullptr && request->GetCurlHandler() == easy) {
+        if (request != nullptr && HandleOf(request) == easy) {
             return request;
         }
     }
@@ -616,8 +625,12 @@ void CollectFinished(CredRequestMgr &mgr, CURLM *multi, RunControl *control) {
         }
         CURL *easy = message->easy_handle;
         CredRequest *request = RequestOf(mgr, easy);
-        if (request != nullptr && message->data.result != CURLE_OK) {
-            request->SetError(CredRequest::ErrorOf(message->data.result, 0));
+        if (request != nullptr) {
+            // libcurl's code, text and timing, as Process records them.
+            CredRequestPrivate::Of(request)->NoteTransfer(message->data.result);
+            if (message->data.result != CURLE_OK) {
+                request->SetError(CredRequest::ErrorOf(message->data.result, 0));
+            }
         }
         if (control != nullptr) {
             auto server = control->serverOf.find(easy);
@@ -626,10 +639,9 @@ void CollectFinished(CredRequestMgr &mgr, CURLM *multi, RunControl *control) {
                 control->serverOf.erase(server);
             }
             auto &active = control->active;
-            active.erase(
-                std::remove_if(active.begin(), active.end(),
-                               [easy](CredRequest *r) { return r->GetCurlHandler() == easy; }),
-                active.end());
+            active.erase(std::remove_if(active.begin(), active.end(),
+                                        [easy](CredRequest *r) { return HandleOf(r) == easy; }),
+                         active.end());
         }
     }
 }
@@ -657,7 +669,7 @@ CURLMcode Advance(CURLM *multi, int *running, CredRequestMgr &mgr, RunControl *c
 bool StopRun(CredRequestMgr &mgr, CURLM *multi, RunControl &control,
              KOVA::_tag_CRED_REQ_ERR error) {
     for (CredRequest *request : control.active) {
-        curl_multi_remove_handle(multi, request->GetCurlHandler());
+        curl_multi_remove_handle(multi, HandleOf(request));
         // After the removal, so that the socket callback's mark of a closed socket gives way.
         request->SetError(error);
     }

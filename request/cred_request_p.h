@@ -104,6 +104,9 @@ class CredRequestPrivate {
     // Records the outcome of one transfer attempt on the handle: libcurl's result, its text
     // and the facts of GetTransferInfo.
     void NoteTransfer(CURLcode result);
+    // The private object of `request` (null when its construction failed), for the library's
+    // own units that drive requests, such as the manager.
+    static CredRequestPrivate *Of(CredRequest *request) { return request->d; }
 
     // ---- libcurl's process-wide set-up.
     // Whether this process gained privileges at exec (setuid, setgid, file capabilities:
@@ -143,6 +146,10 @@ class CredRequestPrivate {
     // pooled) and the pool generation it was taken in.
     std::string poolKey;
     unsigned poolGeneration = 0;
+    // Set once the caller took the handle (CredRequest::GetCurlHandler): it may then sit in a
+    // multi handle of the caller's or hold state that curl_easy_reset keeps (cookies, a share),
+    // so it is cleaned up instead of going back to the pool.
+    bool handleLent = false;
     struct curl_slist *headers = nullptr;
     FILE *reqStream = nullptr;
     FILE *respStream = nullptr;

@@ -233,6 +233,9 @@ TEST_F(ManagerTest, RunDrivesEveryHeldRequestAtOnce) {
                           &status);
         EXPECT_EQ(0, status);
         EXPECT_EQ(KOVA::CRED_REQ_ERR_CONNECT, mgr.GetRequest(kSlow + 2)->GetError());
+        EXPECT_EQ(CURLE_COULDNT_CONNECT, mgr.GetRequest(kSlow + 2)->GetCurlCode());
+        EXPECT_EQ(CURLE_OK, mgr.GetRequest(0)->GetCurlCode());
+        EXPECT_EQ("1.1", mgr.GetRequest(0)->GetTransferInfo()["httpVersion"].asString());
         EXPECT_EQ("slow L", all[kSlow + 3].asString());
         EXPECT_EQ(0, limited->GetResponseTimeout());
     }

@@ -171,9 +171,10 @@ class KOVA_EXPORT CredRequest {
     // ---- Results.
     KOVA::_tag_CRED_REQ_ERR GetError();
     void SetError(KOVA::_tag_CRED_REQ_ERR error);
-    // The libcurl easy handle; null before the first transfer set-up. Owned by the request;
-    // remove it from any multi handle of the caller's before the request is destroyed, since
-    // the handle then goes back to the process's pool of idle handles (see below).
+    // The libcurl easy handle; null before the first transfer set-up. Owned by the request.
+    // A handle the caller took here never goes back to the process's pool of idle handles (see
+    // below): the caller may have put it in a multi handle or given it state, so it is cleaned
+    // up with the request as it always was, which also takes it out of a multi handle.
     CURL *GetCurlHandler();
     // Closes every connection kept alive in the process's pool of idle handles. Requests in
     // use keep theirs. Safe on any thread at any time.
