@@ -121,6 +121,15 @@ class CredRequestPrivate {
     // ScrubCurlEnvironment(secure), then curl_global_init.
     static void InitCurlGlobal(bool secure);
 
+    // ---- A caller's transport lent to inner requests (cred_request_transport.cpp).
+    // Gives this (inner, not yet set up) request the transport settings of `transport`:
+    // certificate checks ("VerifySSL"), TLS context callback, CA file, pinned key, connect
+    // time-out (defaultTimeout), the response time-out when one was set ("RespTime"), and as
+    // its total time-out what is left of the transport's deadline (at least 1 ms), or the
+    // transport's total time-out when no deadline runs.
+    void TakeTransport(const CredRequestPrivate &transport);
+    static CredRequestPrivate *Of(CredRequest &request) { return request.d; }
+
     // Fills protocol, host and port of the request's own credential from `url`.
     bool buildCredByURL(const std::string &url);
 

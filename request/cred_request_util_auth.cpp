@@ -12,6 +12,7 @@
 #include "kovacredential/kovacred.h"
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
+#include "request/cred_request_transport.h"
 #include "request/cred_request_util_p.h"
 
 namespace KOVA {
@@ -146,7 +147,7 @@ bool CredRequestUtil::CheckRedirect(KOVA_CRED *cred) {
             return false;
         }
         // Any failure but a redirect is left for the real request to report.
-        if (request.Process(true, 0) || request.GetError() != CRED_REQ_ERR_REDIRECT) {
+        if (ProcessWithTransport(request, false) || request.GetError() != CRED_REQ_ERR_REDIRECT) {
             return true;
         }
         return ApplyRedirectLocation(cred, request.GetResponseHeader());
@@ -178,7 +179,14 @@ bool ReadLoginAnswer(const std::string &body, Json::Value *response, KOVA_CRED_S
 
 bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
                                    KOVA_CRED_SESS *sess, Json::Value *response) {
+    return LoginWithOTP(cred, otpCode, sess, response, nullptr);
+}
+
+bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
+                                   KOVA_CRED_SESS *sess, Json::Value *response,
+                                   KOVA::CredRequest *transport) {
     return kova::Guarded(kUnit, kLineAuthException, false, [&] {
+        const TransportScope scope(transport);
         if (cred == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineLoginBadParam);
             return false;
@@ -204,7 +212,7 @@ bool CredRequestUtil::LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode,
         }
         request.AddPostParam(params);
         request.SetEncryptParam(true);
-        if (!request.Process(true, 0)) {
+        if (!ProcessWithTransport(request)) {
             kova::Log("%s:%d Send login request fail.[%d]", kUnit, kLineLoginSend,
                       static_cast<int>(request.GetError()));
             return false;
@@ -312,7 +320,13 @@ bool IsLogoutAnswerOk(const std::string &body) {
 }
 
 bool CredRequestUtil::Logout(KOVA_CRED *cred, const std::string &sid) {
+    return Logout(cred, sid, nullptr);
+}
+
+bool CredRequestUtil::Logout(KOVA_CRED *cred, const std::string &sid,
+                             KOVA::CredRequest *transport) {
     return kova::Guarded(kUnit, kLineAuthException, false, [&] {
+        const TransportScope scope(transport);
         if (cred == nullptr || sid.empty()) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineLogoutBadParam);
             return false;
@@ -330,7 +344,7 @@ bool CredRequestUtil::Logout(KOVA_CRED *cred, const std::string &sid) {
         params["_sid"] = sid;
         request.AddPostParam(params);
         request.AddCookie("id", sid);
-        if (!request.Process(true, 0)) {
+        if (!ProcessWithTransport(request)) {
             kova::Log("%s:%d Send logout request fail.[%d]", kUnit, kLineLogoutSend,
                       static_cast<int>(request.GetError()));
             return false;

@@ -17,6 +17,7 @@
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
 #include "platform/vlibc.h"
+#include "request/cred_request_transport.h"
 #include "request/cred_request_util_p.h"
 
 namespace {
@@ -270,7 +271,7 @@ bool CredRequestUtil::GetEncInfo(const std::string &url, Json::Value &info) {
         params["method"] = "getinfo";
         params["format"] = "module";
         request.AddPostParam(params);
-        if (!request.Process(true, 0)) {
+        if (!ProcessWithTransport(request)) {
             kova::Log("%s:%d Send encryption request fail.[%d]", kUnit, kLineEncInfoSendFail,
                       static_cast<int>(request.GetError()));
             return false;

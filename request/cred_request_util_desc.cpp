@@ -16,6 +16,7 @@
 #include "kovacredential/cred_request_util.h"
 #include "platform/json_text.h"
 #include "platform/kova_log.h"
+#include "request/cred_request_transport.h"
 #include "request/cred_request_util_p.h"
 
 namespace KOVA {
@@ -114,7 +115,12 @@ bool StoreWebAPIDescAnswer(const std::string &key, const std::string &body) {
 }
 
 bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
+    return GetWebAPIDesc(cred, nullptr);
+}
+
+bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred, KOVA::CredRequest *transport) {
     return kova::Guarded(kUnit, kLineDescException, false, [&] {
+        const TransportScope scope(transport);
         if (cred == nullptr) {
             kova::Log("%s:%d Bad parameters", kUnit, kLineDescBadParam);
             return false;
@@ -135,7 +141,7 @@ bool CredRequestUtil::GetWebAPIDesc(const KOVA_CRED *cred) {
         request.AddPostParam(params);
         request.SetResponseTimeout(30);
         request.SetEncoding(true);
-        if (!request.Process(true, 0)) {
+        if (!ProcessWithTransport(request)) {
             kova::Log("%s:%d Cred Error:[%s][%d]", kUnit, kLineDescCredError,
                       kova::UrlForLog(request.GetURL()).c_str(),
                       static_cast<int>(request.GetError()));

@@ -28,6 +28,7 @@
 #include "platform/json_text.h"
 #include "simlib/fault_server.h"
 #include "simlib/loopback_server.h"
+#include "simlib/webapi_sim.h"
 #include "store_fixture.h"
 #include "support/sim_process.h"
 #include "support/temp_dir.h"
@@ -753,6 +754,26 @@ TEST_F(KovacredTest, TransportOptionsCheckTheServerAndBoundTheTime) {
                                     "method": "echo"}])")
             .err,
         std::regex("call 0: the API description \\(error 12 [^\n]*curl 60: ")));
+    // The login's own requests are checked: no password reaches a server that fails.
+    kovasim::WebApiSim webapi;
+    kovasim::LoopbackServer::Options httpsOptions;
+    httpsOptions.https = true;
+    kovasim::LoopbackServer https(httpsOptions);
+    webapi.Install(https);
+    ASSERT_TRUE(https.Start()) << https.Error();
+    std::ofstream(db_.dir().File("self.pem")) << https.CertificatePem();
+    ASSERT_EQ(Run("add --host localhost --port " + std::to_string(https.Port()) +
+                      " --protocol https --account admin",
+                  "secret\n")
+                  .status,
+              0);
+    r = Run("login 2 --verify");
+    EXPECT_EQ(r.status, 12);
+    EXPECT_EQ(r.err.rfind("kovacred: login " + unverified, 0), 0u) << r.err;
+    EXPECT_EQ(https.CountPath("/webapi/auth.cgi"), 0u) << "the password went to it";
+    r = Run("login 2 --cacert " + db_.dir().File("self.pem"));
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(https.CountPath("/webapi/auth.cgi"), 1u);
     r = Run("login 1 --pin");
     EXPECT_EQ(r.status, 0) << r.err;
     EXPECT_NE(ReadFile(known).find("127.0.0.1:" + std::to_string(sim_->HttpsPort()) + " sha256//"),
@@ -771,7 +792,7 @@ TEST_F(KovacredTest, TransportOptionsCheckTheServerAndBoundTheTime) {
                   "pw\n")
                   .status,
               0);
-    r = Run("login 2 --max-time 0.5");
+    r = Run("login 3 --max-time 0.5");
     EXPECT_EQ(r.status, 10) << r.err;
     EXPECT_EQ(r.err.rfind("kovacred: login failed (error 10 CRED_REQ_ERR_TIMEOUT", 0), 0u) << r.err;
 }

@@ -2,11 +2,14 @@
 // opens the RSA and AES envelopes and checks every parameter it finds inside.
 #include <string.h>
 
+#include <fstream>
 #include <functional>
 #include <iterator>
+#include <regex>
 #include <string>
 
 #include "kovacredential/kovaplatform.h"
+#include "simlib/fault_server.h"
 #include "webapi_fixture.h"
 
 namespace kova_test {
@@ -309,6 +312,77 @@ TEST_F(WebApiAuthTest, LoginTransferFailureIsReported) {
     cred.port = failing.Port();
     EXPECT_FALSE(CredRequestUtil::Login(&cred, nullptr));
     EXPECT_TRUE(LogHas("Send login request fail.[13]")) << LogDump();
+}
+
+// Every request of a login or logout over a transport runs with the transport's checks and
+// deadline, and the failing one's cause comes back in the transport.
+TEST_F(WebApiAuthTest, LoginAndLogoutOverATransportCheckTheServerBeforeTheSecretsGo) {
+    kovasim::LoopbackServer::Options options;
+    options.https = true;
+    kovasim::LoopbackServer https(options);
+    Sim().Install(https);
+    ASSERT_TRUE(https.Start()) << https.Error();
+    TempDir dir;
+    const std::string caFile = dir.File("server.pem");
+    std::ofstream(caFile) << https.CertificatePem();
+    // The simulator's self-signed certificate names "localhost".
+    KOVA_CRED cred = Cred(https.Port());
+    cred.protocol = "https";
+    cred.host = "localhost";
+    auto expectRefused = [&](CredRequest &transport, const std::string &step) {
+        EXPECT_EQ(KOVA::CRED_REQ_ERR_CURL_OTHER, transport.GetError()) << step;
+        EXPECT_EQ(CURLE_PEER_FAILED_VERIFICATION, transport.GetCurlCode()) << step;
+        EXPECT_FALSE(transport.GetCurlErrorText().empty()) << step;
+        EXPECT_EQ(0u, https.CountPath("/webapi/auth.cgi")) << step << ": the secret was sent";
+    };
+
+    // Refused at the description query, then (description cached) at the encryption query.
+    CredRequest verifying;
+    verifying.SetHTTPSVerify(true);
+    KOVA_CRED_SESS sess;
+    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "", &sess, nullptr, &verifying));
+    expectRefused(verifying, "uncached login");
+    EXPECT_EQ(0u, https.RequestCount());
+    ASSERT_TRUE(CredRequestUtil::GetWebAPIDesc(&cred));
+    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "", &sess, nullptr, &verifying));
+    expectRefused(verifying, "cached login");
+    CredRequestUtil::RemoveWebAPIDesc(&cred);
+    EXPECT_FALSE(CredRequestUtil::GetWebAPIDesc(&cred, &verifying));
+    expectRefused(verifying, "description");
+
+    // The server's own certificate as CA file: every step passes, and the outcome is cleared.
+    CredRequest trusting;
+    trusting.SetCAFile(caFile);
+    trusting.SetError(KOVA::CRED_REQ_ERR_UNKNOWN);
+    ASSERT_TRUE(CredRequestUtil::LoginWithOTP(&cred, "", &sess, nullptr, &trusting)) << LogDump();
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, trusting.GetError());
+    EXPECT_EQ(1u, https.CountPath("/webapi/auth.cgi"));
+    EXPECT_TRUE(Sim().SessionValid(sess.access_token));
+
+    // Logout: with the description cached, its own post is the first request.
+    https.ClearRecords();
+    EXPECT_FALSE(CredRequestUtil::Logout(&cred, sess.access_token, &verifying));
+    expectRefused(verifying, "logout");
+    EXPECT_TRUE(Sim().SessionValid(sess.access_token));
+    EXPECT_TRUE(CredRequestUtil::Logout(&cred, sess.access_token, &trusting)) << LogDump();
+    EXPECT_FALSE(Sim().SessionValid(sess.access_token));
+
+    // A server that never answers: the transport's deadline bounds the login as a whole (the
+    // redirect probe and the description query), before any response time-out.
+    kovasim::FaultServer silent(kovasim::Fault::kSilent);
+    ASSERT_TRUE(silent.Start());
+    KOVA_CRED silentCred = Cred(silent.Port());
+    CredRequestUtil::RemoveWebAPIDesc(&silentCred);  // the same id as `cred`
+    CredRequest bounded;
+    bounded.SetResponseTimeout(5);
+    bounded.SetTotalTimeout(300);
+    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&silentCred, "", &sess, nullptr, &bounded));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_TIMEOUT, bounded.GetError());
+    EXPECT_EQ(CURLE_OPERATION_TIMEDOUT, bounded.GetCurlCode());
+    // The deadline's time-out, not the low-speed abort ("Operation too slow").
+    EXPECT_TRUE(std::regex_search(bounded.GetCurlErrorText(),
+                                  std::regex("timed out after [0-9]+ milliseconds")))
+        << bounded.GetCurlErrorText();
 }
 
 class WebApiRedirectTest : public WebApiAuthTest {

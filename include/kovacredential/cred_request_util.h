@@ -6,6 +6,23 @@
 // (m_jsData) is process-wide; the library's own reads and writes of it take a lock, while a
 // caller that touches m_jsData directly must serialise that access itself. The last error
 // (m_errCode) is process-wide.
+//
+// Transport: the operations make requests of their own (the redirect probe, the description
+// query, the encryption information, the login and logout posts), which by default check no
+// certificate and have no total deadline. The overloads that take a `transport` request give
+// each of those inner requests the transport's settings: certificate and host checks
+// (SetHTTPSVerify), the TLS context callback (SetSSLVerify), the CA file, the pinned public key,
+// the connect time-out (SetDefaultTimeout), the response time-out when one was set, and, as
+// its total time-out, what is left of the transport's total time-out counted from the start of
+// the call, so that SetTotalTimeout bounds the operation as a whole. The transport is not
+// processed and nothing else of it is used (URL, parameters, streams). At the start of the call
+// its error, libcurl code and text and transfer facts are cleared; when an inner transfer fails
+// the operation, they become those of that request (the first one that failed), so that the
+// caller can name the cause (GetError, GetCurlCode, GetCurlErrorText, GetTransferInfo). A
+// failure that was not a transfer (an answer that cannot be used, an API the server does not
+// offer) leaves them clear. A null transport gives the overloads without one. The transport is
+// used by the calling thread only, for the time of the call: it must not be used on another
+// thread meanwhile; calls with different transports may run on several threads at once.
 #ifndef KOVACREDENTIAL_CRED_REQUEST_UTIL_H
 #define KOVACREDENTIAL_CRED_REQUEST_UTIL_H
 
@@ -45,6 +62,8 @@ class KOVA_EXPORT CredRequestUtil {
     // ---- API description cache.
     // Queries the credential's server ("KOVA.API.Info") and caches the answer under its id.
     static bool GetWebAPIDesc(const KOVA_CRED *cred);
+    // The same query over `transport`'s settings (see Transport above).
+    static bool GetWebAPIDesc(const KOVA_CRED *cred, KOVA::CredRequest *transport);
     static void RemoveWebAPIDesc(const KOVA_CRED *cred);
     static bool IsCredIdCached(long id);
     // The API's CGI path relative to "webapi/"; "" on failure (CRED_REQ_ERR_NO_SUCH_API when
@@ -86,6 +105,12 @@ class KOVA_EXPORT CredRequestUtil {
     // credential's id when it is stored. sess and response may be null.
     static bool LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode, KOVA_CRED_SESS *sess,
                              Json::Value *response);
+    // The same login, every request of it (redirect probe, description query when the cache
+    // lacks it, encryption information, the post of the password) over `transport`'s settings
+    // (see Transport above): with certificate checks or a pinned key, the password is sent only
+    // to a server that passes them.
+    static bool LoginWithOTP(KOVA_CRED *cred, const std::string &otpCode, KOVA_CRED_SESS *sess,
+                             Json::Value *response, KOVA::CredRequest *transport);
     static bool Login(KOVA_CRED *cred, KOVA_CRED_SESS *sess);
     static bool Login(long id, KOVA_CRED_SESS *sess);
     // The stored session of the credential, or a fresh login when there is none.
@@ -93,6 +118,8 @@ class KOVA_EXPORT CredRequestUtil {
     static bool GetAccessToken(KOVA_CRED *cred, KOVA_CRED_SESS *sess);
     // Closes a server session; the stored session is left as it is.
     static bool Logout(KOVA_CRED *cred, const std::string &sid);
+    // The same logout over `transport`'s settings (see Transport above).
+    static bool Logout(KOVA_CRED *cred, const std::string &sid, KOVA::CredRequest *transport);
     static bool Logout(KOVA_CRED *cred, KOVA_CRED_SESS *sess);
     static bool Logout(long id);
 };

@@ -169,8 +169,8 @@ void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call,
         call.problem = "no credential with id " + std::to_string(call.credId);
         return;
     }
-    // The description query and the login the manager would make are made here, so that the
-    // transport options apply to the query and a failure is named as login names it.
+    // The description query and the login the manager would make are made here, over the
+    // transport options, so that a failure is named as login names it.
     const Transport *transport =
         ServerTransport(options, servers, cred.protocol, cred.host, cred.port, call);
     if (transport == nullptr) {
@@ -185,8 +185,8 @@ void AddCall(KOVA::CredRequestMgr &mgr, const Json::Value &item, Call &call,
     }
     KOVA_CRED_SESS sess;
     if ((KOVACredSessGetByID(call.credId, &sess) < 0 || sess.filled == 0) &&
-        !LogIn(cred, "", failure, call.code)) {
-        call.problem = "login failed (" + failure + ")";
+        !LogIn(cred, "", *transport, failure, call.code)) {
+        call.problem = "login failed " + failure;
         return;
     }
     KOVA::CredRequestUtil::m_errCode = 0;

@@ -85,56 +85,49 @@ struct LoginOptions {
 
 }  // namespace
 
-bool LogIn(KOVA_CRED &cred, const std::string &otp, std::string &failure, long &code) {
+bool LogIn(KOVA_CRED &cred, const std::string &otp, const Transport &transport,
+           std::string &failure, long &code) {
     KOVA_CRED_SESS sess;
     Json::Value answer;
+    CredRequest via;
+    ApplyTransport(transport, via);
     CredRequestUtil::m_errCode = 0;
-    if (CredRequestUtil::LoginWithOTP(&cred, otp, &sess, &answer)) {
+    if (CredRequestUtil::LoginWithOTP(&cred, otp, &sess, &answer, &via)) {
         return true;
     }
     code = ErrorCodeOf(answer);
     if (code != 0) {
         const std::string text = LoginCodeText(static_cast<int>(code));
-        failure = "server error " + std::to_string(code) + (text.empty() ? "" : ": " + text);
+        failure = "(server error " + std::to_string(code) + (text.empty() ? "" : ": " + text) + ")";
+        return false;
+    }
+    if (via.GetError() != KOVA::CRED_REQ_ERR_NONE) {
+        code = via.GetError();
+        failure = TransferFailure(via, &transport);
         return false;
     }
     code = answer.isObject()                 ? KOVA::CRED_REQ_ERR_INVALID_RESPONSE
            : CredRequestUtil::m_errCode != 0 ? CredRequestUtil::m_errCode
                                              : KOVA::CRED_REQ_ERR_LOGIN_SESSION;
-    failure = ErrorText(code);
+    failure = "(" + ErrorText(code) + ")";
     return false;
 }
 
 bool FetchDescription(const KOVA_CRED &cred, const Transport &transport, Json::Value &desc,
                       std::string &failure, long &code) {
-    CredRequest request;
-    if (!request.SetURL(cred.protocol, cred.host, cred.port, "webapi/query.cgi")) {
-        code = request.GetError();
-        failure = TransferFailure(request);
+    CredRequest via;
+    ApplyTransport(transport, via);
+    if (!CredRequestUtil::GetWebAPIDesc(&cred, &via)) {
+        if (via.GetError() != KOVA::CRED_REQ_ERR_NONE) {
+            code = via.GetError();
+            failure = TransferFailure(via, &transport);
+        } else {
+            code = KOVA::CRED_REQ_ERR_QUERY_FAIL;
+            failure = "(" + ErrorText(code) + "): the server's API description is not usable";
+        }
         return false;
     }
-    Json::Value params(Json::objectValue);
-    params["api"] = "KOVA.API.Info";
-    params["version"] = 1;
-    params["method"] = "query";
-    request.AddPostParam(params);
-    request.SetResponseTimeout(30);
-    request.SetEncoding(true);
-    ApplyTransport(transport, request);
-    if (!request.Process(true, 0)) {
-        code = request.GetError();
-        failure = TransferFailure(request, &transport);
-        return false;
-    }
-    Json::Value answer;
-    if (!ParseJson(request.GetResponse(), answer) || !answer.isObject() ||
-        !answer["success"].isBool() || !answer["success"].asBool() || !answer["data"].isObject()) {
-        code = KOVA::CRED_REQ_ERR_QUERY_FAIL;
-        failure = "(" + ErrorText(code) + "): the server's API description is not usable";
-        return false;
-    }
-    desc = answer["data"];
-    CredRequestUtil::m_jsData["webapiDesc"][std::to_string(cred.id)] = desc;
+    desc = CredRequestUtil::m_jsData["webapiDesc"][std::to_string(cred.id)];
     return true;
 }
 
@@ -142,17 +135,17 @@ namespace {
 
 // The session of credential `id` the library's factory will use: the stored one, or one a
 // login gets now (a failed login is reported as "login" reports it). False after the line.
-bool HaveSession(const std::string &what, KOVA_CRED &cred) {
+bool HaveSession(const std::string &what, KOVA_CRED &cred, const Transport &transport) {
     KOVA_CRED_SESS sess;
     if (KOVACredSessGetByID(cred.id, &sess) == 0 && sess.filled != 0) {
         return true;
     }
     std::string failure;
     long code = 0;
-    if (LogIn(cred, "", failure, code)) {
+    if (LogIn(cred, "", transport, failure, code)) {
         return true;
     }
-    fprintf(stderr, "kovacred: %s failed: login failed (%s)\n", what.c_str(), failure.c_str());
+    fprintf(stderr, "kovacred: %s failed: login failed %s\n", what.c_str(), failure.c_str());
     gExitCode = code >= 1 && code <= 255 ? static_cast<int>(code) : 1;
     return false;
 }
@@ -162,14 +155,13 @@ void RunLogin(LoginOptions &opts) {
     if (!LoadCred("login", opts.id, cred)) {
         return;
     }
-    Json::Value desc;
-    if (!FetchDescription("login", cred, opts.transport, desc)) {
+    if (!PrepareTransport("login", opts.transport, cred.protocol, cred.host, cred.port)) {
         return;
     }
     std::string failure;
     long code = 0;
-    if (!LogIn(cred, opts.otp, failure, code)) {
-        fprintf(stderr, "kovacred: login failed (%s)\n", failure.c_str());
+    if (!LogIn(cred, opts.otp, opts.transport, failure, code)) {
+        fprintf(stderr, "kovacred: login failed %s\n", failure.c_str());
         gExitCode = code >= 1 && code <= 255 ? static_cast<int>(code) : 1;
         return;
     }
@@ -186,7 +178,6 @@ struct LogoutOptions {
 void RunLogout(LogoutOptions &opts) {
     const int id = opts.id;
     KOVA_CRED cred;
-    Json::Value desc;
     if (!LoadCred("logout", id, cred)) {
         return;
     }
@@ -195,11 +186,17 @@ void RunLogout(LogoutOptions &opts) {
         FailText("logout failed: no stored session for credential " + std::to_string(id));
         return;
     }
-    if (!FetchDescription("logout", cred, opts.transport, desc)) {
+    if (!PrepareTransport("logout", opts.transport, cred.protocol, cred.host, cred.port)) {
         return;
     }
-    if (!CredRequestUtil::Logout(&cred, &sess)) {
-        Fail("logout", KOVA::CRED_REQ_ERR_INVALID_RESPONSE);
+    CredRequest via;
+    ApplyTransport(opts.transport, via);
+    if (!CredRequestUtil::Logout(&cred, sess.access_token, &via)) {
+        if (via.GetError() != KOVA::CRED_REQ_ERR_NONE) {
+            FailTransfer("logout", via, &opts.transport);
+        } else {
+            Fail("logout", KOVA::CRED_REQ_ERR_INVALID_RESPONSE);
+        }
         return;
     }
     KOVACredSessRemoveByID(id);
@@ -248,7 +245,8 @@ void RunCall(CallOptions &opts) {
     }
     const std::string what = "call " + opts.api;
     Json::Value desc;
-    if (!FetchDescription(what, cred, opts.transport, desc) || !HaveSession(what, cred)) {
+    if (!FetchDescription(what, cred, opts.transport, desc) ||
+        !HaveSession(what, cred, opts.transport)) {
         return;
     }
     KOVA_CRED_SESS sess;

@@ -128,17 +128,19 @@ void PrintTiming(KOVA::CredRequest &request);
 
 // ---- WebAPI.
 
-// The credential's API description, asked for by a request of the tool's own (the query the
-// library would make), so that the transport options apply to it and a failure names its
-// cause. The answer goes into the library's description cache, where its login and request
-// factories find it instead of asking again. False with TransferFailure's text and the code.
+// The credential's API description, queried by the library over the transport options, which
+// also keeps it in its description cache, where its login and request factories find it
+// instead of asking again. False with the failure's text ("(<ErrorText>)[: <cause>]", as
+// TransferFailure gives it) and the code.
 bool FetchDescription(const KOVA_CRED &cred, const Transport &transport, Json::Value &desc,
                       std::string &failure, long &code);
 
-// Logs in with credential `cred` (the library's login, with the one-time code `otp` when not
-// empty) and stores the session; false with the failure's text ("server error 400: wrong
-// account or password", or ErrorText of the library's code) and exit status in `code`.
-bool LogIn(KOVA_CRED &cred, const std::string &otp, std::string &failure, long &code);
+// Logs in with credential `cred` (the library's login over the transport options, with the
+// one-time code `otp` when not empty) and stores the session; false with the failure's text
+// ("(server error 400: wrong account or password)", TransferFailure's text of the request that
+// failed, or "(<ErrorText of the library's code>)") and exit status in `code`.
+bool LogIn(KOVA_CRED &cred, const std::string &otp, const Transport &transport,
+           std::string &failure, long &code);
 
 // ---- Output.
 
