@@ -460,7 +460,7 @@ std::string CredRequest::GetCurlErrorText() {
 }
 
 Json::Value CredRequest::GetTransferInfo() {
-    return OnPrivate(d, Json::Value(), [](CredRequestPrivate &p) { return p.transferInfo; });
+    return OnPrivate(d, Json::Value(), [](CredRequestPrivate &p) { return p.TransferInfo(); });
 }
 
 }  // namespace KOVA

@@ -17,6 +17,7 @@
 #include <memory>
 #include <new>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include <openssl/ssl.h>
@@ -333,6 +334,10 @@ struct RunControl {
     std::vector<CURL *> added;          // handles added to the multi handle
     std::map<std::string, ServerAdmission> servers;
     std::map<CURL *, ServerAdmission *> serverOf;
+    // The held request of each handle, the first in the manager's order (as RequestOf finds
+    // it), made once the run's requests are set up: a finished transfer finds its request
+    // without a walk through all of them.
+    std::unordered_map<CURL *, CredRequest *> requestOf;
     bool hasDeadline = false;
     Clock::time_point deadline;
     const RunRegistration *registration = nullptr;
@@ -509,6 +514,13 @@ bool CredRequestMgr::Run(long timeoutMilliseconds) {
                 StartOrQueue(multi, request, control);
             }
         }
+        control.requestOf.reserve(requests.size());
+        for (CredRequest *request : requests) {
+            CURL *easy = request != nullptr ? HandleOf(request) : nullptr;
+            if (easy != nullptr) {
+                control.requestOf.emplace(easy, request);
+            }
+        }
         return DriveTransfers(*this, multi,
                               longestTimeout > 0 ? longestTimeout : kDefaultWaitSeconds, &control);
     });
@@ -624,7 +636,13 @@ void CollectFinished(CredRequestMgr &mgr, CURLM *multi, RunControl *control) {
             continue;
         }
         CURL *easy = message->easy_handle;
-        CredRequest *request = RequestOf(mgr, easy);
+        CredRequest *request = nullptr;
+        if (control != nullptr) {
+            auto known = control->requestOf.find(easy);
+            request = known != control->requestOf.end() ? known->second : RequestOf(mgr, easy);
+        } else {
+            request = RequestOf(mgr, easy);
+        }
         if (request != nullptr) {
             // libcurl's code, text and timing, as Process records them.
             CredRequestPrivate::Of(request)->NoteTransfer(message->data.result);

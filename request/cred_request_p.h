@@ -102,8 +102,10 @@ class CredRequestPrivate {
     // a total time-out). False when the option cannot be set (CRED_REQ_ERR_CURL_INTERNAL).
     bool ArmDeadline();
     // Records the outcome of one transfer attempt on the handle: libcurl's result, its text
-    // and the facts of GetTransferInfo.
+    // and the raw facts GetTransferInfo reports (see TransferFacts).
     void NoteTransfer(CURLcode result);
+    // The facts of the last transfer attempt as GetTransferInfo reports them; null before any.
+    Json::Value TransferInfo() const;
     // The private object of `request` (null when its construction failed), for the library's
     // own units that drive requests, such as the manager.
     static CredRequestPrivate *Of(CredRequest *request) { return request->d; }
@@ -187,10 +189,21 @@ class CredRequestPrivate {
     // The deadline of the current Process (CLOCK_MONOTONIC, milliseconds), with a total
     // time-out.
     int64_t deadlineMs = 0;
+    // What libcurl tells of the last transfer attempt, read from the handle right after it (the
+    // handle may serve another request later) and turned into JSON only when asked for.
+    struct TransferFacts {
+        bool noted = false;  // false before any transfer
+        bool completed = false;
+        curl_off_t namelookupUs = 0, connectUs = 0, tlsUs = 0, firstByteUs = 0, totalUs = 0;
+        long connects = 0;
+        long httpVersion = 0;
+        long remotePort = 0;
+        std::string remoteIp;
+    };
     // Outcome of the last transfer attempt.
     CURLcode curlCode = CURLE_OK;
     std::string curlErrorText;
-    Json::Value transferInfo;  // null before any transfer
+    TransferFacts transferFacts;
     char curlErrorBuffer[CURL_ERROR_SIZE] = {};
 
     // Stream positions of the current Process (see MarkStreams): -1 when a stream is not set

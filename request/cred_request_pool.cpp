@@ -175,6 +175,14 @@ struct ThreadMultiHolder {
 };
 thread_local ThreadMultiHolder tThreadMulti;
 
+// The server of the URL this thread asked KeyOf for last: requests in a row mostly go to the
+// same URL, which then is not parsed again.
+struct LastServer {
+    std::string url;
+    std::string server;
+};
+thread_local LastServer tLastServer;
+
 // Idle connections the manager's multi handle of a thread keeps between runs.
 constexpr long kMaxIdleConnectionsPerThread = 64;
 
@@ -190,14 +198,34 @@ unsigned CredRequestPool::Generation() {
 
 std::string CredRequestPool::KeyOf(const std::string &url, const Tls &tls) {
     (void)gForkHandlers;
-    const std::string server = ReuseEnabled() ? ServerOf(url) : std::string();
-    if (server.empty()) {
+    if (!ReuseEnabled()) {
+        return std::string();
+    }
+    LastServer &last = tLastServer;
+    if (last.server.empty() || last.url != url) {
+        last.server = ServerOf(url);
+        last.url = last.server.empty() ? std::string() : url;
+    }
+    if (last.server.empty()) {
         return std::string();
     }
     // Lengths keep the free-form parts from running into each other.
-    return server + (tls.verify ? " verify" : " noverify") + " ca" +
-           std::to_string(tls.caFile.size()) + ":" + tls.caFile + " pin" +
-           std::to_string(tls.pinnedKey.size()) + ":" + tls.pinnedKey;
+    const std::string caLength = std::to_string(tls.caFile.size());
+    const std::string pinLength = std::to_string(tls.pinnedKey.size());
+    std::string key;
+    key.reserve(last.server.size() + caLength.size() + tls.caFile.size() + pinLength.size() +
+                tls.pinnedKey.size() + 24);
+    key.append(last.server)
+        .append(tls.verify ? " verify" : " noverify")
+        .append(" ca")
+        .append(caLength)
+        .append(":")
+        .append(tls.caFile)
+        .append(" pin")
+        .append(pinLength)
+        .append(":")
+        .append(tls.pinnedKey);
+    return key;
 }
 
 std::string CredRequestPool::ServerOf(const std::string &url) {

@@ -6,7 +6,6 @@
 
 #include <algorithm>
 #include <limits>
-#include <utility>
 
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
@@ -35,10 +34,14 @@ int64_t MonotonicMs() {
     return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
 }
 
-// A libcurl time (microseconds) in seconds.
-double Seconds(CURL *curl, CURLINFO what) {
+// A libcurl time in microseconds, 0 when libcurl cannot tell it.
+curl_off_t Micros(CURL *curl, CURLINFO what) {
     curl_off_t us = 0;
-    return curl_easy_getinfo(curl, what, &us) == CURLE_OK ? static_cast<double>(us) / 1e6 : 0.0;
+    return curl_easy_getinfo(curl, what, &us) == CURLE_OK ? us : 0;
+}
+
+double Seconds(curl_off_t us) {
+    return static_cast<double>(us) / 1e6;
 }
 
 const char *HttpVersionText(long version) {
@@ -87,27 +90,44 @@ bool CredRequestPrivate::ArmDeadline() {
 void CredRequestPrivate::NoteTransfer(CURLcode result) {
     curlCode = result;
     curlErrorText = curlErrorBuffer[0] != '\0' ? curlErrorBuffer : curl_easy_strerror(result);
-    Json::Value info(Json::objectValue);
-    info["namelookup"] = Seconds(curl, CURLINFO_NAMELOOKUP_TIME_T);
-    info["connect"] = Seconds(curl, CURLINFO_CONNECT_TIME_T);
-    info["tls"] = Seconds(curl, CURLINFO_APPCONNECT_TIME_T);
-    info["firstByte"] = Seconds(curl, CURLINFO_STARTTRANSFER_TIME_T);
-    info["total"] = Seconds(curl, CURLINFO_TOTAL_TIME_T);
-    long connects = 0;
-    curl_easy_getinfo(curl, CURLINFO_NUM_CONNECTS, &connects);
-    info["connects"] = static_cast<Json::Int64>(connects);
-    // A completed transfer that opened no connection rode one made earlier.
-    info["reused"] = result == CURLE_OK && connects == 0;
-    long version = 0;
-    curl_easy_getinfo(curl, CURLINFO_HTTP_VERSION, &version);
-    info["httpVersion"] = HttpVersionText(version);
+    TransferFacts &f = transferFacts;
+    f.noted = true;
+    f.completed = result == CURLE_OK;
+    f.namelookupUs = Micros(curl, CURLINFO_NAMELOOKUP_TIME_T);
+    f.connectUs = Micros(curl, CURLINFO_CONNECT_TIME_T);
+    f.tlsUs = Micros(curl, CURLINFO_APPCONNECT_TIME_T);
+    f.firstByteUs = Micros(curl, CURLINFO_STARTTRANSFER_TIME_T);
+    f.totalUs = Micros(curl, CURLINFO_TOTAL_TIME_T);
+    f.connects = 0;
+    curl_easy_getinfo(curl, CURLINFO_NUM_CONNECTS, &f.connects);
+    f.httpVersion = 0;
+    curl_easy_getinfo(curl, CURLINFO_HTTP_VERSION, &f.httpVersion);
     char *ip = nullptr;
     curl_easy_getinfo(curl, CURLINFO_PRIMARY_IP, &ip);
-    info["remoteIp"] = ip != nullptr ? ip : "";
-    long port = 0;
-    curl_easy_getinfo(curl, CURLINFO_PRIMARY_PORT, &port);
-    info["remotePort"] = static_cast<Json::Int64>(port);
-    transferInfo = std::move(info);
+    // Assigned in place: the string keeps its buffer from one attempt to the next.
+    f.remoteIp.assign(ip != nullptr ? ip : "");
+    f.remotePort = 0;
+    curl_easy_getinfo(curl, CURLINFO_PRIMARY_PORT, &f.remotePort);
+}
+
+Json::Value CredRequestPrivate::TransferInfo() const {
+    const TransferFacts &f = transferFacts;
+    if (!f.noted) {
+        return Json::Value();
+    }
+    Json::Value info(Json::objectValue);
+    info["namelookup"] = Seconds(f.namelookupUs);
+    info["connect"] = Seconds(f.connectUs);
+    info["tls"] = Seconds(f.tlsUs);
+    info["firstByte"] = Seconds(f.firstByteUs);
+    info["total"] = Seconds(f.totalUs);
+    info["connects"] = static_cast<Json::Int64>(f.connects);
+    // A completed transfer that opened no connection rode one made earlier.
+    info["reused"] = f.completed && f.connects == 0;
+    info["httpVersion"] = HttpVersionText(f.httpVersion);
+    info["remoteIp"] = f.remoteIp;
+    info["remotePort"] = static_cast<Json::Int64>(f.remotePort);
+    return info;
 }
 
 constexpr int kLineInitFailed = 47;

@@ -49,7 +49,7 @@ TransportScope::TransportScope(CredRequest *transport)
     t->error = CRED_REQ_ERR_NONE;
     t->curlCode = CURLE_OK;
     t->curlErrorText.clear();
-    t->transferInfo = Json::Value();
+    t->transferFacts = CredRequestPrivate::TransferFacts();
     t->StartDeadline();
 }
 
@@ -73,7 +73,7 @@ bool ProcessWithTransport(CredRequest &request, bool report) {
         transport->error = inner->error;
         transport->curlCode = inner->curlCode;
         transport->curlErrorText = inner->curlErrorText;
-        transport->transferInfo = inner->transferInfo;
+        transport->transferFacts = inner->transferFacts;
     }
     return false;
 }
