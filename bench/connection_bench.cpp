@@ -31,6 +31,7 @@
 
 #include <curl/curl.h>
 
+#include "bench_support.h"
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_mgr.h"
 #include "kovacredential/kovacred.h"
@@ -42,6 +43,9 @@
 #include "support/temp_dir.h"
 
 namespace {
+
+using kova_bench::Median;
+using kova_bench::StatusKb;
 
 using Clock = std::chrono::steady_clock;
 
@@ -61,11 +65,6 @@ constexpr const char *kBody = "hello from nginx\n";
 
 double Since(Clock::time_point start) {
     return std::chrono::duration<double>(Clock::now() - start).count();
-}
-
-double Median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values.empty() ? 0 : values[values.size() / 2];
 }
 
 size_t AppendBody(char *data, size_t size, size_t nmemb, void *out) {
@@ -239,18 +238,6 @@ int MultiSide(const std::string &url) {
         curl_multi_remove_handle(multi.get(), easies[i].get());
     }
     return good;
-}
-
-// A "kB" line of /proc/self/status (VmHWM: the peak resident set); 0 when missing.
-long StatusKb(const char *field) {
-    std::ifstream status("/proc/self/status");
-    const std::string prefix = std::string(field) + ":";
-    for (std::string line; std::getline(status, line);) {
-        if (line.rfind(prefix, 0) == 0) {
-            return strtol(line.c_str() + prefix.size(), nullptr, 10);
-        }
-    }
-    return 0;
 }
 
 // The child: prints its seconds, peak resident set (kB) and right answers.

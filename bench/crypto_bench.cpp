@@ -24,6 +24,7 @@
 #include <openssl/param_build.h>
 #include <openssl/rsa.h>
 
+#include "bench_support.h"
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
 #include "kovacredential/kovacred.h"
@@ -31,6 +32,8 @@
 #include "simlib/webapi_sim.h"
 
 namespace {
+
+using kova_bench::Median;
 
 using Clock = std::chrono::steady_clock;
 
@@ -131,11 +134,6 @@ bool LegacyRsa(const std::string &modulusHex, const std::string &plain, std::str
     return true;
 }
 #pragma GCC diagnostic pop
-
-double Median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values[values.size() / 2];
-}
 
 // Seconds per call over `iterations` calls; negative when a call fails.
 double PerCall(const std::function<bool()> &op, int iterations) {

@@ -33,6 +33,7 @@
 
 #include <curl/curl.h>
 
+#include "bench_support.h"
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_mgr.h"
 #include "platform/json_text.h"
@@ -42,6 +43,9 @@
 extern char **environ;
 
 namespace {
+
+using kova_bench::Median;
+using kova_bench::StatusKb;
 
 using Clock = std::chrono::steady_clock;
 using Requests = std::vector<std::unique_ptr<KOVA::CredRequest>>;
@@ -55,11 +59,6 @@ constexpr int kRssRounds = 5;
 
 double Since(Clock::time_point start) {
     return std::chrono::duration<double>(Clock::now() - start).count();
-}
-
-double Median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values[values.size() / 2];
 }
 
 // A batch of requests and the answer each must bring back.
@@ -229,18 +228,6 @@ void Report(const char *title, const char *nameA, const char *nameB, const Figur
 }
 
 // ---- Memory
-
-// A "kB" line of /proc/self/status (VmRSS: resident now, VmHWM: its peak); 0 when missing.
-long StatusKb(const char *field) {
-    std::ifstream status("/proc/self/status");
-    const std::string prefix = std::string(field) + ":";
-    for (std::string line; std::getline(status, line);) {
-        if (line.rfind(prefix, 0) == 0) {
-            return strtol(line.c_str() + prefix.size(), nullptr, 10);
-        }
-    }
-    return 0;
-}
 
 size_t AppendToString(char *data, size_t size, size_t nmemb, void *out) {
     static_cast<std::string *>(out)->append(data, size * nmemb);

@@ -19,6 +19,7 @@
 
 #include <json/value.h>
 
+#include "bench_support.h"
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_farlink.h"
 #include "platform/json_text.h"
@@ -26,15 +27,12 @@
 
 namespace {
 
+using kova_bench::Median;
+
 using Clock = std::chrono::steady_clock;
 
 double Millis(Clock::duration d) {
     return std::chrono::duration<double, std::milli>(d).count();
-}
-
-double Median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values[values.size() / 2];
 }
 
 // One directory command exactly as the client sends it.

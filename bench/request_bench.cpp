@@ -18,10 +18,14 @@
 
 #include <curl/curl.h>
 
+#include "bench_support.h"
 #include "kovacredential/cred_request.h"
 #include "simlib/loopback_server.h"
 
 namespace {
+
+using kova_bench::Median;
+using kova_bench::StatusKb;
 
 using Clock = std::chrono::steady_clock;
 
@@ -84,31 +88,7 @@ double Seconds(int n, Fn fn, int &failures) {
     return std::chrono::duration<double>(Clock::now() - start).count();
 }
 
-double Median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values.empty() ? 0 : values[values.size() / 2];
-}
-
 constexpr size_t kDownloadBytes = 200u << 20;
-
-// A field of /proc/self/status in kB ("VmRSS", "VmHWM"); -1 when it cannot be read.
-long StatusKb(const char *field) {
-    FILE *status = fopen("/proc/self/status", "r");
-    if (status == nullptr) {
-        return -1;
-    }
-    char line[256];
-    long kb = -1;
-    const size_t length = strlen(field);
-    while (fgets(line, sizeof(line), status) != nullptr) {
-        if (strncmp(line, field, length) == 0 && line[length] == ':') {
-            kb = atol(line + length + 1);
-            break;
-        }
-    }
-    fclose(status);
-    return kb;
-}
 
 // How far `download` (which writes into the stream it is given) raises the peak resident set
 // above the resident set before it, in kB; -1 when the download fails or comes up short.

@@ -50,11 +50,14 @@
 
 #include <sqlite3.h>
 
+#include "bench_support.h"
 #include "kovacredential/kovacredential.h"
 
 extern char **environ;
 
 namespace {
+
+using kova_bench::Median;
 
 constexpr const char kPragma[] = "PRAGMA foreign_keys = ON;";
 constexpr const char kCredSchema[] =
@@ -590,11 +593,6 @@ double Rate(const Call &call, const std::function<void()> &op) {
         elapsed = std::chrono::duration<double>(Clock::now() - start).count();
     } while (elapsed < kSecondsPerRun && calls < kMaxCallsPerRun);
     return calls / elapsed;
-}
-
-double Median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values[values.size() / 2];
 }
 
 struct Result {
