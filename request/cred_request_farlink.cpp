@@ -166,15 +166,18 @@ bool CredRequestFarlinkPrivate::BoundRequest(CredRequest &request, long response
     if (!deadlineRunning) {
         return true;
     }
-    // Rounded up, so that a request cut short by it ends at or after the deadline and its
-    // failure is seen as the deadline's.
+    // Rounded up, plus the 2 ms that the request's and libcurl's whole-millisecond clocks may
+    // take off it (libcurl rounds the time spent up), so that a request cut short by it ends
+    // at or after the deadline and its failure is seen as the deadline's.
+    constexpr long long kClockRoundingMs = 2;
     const long long left =
         std::chrono::ceil<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now())
             .count();
     if (left <= 0) {
         return false;
     }
-    return request.SetTotalTimeout(static_cast<long>(std::min<long long>(left, LONG_MAX)));
+    return request.SetTotalTimeout(
+        static_cast<long>(std::min<long long>(left + kClockRoundingMs, LONG_MAX)));
 }
 
 // ---- Errors.

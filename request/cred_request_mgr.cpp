@@ -615,8 +615,15 @@ bool IsPollFailure(CURLMcode code) {
 #endif
 }
 
-// The held request whose transfer is `easy`, or null.
-CredRequest *RequestOf(CredRequestMgr &mgr, CURL *easy) {
+// The held request whose transfer is `easy` (the first in the manager's order), or null: from
+// the run's map when there is one, else by a walk through the slots.
+CredRequest *RequestOf(CredRequestMgr &mgr, CURL *easy, const RunControl *control) {
+    if (control != nullptr) {
+        auto known = control->requestOf.find(easy);
+        if (known != control->requestOf.end()) {
+            return known->second;
+        }
+    }
     for (int i = 0; i < mgr.Size(); ++i) {
         CredRequest *request = mgr.GetRequest(i);
         if (request != nullptr && HandleOf(request) == easy) {
@@ -636,13 +643,7 @@ void CollectFinished(CredRequestMgr &mgr, CURLM *multi, RunControl *control) {
             continue;
         }
         CURL *easy = message->easy_handle;
-        CredRequest *request = nullptr;
-        if (control != nullptr) {
-            auto known = control->requestOf.find(easy);
-            request = known != control->requestOf.end() ? known->second : RequestOf(mgr, easy);
-        } else {
-            request = RequestOf(mgr, easy);
-        }
+        CredRequest *request = RequestOf(mgr, easy, control);
         if (request != nullptr) {
             // libcurl's code, text and timing, as Process records them.
             CredRequestPrivate::Of(request)->NoteTransfer(message->data.result);
@@ -657,9 +658,7 @@ void CollectFinished(CredRequestMgr &mgr, CURLM *multi, RunControl *control) {
                 control->serverOf.erase(server);
             }
             auto &active = control->active;
-            active.erase(std::remove_if(active.begin(), active.end(),
-                                        [easy](CredRequest *r) { return HandleOf(r) == easy; }),
-                         active.end());
+            active.erase(std::remove(active.begin(), active.end(), request), active.end());
         }
     }
 }

@@ -107,7 +107,7 @@ class CredRequestPrivate {
     // The facts of the last transfer attempt as GetTransferInfo reports them; null before any.
     Json::Value TransferInfo() const;
     // The private object of `request` (null when its construction failed), for the library's
-    // own units that drive requests, such as the manager.
+    // own units that drive requests: the manager and the transport of inner requests.
     static CredRequestPrivate *Of(CredRequest *request) { return request->d; }
 
     // ---- libcurl's process-wide set-up.
@@ -130,7 +130,6 @@ class CredRequestPrivate {
     // its total time-out what is left of the transport's deadline (at least 1 ms), or the
     // transport's total time-out when no deadline runs.
     void TakeTransport(const CredRequestPrivate &transport);
-    static CredRequestPrivate *Of(CredRequest &request) { return request.d; }
 
     // Fills protocol, host and port of the request's own credential from `url`.
     bool buildCredByURL(const std::string &url);

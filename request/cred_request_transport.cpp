@@ -40,7 +40,7 @@ void CredRequestPrivate::TakeTransport(const CredRequestPrivate &transport) {
 
 TransportScope::TransportScope(CredRequest *transport)
     : saved_(tTransport), savedReported_(tReported) {
-    CredRequestPrivate *t = transport != nullptr ? CredRequestPrivate::Of(*transport) : nullptr;
+    CredRequestPrivate *t = transport != nullptr ? CredRequestPrivate::Of(transport) : nullptr;
     if (t == nullptr || transport == saved_) {
         return;
     }
@@ -59,9 +59,9 @@ TransportScope::~TransportScope() {
 }
 
 bool ProcessWithTransport(CredRequest &request, bool report) {
-    CredRequestPrivate *inner = CredRequestPrivate::Of(request);
+    CredRequestPrivate *inner = CredRequestPrivate::Of(&request);
     CredRequestPrivate *transport =
-        tTransport != nullptr ? CredRequestPrivate::Of(*tTransport) : nullptr;
+        tTransport != nullptr ? CredRequestPrivate::Of(tTransport) : nullptr;
     if (inner != nullptr && transport != nullptr) {
         inner->TakeTransport(*transport);
     }
