@@ -2,12 +2,13 @@
 //
 // A library call opens the database, runs its statements and closes it again. The raw side
 // does, for every call, exactly this:
-//   1. open(path, O_PATH | O_NOFOLLOW | O_CLOEXEC) and fstat: the path must name a regular file
-//      (the mode check; a link or anything else is refused);
-//   2. chmod("/proc/self/fd/N", 0600): the mode is set on the file that descriptor holds;
-//   3. sqlite3_open_v2(path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOFOLLOW) (the safe open);
-//   4. lstat(path), its device and inode compared with those of step 1, so that the file SQLite
-//      opened is the one whose mode was set; the descriptor is closed;
+//   1. open(path, O_PATH | O_CLOEXEC) and fstat: the path must name a regular file of the
+//      effective user (the type and owner checks; nothing is opened for reading yet);
+//   2. open(path, O_RDWR | O_NONBLOCK | O_NOCTTY | O_CLOEXEC), fstat, the device and inode
+//      compared with those of step 1, fchmod(0600) and close: the mode is set on that file;
+//   3. sqlite3_open_v2(path, SQLITE_OPEN_READWRITE);
+//   4. stat(path), its device and inode compared with those of step 1, so that the file SQLite
+//      opened is the one whose mode was set; the descriptor of step 1 is closed;
 //   5. sqlite3_exec of "PRAGMA foreign_keys = ON;" and of both "CREATE TABLE if not exists"
 //      statements;
 //   6. the call's statements, formatted with sqlite3_mprintf as the library formats them, each
@@ -20,8 +21,7 @@
 //      first: what the library's calls hand over, records the caller frees one by one;
 //   7. sqlite3_close.
 // It leaves out what its set-up makes unnecessary: the existence test and creation of a
-// missing file, resolving a linked folder, the lock retry and the log (the files exist, in a
-// folder reached without links, and no other process uses them).
+// missing file, the lock retry and the log (the files exist and no other process uses them).
 //
 // Each comparison alternates kRounds runs of the library and the raw side; a run lasts
 // kSecondsPerRun or kMaxCallsPerRun calls. Rates are medians of the runs, the ratio (library
@@ -150,26 +150,28 @@ using SqlText = std::unique_ptr<char, SqliteFree>;
 
 // Steps 1 to 5 of the header comment.
 RawDb RawOpen(const char *path) {
-    const int fd = open(path, O_PATH | O_NOFOLLOW | O_CLOEXEC);
-    struct stat held;
-    if (fd < 0 || fstat(fd, &held) != 0 || !S_ISREG(held.st_mode)) {
-        Fail("the raw open found no regular file");
+    const int held = open(path, O_PATH | O_CLOEXEC);
+    struct stat checked;
+    if (held < 0 || fstat(held, &checked) != 0 || !S_ISREG(checked.st_mode) ||
+        checked.st_uid != geteuid()) {
+        Fail("the raw open found no regular file of ours");
     }
-    char name[64];
-    snprintf(name, sizeof(name), "/proc/self/fd/%d", fd);
-    if (chmod(name, 0600) != 0) {
+    const int file = open(path, O_RDWR | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
+    struct stat opened;
+    if (file < 0 || fstat(file, &opened) != 0 || opened.st_dev != checked.st_dev ||
+        opened.st_ino != checked.st_ino || fchmod(file, 0600) != 0) {
         Fail("the raw open could not set the mode");
     }
+    close(file);
     sqlite3 *raw = nullptr;
-    const int rc =
-        sqlite3_open_v2(path, &raw, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOFOLLOW, nullptr);
+    const int rc = sqlite3_open_v2(path, &raw, SQLITE_OPEN_READWRITE, nullptr);
     RawDb db(raw);
     struct stat now;
-    if (rc != SQLITE_OK || lstat(path, &now) != 0 || now.st_dev != held.st_dev ||
-        now.st_ino != held.st_ino) {
+    if (rc != SQLITE_OK || stat(path, &now) != 0 || now.st_dev != checked.st_dev ||
+        now.st_ino != checked.st_ino) {
         Fail("the raw open failed");
     }
-    close(fd);
+    close(held);
     if (sqlite3_exec(db.get(), kPragma, nullptr, nullptr, nullptr) != SQLITE_OK ||
         sqlite3_exec(db.get(), kCredSchema, nullptr, nullptr, nullptr) != SQLITE_OK ||
         sqlite3_exec(db.get(), kSessSchema, nullptr, nullptr, nullptr) != SQLITE_OK) {

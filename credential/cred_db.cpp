@@ -169,13 +169,13 @@ const char *Text(const SqlText &sql) {
     return sql ? sql.get() : "";
 }
 
-// ExecWithRetry that logs a lasting failure as "<unit>:<line> Exec sql:[<text>] error: <msg>",
-// where the text is what logText() returns (made only when there is something to log).
-template <typename LogText>
-bool ExecLoggedAs(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg, int line,
-                  LogText logText) {
+// Logs a lasting failure of `run` (ExecWithRetry or StepWithRetry bound to its statement) as
+// "<unit>:<line> Exec sql:[<text>] error: <msg>", where the text is what logText() returns
+// (made only when there is something to log).
+template <typename Run, typename LogText>
+bool RunLogged(Run run, int line, LogText logText) {
     SqlText message;
-    const ExecResult result = ExecWithRetry(db, sql, callback, arg, &message);
+    const ExecResult result = run(&message);
     if (result == ExecResult::kFailed) {
         const auto shown = logText();
         Log("%s:%d Exec sql:[%s] error: %s\n", kUnit, line, Text(shown), message.get());
@@ -183,9 +183,23 @@ bool ExecLoggedAs(sqlite3 *db, const char *sql, sqlite3_callback callback, void 
     return result == ExecResult::kOk;
 }
 
+template <typename LogText>
+bool ExecLoggedAs(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg, int line,
+                  LogText logText) {
+    return RunLogged(
+        [&](SqlText *message) { return ExecWithRetry(db, sql, callback, arg, message); }, line,
+        logText);
+}
+
 // For statements without a secret: the log shows the statement itself.
 bool ExecLogged(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg, int line) {
     return ExecLoggedAs(db, sql, callback, arg, line, [sql] { return sql; });
+}
+
+// ExecLogged for a single statement whose rows `row` reads from the statement.
+bool StepLogged(sqlite3 *db, const char *sql, StatementRow row, void *arg, int line) {
+    return RunLogged([&](SqlText *message) { return StepWithRetry(db, sql, row, arg, message); },
+                     line, [sql] { return sql; });
 }
 
 // An open file descriptor, closed when the owner goes.
@@ -325,7 +339,7 @@ Record *ReadList(sqlite3 *db, const char *base, const char *whereFormat, const c
         return head;
     }
     ListReader<Record> reader;
-    ExecLogged(db, sql.get(), ListReader<Record>::Row, &reader, line);
+    StepLogged(db, sql.get(), ListReader<Record>::Row, &reader, line);
     return reader.head;
 }
 
@@ -341,7 +355,7 @@ int NewestCredIdByApplication(sqlite3 *db, const char *application) {
     SqlText sql = FormatListStatement(kCredSelectAll, " WHERE %q", nullptr, nullptr, 0);
     ApplicationMatch match(application);
     if (sql) {
-        ExecLogged(db, sql.get(), ApplicationMatch::Row, &match, kLineGetListExec);
+        StepLogged(db, sql.get(), ApplicationMatch::Row, &match, kLineGetListExec);
     }
     return match.id;
 }
@@ -372,16 +386,19 @@ uint32_t LockBackoffMicros(int randomValue) {
     return static_cast<uint32_t>(sum) <= 999999u ? static_cast<uint32_t>(sum) : 999999u;
 }
 
-ExecResult ExecWithRetry(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg,
-                         SqlText *errorMessage) {
+namespace {
+
+// Runs `runOnce` (true on success, else SQLite's message in its argument, null when there is
+// none) until it succeeds, fails otherwise than on a locked database, or has run
+// kLockAttempts times.
+template <typename RunOnce>
+ExecResult RetryWhileLocked(RunOnce runOnce, SqlText *errorMessage) {
     int attemptsLeft = kLockAttempts;
     for (;;) {
-        char *raw = nullptr;
-        if (sqlite3_exec(db, sql, callback, arg, &raw) == SQLITE_OK) {
-            sqlite3_free(raw);
+        SqlText message;
+        if (runOnce(&message)) {
             return ExecResult::kOk;
         }
-        SqlText message(raw);
         if (!message) {
             return ExecResult::kFailedSilently;
         }
@@ -391,6 +408,48 @@ ExecResult ExecWithRetry(sqlite3 *db, const char *sql, sqlite3_callback callback
         }
         SleepFully(LockBackoffMicros(rand()));
     }
+}
+
+// One run of a single statement with sqlite3_exec's outcome: true, or false with the message
+// sqlite3_exec would give (a copy of sqlite3_errmsg, "out of memory" where a row was aborted).
+bool StepOnce(sqlite3 *db, const char *sql, StatementRow row, void *arg, SqlText *message) {
+    sqlite3_stmt *stmt = nullptr;
+    int rc = sqlite3_prepare_v2(db, sql, -1, &stmt, nullptr);
+    bool aborted = false;
+    if (rc == SQLITE_OK && stmt != nullptr) {
+        while ((rc = sqlite3_step(stmt)) == SQLITE_ROW) {
+            if (!row(arg, stmt)) {
+                aborted = true;
+                break;
+            }
+        }
+        sqlite3_finalize(stmt);
+    }
+    if (rc == SQLITE_OK || (rc == SQLITE_DONE && !aborted)) {
+        return true;
+    }
+    message->reset(sqlite3_mprintf("%s", aborted ? "out of memory" : sqlite3_errmsg(db)));
+    return false;
+}
+
+}  // namespace
+
+ExecResult ExecWithRetry(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg,
+                         SqlText *errorMessage) {
+    return RetryWhileLocked(
+        [&](SqlText *message) {
+            char *raw = nullptr;
+            const bool ok = sqlite3_exec(db, sql, callback, arg, &raw) == SQLITE_OK;
+            message->reset(raw);
+            return ok;
+        },
+        errorMessage);
+}
+
+ExecResult StepWithRetry(sqlite3 *db, const char *sql, StatementRow row, void *arg,
+                         SqlText *errorMessage) {
+    return RetryWhileLocked([&](SqlText *message) { return StepOnce(db, sql, row, arg, message); },
+                            errorMessage);
 }
 
 }  // namespace cred

@@ -60,9 +60,18 @@ enum class ExecResult {
 
 // Executes `sql` with sqlite3_exec, retrying while SQLite reports "database is locked"
 // (kLockAttempts executions at most, a LockBackoffMicros pause slept in full before each
-// retry). On
-// kFailed, *errorMessage holds SQLite's message of the last attempt.
+// retry). On kFailed, *errorMessage holds SQLite's message of the last attempt.
 ExecResult ExecWithRetry(sqlite3 *db, const char *sql, sqlite3_callback callback, void *arg,
+                         SqlText *errorMessage);
+
+// A row callback that reads the current row of a statement with sqlite3_column_*; false
+// aborts the statement as a failed allocation inside sqlite3_exec does.
+using StatementRow = bool (*)(void *arg, sqlite3_stmt *stmt);
+
+// ExecWithRetry for a text that holds a single statement, whose rows `row` reads from the
+// statement itself: typed columns need no round trip through text. The outcome, the retry
+// and the messages are those of sqlite3_exec running the same text.
+ExecResult StepWithRetry(sqlite3 *db, const char *sql, StatementRow row, void *arg,
                          SqlText *errorMessage);
 
 // Opens the database as KOVACredDBInit does, owning the connection.
@@ -83,40 +92,39 @@ int ListNewestCredIdByApplication(const char *application);
 void CredRowToRecord(KOVA_CRED *pCred, int nCol, char **azVal, char **azCol);
 void CredSessRowToRecord(KOVA_CRED_SESS *pSess, int nCol, char **azVal, char **azCol);
 
-// Reads the rows of one SELECT into a list, newest row first, exactly as CredRowAppend and
-// CredSessRowAppend do, but finds the member each column fills from the first row's names
-// only. sqlite3_exec hands every row of one statement the same array of names, so the text it
-// runs must hold a single statement. Pass the reader as the callback's argument.
+// Reads the rows of one SELECT into a list, newest row first, with the records CredRowAppend
+// and CredSessRowAppend make of the same rows, but finds the member each column fills once
+// per statement. An integer column is read as an integer, not through its text. Run it with
+// StepWithRetry, the reader as the argument.
+constexpr size_t kListMembers = 12;
 template <typename Record>
 class ListReader {
   public:
-    static int Row(void *pArg, int nCol, char **azVal, char **azCol);
+    static bool Row(void *reader, sqlite3_stmt *stmt);
     Record *head = nullptr;
 
   private:
-    // Whether members_ holds the layout of these names (learning it when not); false when
-    // memory ran out, and the row is then copied by name.
-    bool Learn(int nCol, char **azCol);
-    char **names_ = nullptr;
-    std::vector<int> members_;
+    // Learns which column fills each member (the record's integer members, then its strings).
+    void Learn(sqlite3_stmt *stmt);
+    bool learnt_ = false;
+    int columns_[kListMembers];
 };
 extern template class ListReader<KOVA_CRED>;
 extern template class ListReader<KOVA_CRED_SESS>;
 
 // Finds among the credential rows of one SELECT the id of the last whose application equals
 // `application` byte for byte (a NULL column reads as ""): the id a list of those rows,
-// filtered by KOVACredKeepByApplication, starts with. `id` stays -1 when none matches. Pass
-// the match as the callback's argument; the text run must hold a single statement.
+// filtered by KOVACredKeepByApplication, starts with. `id` stays -1 when none matches. Run it
+// with StepWithRetry, the match as the argument.
 class ApplicationMatch {
   public:
     explicit ApplicationMatch(const char *application) : application_(application) {}
-    static int Row(void *pArg, int nCol, char **azVal, char **azCol);
+    static bool Row(void *match, sqlite3_stmt *stmt);
     int id = -1;
 
   private:
     const char *application_;
-    char **names_ = nullptr;
-    int count_ = -1;
+    bool learnt_ = false;
     int idColumn_ = -1;
     int applicationColumn_ = -1;
 };

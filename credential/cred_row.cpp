@@ -5,6 +5,8 @@
 #include <stdlib.h>
 #include <string.h>
 
+#include <algorithm>
+#include <iterator>
 #include <new>
 #include <string>
 #include <vector>
@@ -65,6 +67,16 @@ const StringColumn<KOVA_CRED_SESS> kSessStringColumns[] = {
 // converts as strtol does where long is 32 bits: a value beyond the range saturates rather
 // than wrapping. Up to 18 digits after an optional minus sign, which covers everything this
 // library stores, are read here; any other text goes through strtoll.
+int32_t Saturated(int64_t value) {
+    if (value > INT32_MAX) {
+        return INT32_MAX;
+    }
+    if (value < INT32_MIN) {
+        return INT32_MIN;
+    }
+    return static_cast<int32_t>(value);
+}
+
 int32_t ColumnInt(const char *text) {
     if (text == nullptr) {
         return 0;
@@ -81,13 +93,46 @@ int32_t ColumnInt(const char *text) {
     } else if (negative) {
         value = -value;
     }
-    if (value > INT32_MAX) {
-        return INT32_MAX;
+    return Saturated(value);
+}
+
+// A column of the statement's current row as sqlite3_exec hands it over: its text, or null for
+// NULL. False when SQLite could not make the text, where sqlite3_exec fails for want of memory.
+inline bool ColumnText(sqlite3_stmt *stmt, int column, const char **text) {
+    *text = reinterpret_cast<const char *>(sqlite3_column_text(stmt, column));
+    return *text != nullptr || sqlite3_column_type(stmt, column) == SQLITE_NULL;
+}
+
+// The integer an integer member reads from a column: the stored integer itself where the
+// column holds one (the number its decimal text reads as), else what ColumnInt makes of the
+// text. False as for ColumnText.
+inline bool ColumnInteger(sqlite3_stmt *stmt, int column, int32_t *value) {
+    // The column's value object is only asked its type and integer, which neither convert nor
+    // allocate: one call into SQLite where sqlite3_column_type and sqlite3_column_int64 take two.
+    sqlite3_value *stored = sqlite3_column_value(stmt, column);
+    if (sqlite3_value_type(stored) == SQLITE_INTEGER) {
+        *value = Saturated(sqlite3_value_int64(stored));
+        return true;
     }
-    if (value < INT32_MIN) {
-        return INT32_MIN;
+    const char *text = nullptr;
+    if (!ColumnText(stmt, column, &text)) {
+        return false;
     }
-    return static_cast<int32_t>(value);
+    *value = ColumnInt(text);
+    return true;
+}
+
+// Makes the empty string `empty` hold `text`, built in place as a new string is: the copy a
+// move from a temporary takes, and the checks of an assignment, cost a list read a tenth of
+// its time. If building throws, `empty` is left an empty string again.
+inline void Rebuild(std::string &empty, const char *text) {
+    empty.~basic_string();
+    try {
+        new (&empty) std::string(text);
+    } catch (...) {
+        new (&empty) std::string();
+        throw;
+    }
 }
 
 // The member a column fills: an index into the record's integer columns, then into its
@@ -97,6 +142,9 @@ constexpr int kNoMember = -1;
 template <typename Record, size_t NInt, size_t NString>
 int MemberOf(const char *name, const IntColumn<Record> (&intColumns)[NInt],
              const StringColumn<Record> (&stringColumns)[NString]) {
+    if (name == nullptr) {
+        return kNoMember;
+    }
     const size_t length = strlen(name);
     for (size_t i = 0; i < NInt; ++i) {
         if (intColumns[i].name.Is(name, length)) {
@@ -197,39 +245,62 @@ void CredSessRowToRecord(KOVA_CRED_SESS *pSess, int nCol, char **azVal, char **a
 }
 
 template <typename Record>
-bool ListReader<Record>::Learn(int nCol, char **azCol) {
-    if (azCol == names_ && static_cast<size_t>(nCol) == members_.size()) {
-        return true;
+void ListReader<Record>::Learn(sqlite3_stmt *stmt) {
+    static_assert(
+        std::size(Columns<Record>::ints) + std::size(Columns<Record>::strings) <= kListMembers,
+        "every member has a column slot");
+    learnt_ = true;
+    std::fill(std::begin(columns_), std::end(columns_), kNoMember);
+    const int count = sqlite3_column_count(stmt);
+    for (int i = 0; i < count; ++i) {
+        const int member =
+            MemberOf(sqlite3_column_name(stmt, i), Columns<Record>::ints, Columns<Record>::strings);
+        if (member != kNoMember) {
+            columns_[member] = i;  // as in a record, a later column of the same name wins
+        }
     }
-    names_ = nullptr;
-    try {
-        members_.resize(static_cast<size_t>(nCol));
-    } catch (const std::bad_alloc &) {
-        return false;
-    }
-    for (int i = 0; i < nCol; ++i) {
-        members_[i] = MemberOf(azCol[i], Columns<Record>::ints, Columns<Record>::strings);
-    }
-    names_ = azCol;
-    return true;
 }
 
 template <typename Record>
-int ListReader<Record>::Row(void *pArg, int nCol, char **azVal, char **azCol) {
+bool ListReader<Record>::Row(void *pArg, sqlite3_stmt *stmt) {
+    constexpr auto &ints = Columns<Record>::ints;
+    constexpr auto &strings = Columns<Record>::strings;
+    constexpr size_t kInts = std::size(ints);
     auto *reader = static_cast<ListReader *>(pArg);
-    const bool learnt = reader->Learn(nCol, azCol);
-    return RowAppend<Record>(&reader->head, nCol, azVal, azCol,
-                             [reader, learnt](Record *rec, int n, char **vals, char **names) {
-                                 if (!learnt) {
-                                     RowToRecord(rec, n, vals, names, Columns<Record>::ints,
-                                                 Columns<Record>::strings);
-                                     return;
-                                 }
-                                 for (int i = 0; i < n; ++i) {
-                                     CopyColumn(rec, reader->members_[i], vals[i],
-                                                Columns<Record>::ints, Columns<Record>::strings);
-                                 }
-                             });
+    if (!reader->learnt_) {
+        reader->Learn(stmt);
+    }
+    // As in RowAppend: a record that cannot be made is left out and the rows go on.
+    Record *node = new (std::nothrow) Record();
+    if (node == nullptr) {
+        return true;
+    }
+    node->filled = 1;
+    bool copied = true;
+    for (size_t m = 0; m < kInts && copied; ++m) {
+        const int column = reader->columns_[m];
+        copied = column == kNoMember || ColumnInteger(stmt, column, &(node->*ints[m].member));
+    }
+    try {
+        for (size_t m = 0; m < std::size(strings) && copied; ++m) {
+            const int column = reader->columns_[kInts + m];
+            const char *text = nullptr;
+            copied = column == kNoMember || ColumnText(stmt, column, &text);
+            if (copied && column != kNoMember) {
+                Rebuild(node->*strings[m].member, text != nullptr ? text : "");
+            }
+        }
+    } catch (const std::bad_alloc &) {
+        delete node;
+        return true;
+    }
+    if (!copied) {
+        delete node;
+        return false;
+    }
+    node->next = reader->head;
+    reader->head = node;
+    return true;
 }
 
 template class ListReader<KOVA_CRED>;
@@ -240,29 +311,35 @@ constexpr ColumnName kIdColumn("id");
 constexpr ColumnName kApplicationColumn("application");
 }  // namespace
 
-int ApplicationMatch::Row(void *pArg, int nCol, char **azVal, char **azCol) {
+bool ApplicationMatch::Row(void *pArg, sqlite3_stmt *stmt) {
     auto *match = static_cast<ApplicationMatch *>(pArg);
-    if (azCol != match->names_ || nCol != match->count_) {
+    if (!match->learnt_) {
         // As in a record, a later column of the same name wins.
-        match->idColumn_ = -1;
-        match->applicationColumn_ = -1;
-        for (int i = 0; i < nCol; ++i) {
-            const size_t length = strlen(azCol[i]);
-            if (kIdColumn.Is(azCol[i], length)) {
+        match->learnt_ = true;
+        const int count = sqlite3_column_count(stmt);
+        for (int i = 0; i < count; ++i) {
+            const char *name = sqlite3_column_name(stmt, i);
+            const size_t length = name != nullptr ? strlen(name) : 0;
+            if (name != nullptr && kIdColumn.Is(name, length)) {
                 match->idColumn_ = i;
-            } else if (kApplicationColumn.Is(azCol[i], length)) {
+            } else if (name != nullptr && kApplicationColumn.Is(name, length)) {
                 match->applicationColumn_ = i;
             }
         }
-        match->names_ = azCol;
-        match->count_ = nCol;
     }
-    const char *application =
-        match->applicationColumn_ >= 0 ? azVal[match->applicationColumn_] : nullptr;
+    const char *application = nullptr;
+    if (match->applicationColumn_ >= 0 &&
+        !ColumnText(stmt, match->applicationColumn_, &application)) {
+        return false;
+    }
     if (strcmp(application != nullptr ? application : "", match->application_) == 0) {
-        match->id = match->idColumn_ >= 0 ? ColumnInt(azVal[match->idColumn_]) : -1;
+        int32_t id = -1;
+        if (match->idColumn_ >= 0 && !ColumnInteger(stmt, match->idColumn_, &id)) {
+            return false;
+        }
+        match->id = id;
     }
-    return 0;
+    return true;
 }
 
 }  // namespace cred

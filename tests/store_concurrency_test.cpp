@@ -94,6 +94,12 @@ TEST_F(LockTest, LockedWriteIsTried101TimesThenLoggedOnce) {
     EXPECT_EQ(counter.count, 101);
     EXPECT_EQ(kova_test::LogRecords(), (Texts{"cred_db:242 Exec sql:[SELECT * FROM credentials "
                                               "WHERE id=1;] error: database is locked\n"}));
+    counter = {"SELECT * FROM credentials"};
+    kova_test::ClearLog();
+    EXPECT_EQ(KOVACredDBRecordGetList(conn.get(), nullptr, nullptr, 0), nullptr);
+    EXPECT_EQ(counter.count, 101);
+    EXPECT_EQ(kova_test::LogRecords(), (Texts{"cred_db:297 Exec sql:[SELECT * FROM credentials;] "
+                                              "error: database is locked\n"}));
 
     // Through the interface the open's schema statement meets the lock first.
     kova_test::ClearLog();

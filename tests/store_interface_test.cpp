@@ -260,6 +260,25 @@ TEST_F(InterfaceTest, ListIsNewestFirstFilteredAndLookedUpByApplication) {
     EXPECT_EQ(KOVACredIDGetByApplication("backup"), 4);
     EXPECT_EQ(KOVACredIDGetByApplication(""), 7);
     EXPECT_EQ(KOVACredIDGetByApplication("h9"), -1);
+
+    // Integer members read what the row's text reads as, whatever the column holds: a real
+    // number is cut at its point (even past the range), a text read as strtol reads it, an
+    // integer beyond 32 bits saturates. A list and a read by id agree on every member.
+    ASSERT_TRUE(Query("DELETE FROM credentials; INSERT INTO credentials VALUES ('odd', 'n', "
+                      "7001.9, 'h', 11, ' 42abc'), ('odd', 'n', -5e30, 'h', 12, 99999999999), "
+                      "('odd', 'n', NULL, 'h', 13, -99999999999);")
+                    .empty());
+    ASSERT_EQ(KOVACredListGet(&list, nullptr, nullptr), 3);
+    std::vector<Ints> listed;
+    for (const KOVA_CRED *cred = list; cred != nullptr; cred = cred->next) {
+        listed.push_back({cred->id, cred->port, cred->ctime});
+        CredPtr byId = NewCred();
+        ASSERT_EQ(KOVACredGetByID(cred->id, byId.get()), 0);
+        EXPECT_EQ(listed.back(), (Ints{byId->id, byId->port, byId->ctime}));
+    }
+    EXPECT_EQ(listed, (std::vector<Ints>{{13, 0, INT32_MIN}, {12, -5, INT32_MAX}, {11, 7001, 42}}));
+    KOVACredListFree(&list);
+    EXPECT_EQ(KOVACredIDGetByApplication("odd"), 13);
     EXPECT_TRUE(kova_test::LogRecords().empty()) << kova_test::LogDump();
 }
 
