@@ -54,7 +54,9 @@ constexpr int kConcurrent = 1000;
 constexpr int kLinkCalls = 20;
 constexpr int kLinkRttMs = 50;
 constexpr int kWebApiCalls = 10;
-constexpr int kRounds = 3;
+// Rounds of (1): each takes a few milliseconds, so that one slow moment of the machine would
+// decide the figure of a few.
+constexpr int kRounds = 15;
 // The library's side of (2) takes seconds before connections are reused: one round each.
 constexpr int kConcurrentRounds = 1;
 // Debian's interpreter, which python3-requests installs into (a python3 earlier on the PATH
@@ -397,13 +399,26 @@ int main(int argc, char **argv) {
     const std::string url = nginx.BaseUrl() + "/small";
     Sequential first;
     for (int round = 0; round < kRounds; ++round) {
-        nginx.ClearLog();
-        first.library.push_back(Counted([&] { return LibraryGets(url, kSequential); },
-                                        counter(kSequential), &first.libraryConnections,
-                                        &first.good));
-        nginx.ClearLog();
-        first.raw.push_back(Counted([&] { return RawHandleGets(url, kSequential); },
-                                    counter(kSequential), &first.rawConnections, &first.good));
+        const auto library = [&] {
+            nginx.ClearLog();
+            first.library.push_back(Counted([&] { return LibraryGets(url, kSequential); },
+                                            counter(kSequential), &first.libraryConnections,
+                                            &first.good));
+        };
+        const auto raw = [&] {
+            nginx.ClearLog();
+            first.raw.push_back(Counted([&] { return RawHandleGets(url, kSequential); },
+                                        counter(kSequential), &first.rawConnections, &first.good));
+        };
+        // Which side goes first alternates, so that neither always meets a machine the
+        // other has just warmed or loaded.
+        if (round % 2 == 0) {
+            library();
+            raw();
+        } else {
+            raw();
+            library();
+        }
         nginx.ClearLog();
         first.python.push_back(Counted([&] { return PythonSessionGets(url, kSequential); },
                                        counter(kSequential), &first.pythonConnections,
