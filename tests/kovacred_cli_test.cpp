@@ -701,24 +701,28 @@ TEST_F(KovacredTest, BatchInterruptedPrintsWhatFinished) {
 TEST_F(KovacredTest, TransportOptionsCheckTheServerAndBoundTheTime) {
     kova_test::TestCa ca;
     const kova_test::TlsIdentity identity = ca.Issue("IP:127.0.0.1");
-    kova_test::TlsServer tls(identity);
-    ASSERT_TRUE(tls.Start());
+    kovasim::LoopbackServer tls(HttpsWith(identity));
+    tls.Route("GET", "/ok", [](const httplib::Request &, httplib::Response &res) {
+        res.set_content("secure", "text/plain");
+    });
+    ASSERT_TRUE(tls.Start()) << tls.Error();
+    const std::string url = tls.BaseUrl() + "/ok";
     const std::string caFile = db_.dir().File("ca.pem");
     std::ofstream(caFile) << ca.CertPem();
     const std::string known = db_.dir().File("known_servers");
-    const std::string server = tls.Url().substr(8, tls.Url().find("/ok") - 8);
+    const std::string server = "127.0.0.1:" + std::to_string(tls.Port());
     const std::string unverified =
         "failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other libcurl failure): curl 60: ";
 
-    Result r = Run("request " + tls.Url());
+    Result r = Run("request " + url);
     EXPECT_EQ(r.out, "secure") << r.err;
-    r = Run("request --verify " + tls.Url());
+    r = Run("request --verify " + url);
     EXPECT_EQ(r.status, 12);
     EXPECT_EQ(r.err.rfind("kovacred: request " + unverified, 0), 0u) << r.err;
-    EXPECT_EQ(Run("request --cacert " + caFile + " " + tls.Url()).out, "secure");
+    EXPECT_EQ(Run("request --cacert " + caFile + " " + url).out, "secure");
 
     // Trust on first use: the key is recorded, then required.
-    r = Run("request --pin " + tls.Url());
+    r = Run("request --pin " + url);
     EXPECT_EQ(r.out, "secure");
     EXPECT_EQ(r.err, "kovacred: pinned the public key of " + server + " (" + identity.pin +
                          ") in " + known + "\n");
@@ -726,13 +730,13 @@ TEST_F(KovacredTest, TransportOptionsCheckTheServerAndBoundTheTime) {
     struct stat st;
     ASSERT_EQ(stat(known.c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 0777, 0600u);
-    r = Run("request --pin " + tls.Url());
+    r = Run("request --pin " + url);
     EXPECT_EQ(r.out, "secure");
     EXPECT_EQ(r.err, "");
     const std::string other = ca.Issue("IP:127.0.0.1").pin;
     std::ofstream(known) << server << " " << other << "\n";
-    const int served = tls.Requests();
-    r = Run("request --pin " + tls.Url());
+    const size_t served = tls.RequestCount();
+    r = Run("request --pin " + url);
     EXPECT_EQ(r.status, 12);
     EXPECT_EQ(r.err,
               "kovacred: request failed (error 12 CRED_REQ_ERR_CURL_OTHER: any other "
@@ -740,7 +744,7 @@ TEST_F(KovacredTest, TransportOptionsCheckTheServerAndBoundTheTime) {
                   server + " has changed: known " + other + ", now " + identity.pin +
                   "; if the change is expected, delete the line of " + server + " from " + known +
                   " and run again\n");
-    EXPECT_EQ(tls.Requests(), served) << "the request reached a server with another key";
+    EXPECT_EQ(tls.RequestCount(), served) << "the request reached a server with another key";
 
     // The WebAPI commands against the simulator's self-signed certificate.
     Add("admin", "secret", true);

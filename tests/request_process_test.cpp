@@ -721,10 +721,13 @@ TEST_F(HttpsTest, PrivateCAHostNamesAndPinnedKeys) {
     for (const Case &c : cases) {
         SCOPED_TRACE(c.name);
         kova_test::ClearLog();
-        kova_test::TlsServer server(c.served);
-        ASSERT_TRUE(server.Start());
+        kovasim::LoopbackServer server(kova_test::HttpsWith(c.served));
+        server.Route("GET", "/ok", [](const httplib::Request &, httplib::Response &res) {
+            res.set_content("secure", "text/plain");
+        });
+        ASSERT_TRUE(server.Start()) << server.Error();
         KOVA::CredRequest req;
-        ASSERT_TRUE(req.SetURL(server.Url()));
+        ASSERT_TRUE(req.SetURL(server.BaseUrl() + "/ok"));
         Trust trust;
         int calls = 0;
         if (c.check == kVerify) {
@@ -743,7 +746,7 @@ TEST_F(HttpsTest, PrivateCAHostNamesAndPinnedKeys) {
         const bool ok = c.curlCode == CURLE_OK;
         EXPECT_EQ(req.Process(true, 0), ok) << kova_test::LogDump();
         EXPECT_EQ(req.GetCurlCode(), c.curlCode) << req.GetCurlErrorText();
-        EXPECT_EQ(server.Requests(), ok ? 1 : 0);
+        EXPECT_EQ(server.RequestCount(), ok ? 1u : 0u);
         EXPECT_EQ(trust.calls + calls, c.check == kCallback ? 1 : 0);
         if (ok) {
             EXPECT_EQ(req.GetResponse(), "secure");

@@ -461,21 +461,8 @@ TEST_F(DatabaseTest, HostileTextRoundTripsAndInjectsNothing) {
 // ---- A hostile or broken environment: the open fails cleanly with its log, the callers report
 // the inner error, and nothing is changed or created through a link.
 
-bool WriteFile(const std::string &path, const std::string &content, mode_t mode) {
-    kova_test::File f(fopen(path.c_str(), "w"));
-    return f && fwrite(content.data(), 1, content.size(), f.get()) == content.size() &&
-           chmod(path.c_str(), mode) == 0;
-}
-
-// The whole content of a file (empty when it cannot be read).
-std::string ReadFile(const std::string &path) {
-    std::string content;
-    kova_test::File f(fopen(path.c_str(), "r"));
-    for (int c; f && (c = fgetc(f.get())) != EOF;) {
-        content += static_cast<char>(c);
-    }
-    return content;
-}
+using kova_test::ReadFile;
+using kova_test::WriteFile;
 
 struct PathCase {
     const char *name;

@@ -11,10 +11,11 @@
 #include <unistd.h>
 
 #include <chrono>
-#include <fstream>
 #include <set>
 #include <sstream>
 #include <thread>
+
+#include "support/tls_certs.h"
 
 extern char **environ;
 
@@ -62,12 +63,6 @@ bool Accepts(int port) {
     return ok;
 }
 
-std::string ReadFile(const std::string &path) {
-    std::stringstream text;
-    text << std::ifstream(path, std::ios::binary).rdbuf();
-    return text.str();
-}
-
 void Sleep(int ms) {
     std::this_thread::sleep_for(std::chrono::milliseconds(ms));
 }
@@ -86,15 +81,15 @@ std::string NginxServer::BaseUrl() const {
     return std::string(options_.tls ? "https" : "http") + "://127.0.0.1:" + std::to_string(port_);
 }
 
+// A certificate for "localhost" and 127.0.0.1 issued by a CA of its own, whose certificate
+// clients may trust.
 bool NginxServer::MakeCertificate() {
-    const std::string command =
-        "openssl req -x509 -newkey rsa:2048 -nodes -days 7 -subj /CN=localhost"
-        " -addext subjectAltName=DNS:localhost,IP:127.0.0.1 -keyout '" +
-        dir_.File("key.pem") + "' -out '" + dir_.File("cert.pem") + "' 2>'" +
-        dir_.File("openssl.err") + "'";
-    if (RunCommand(command) != 0) {
-        error_ = "openssl could not make a certificate (scripts/setup installs openssl): " +
-                 ReadFile(dir_.File("openssl.err"));
+    const TestCa ca;
+    const TlsIdentity identity = ca.Issue("DNS:localhost,IP:127.0.0.1");
+    if (identity.certPem.empty() || !WriteFile(dir_.File("ca.pem"), ca.CertPem()) ||
+        !WriteFile(dir_.File("cert.pem"), identity.certPem) ||
+        !WriteFile(dir_.File("key.pem"), identity.keyPem)) {
+        error_ = "cannot make a certificate in " + dir_.path();
         return false;
     }
     return true;
@@ -146,10 +141,7 @@ bool NginxServer::WriteConfig() {
     }
     c << "    " << options_.extraServer << "\n  }\n}\n";
 
-    std::ofstream out(dir_.File("nginx.conf"));
-    out << c.str();
-    out.close();
-    if (!out) {
+    if (!WriteFile(dir_.File("nginx.conf"), c.str())) {
         error_ = "cannot write " + dir_.File("nginx.conf");
         return false;
     }

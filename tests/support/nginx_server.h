@@ -2,8 +2,8 @@
 // server: TLS with HTTP/2, keep-alive under its own settings, and an access log from which a
 // test reads how many connections the clients opened.
 //
-// Every instance has its own prefix folder (mkdtemp) holding the configuration, a self-signed
-// certificate for "localhost" and 127.0.0.1 (made with the openssl tool), the logs and nginx's
+// Every instance has its own prefix folder (mkdtemp) holding the configuration, a certificate
+// for "localhost" and 127.0.0.1 issued by a fresh TestCa (and that CA's), the logs and nginx's
 // temporary folders, and listens on a free port of 127.0.0.1. Locations served:
 //   /small     a short static body ("hello from nginx\n")
 //   /echo      the request body back (needs Debian's echo module; GET answers an empty body)
@@ -56,8 +56,8 @@ class NginxServer {
 
     // Writes the prefix folder and starts nginx, waiting (at most ten seconds) until it
     // accepts connections. A port taken by someone else in between is replaced by another
-    // (a few attempts). False with Error() set when nginx or openssl is missing or nginx did
-    // not come up; Error() then carries nginx's own error log.
+    // (a few attempts). False with Error() set when nginx is missing or nginx did not come
+    // up; Error() then carries nginx's own error log.
     bool Start();
     void Stop();
     const std::string &Error() const { return error_; }
@@ -66,7 +66,7 @@ class NginxServer {
     // "https://127.0.0.1:PORT" or "http://..." (no trailing slash).
     std::string BaseUrl() const;
     // The PEM certificate file clients may trust to verify the server (CA file).
-    std::string CertificateFile() const { return dir_.File("cert.pem"); }
+    std::string CertificateFile() const { return dir_.File("ca.pem"); }
     const std::string &Prefix() const { return dir_.path(); }
 
     // The access log so far, in order of completion. nginx writes a line once it has

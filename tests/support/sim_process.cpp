@@ -11,12 +11,6 @@
 
 namespace kova_test {
 
-std::string ReadFile(const std::string &path) {
-    std::stringstream text;
-    text << std::ifstream(path, std::ios::binary).rdbuf();
-    return text.str();
-}
-
 SimProcess::SimProcess(const TempDir &dir, const std::string &args, int relayHosts)
     : portsFile_(dir.File("kovasim.ports")), errorFile_(dir.File("kovasim.err")) {
     pid_ = fork();

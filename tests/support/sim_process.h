@@ -12,9 +12,6 @@
 
 namespace kova_test {
 
-// The whole content of the file at `path` ("" when it cannot be read).
-std::string ReadFile(const std::string &path);
-
 class SimProcess {
   public:
     // Runs `kovasim ARGS` and waits (at most 60 s, for an emulated kovasim making its key)

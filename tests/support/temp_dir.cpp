@@ -2,9 +2,12 @@
 
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 
 #include <filesystem>
+#include <fstream>
+#include <sstream>
 #include <stdexcept>
 
 namespace kova_test {
@@ -36,6 +39,18 @@ TempDatabase::TempDatabase() : db_(dir_.File("credentials.sqlite")) {
 
 TempDatabase::~TempDatabase() {
     old_ ? setenv("kovacredential_db", old_->c_str(), 1) : unsetenv("kovacredential_db");
+}
+
+std::string ReadFile(const std::string &path) {
+    std::stringstream text;
+    text << std::ifstream(path, std::ios::binary).rdbuf();
+    return text.str();
+}
+
+bool WriteFile(const std::string &path, const std::string &content, mode_t mode) {
+    File f(fopen(path.c_str(), "w"));
+    return f && fwrite(content.data(), 1, content.size(), f.get()) == content.size() &&
+           fflush(f.get()) == 0 && chmod(path.c_str(), mode) == 0;
 }
 
 int RunCommand(const std::string &command, std::string *out) {

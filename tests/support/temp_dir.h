@@ -3,6 +3,7 @@
 #define KOVA_TESTS_SUPPORT_TEMP_DIR_H
 
 #include <stdio.h>
+#include <sys/types.h>
 
 #include <memory>
 #include <optional>
@@ -48,6 +49,12 @@ struct FileCloser {
     }
 };
 using File = std::unique_ptr<FILE, FileCloser>;
+
+// The whole content of the file at `path` ("" when it cannot be read).
+std::string ReadFile(const std::string &path);
+// Writes `content` to the file at `path` (created or replaced) and gives it `mode`; true when
+// all of it was written.
+bool WriteFile(const std::string &path, const std::string &content, mode_t mode = 0600);
 
 // Runs a shell command, returning its exit status and (optionally) its standard output.
 int RunCommand(const std::string &command, std::string *out = nullptr);

@@ -6,11 +6,7 @@
 #include <openssl/x509.h>
 #include <openssl/x509v3.h>
 
-#include <chrono>
-
-#include <httplib.h>
-
-#include "kovacredential/cred_request.h"
+#include <atomic>
 
 namespace kova_test {
 
@@ -143,54 +139,12 @@ TlsIdentity TestCa::Issue(const std::string &subjectAltNames) const {
     return identity;
 }
 
-TlsServer::TlsServer(const TlsIdentity &identity) {
-    BIO *certBio =
-        BIO_new_mem_buf(identity.certPem.data(), static_cast<int>(identity.certPem.size()));
-    BIO *keyBio = BIO_new_mem_buf(identity.keyPem.data(), static_cast<int>(identity.keyPem.size()));
-    CertPtr cert(PEM_read_bio_X509(certBio, nullptr, nullptr, nullptr));
-    KeyPtr key(PEM_read_bio_PrivateKey(keyBio, nullptr, nullptr, nullptr));
-    BIO_free(certBio);
-    BIO_free(keyBio);
-    if (!cert || !key) {
-        return;
-    }
-    // The server's TLS context takes its own references to both.
-    server_ = std::make_unique<httplib::SSLServer>(cert.get(), key.get());
-    server_->Get("/ok", [this](const httplib::Request &, httplib::Response &res) {
-        ++requests_;
-        res.set_content("secure", "text/plain");
-    });
-}
-
-TlsServer::~TlsServer() {
-    if (thread_.joinable()) {
-        // stop() only ends a loop that runs: wait (bounded) until it does.
-        for (int i = 0; i < 500 && !server_->is_running(); ++i) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        }
-        // The test's own kept-alive connections would hold stop() for the server's keep-alive
-        // time.
-        KOVA::CredRequest::CloseIdleConnections();
-        server_->stop();
-        thread_.join();
-    }
-}
-
-bool TlsServer::Start() {
-    if (!server_ || !server_->is_valid()) {
-        return false;
-    }
-    port_ = server_->bind_to_any_port("127.0.0.1");
-    if (port_ <= 0) {
-        return false;
-    }
-    // The socket listens already; connections wait in its backlog until the loop runs.
-    thread_ = std::thread([this] { server_->listen_after_bind(); });
-    return true;
-}
-
-std::string TlsServer::Url() const {
-    return "https://127.0.0.1:" + std::to_string(port_) + "/ok";
+kovasim::LoopbackServer::Options HttpsWith(const TlsIdentity &identity) {
+    kovasim::LoopbackServer::Options options;
+    options.https = true;
+    options.certPem = identity.certPem;
+    options.keyPem = identity.keyPem;
+    return options;
 }
 
 }  // namespace kova_test

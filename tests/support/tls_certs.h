@@ -1,16 +1,12 @@
-// TLS material for tests that check certificates: a private CA, server certificates it signs
-// for chosen names, and an HTTPS server on loopback that presents one of them.
+// TLS material for tests and servers that check certificates: a private CA and server
+// certificates it signs for chosen names, which a LoopbackServer or nginx then presents.
 #ifndef KOVA_TESTS_SUPPORT_TLS_CERTS_H
 #define KOVA_TESTS_SUPPORT_TLS_CERTS_H
 
-#include <atomic>
 #include <memory>
 #include <string>
-#include <thread>
 
-namespace httplib {
-class SSLServer;
-}
+#include "simlib/loopback_server.h"
 
 namespace kova_test {
 
@@ -42,25 +38,8 @@ class TestCa {
     std::string certPem_;
 };
 
-// An HTTPS server on 127.0.0.1 (a free port) presenting `identity`; GET /ok answers "secure".
-class TlsServer {
-  public:
-    explicit TlsServer(const TlsIdentity &identity);
-    ~TlsServer();
-    TlsServer(const TlsServer &) = delete;
-    TlsServer &operator=(const TlsServer &) = delete;
-    bool Start();
-    // "https://127.0.0.1:PORT/ok".
-    std::string Url() const;
-    // Requests that reached /ok.
-    int Requests() const { return requests_; }
-
-  private:
-    std::unique_ptr<httplib::SSLServer> server_;
-    std::thread thread_;
-    int port_ = 0;
-    std::atomic<int> requests_{0};
-};
+// Options of a LoopbackServer on 127.0.0.1 that serves HTTPS with `identity`.
+kovasim::LoopbackServer::Options HttpsWith(const TlsIdentity &identity);
 
 }  // namespace kova_test
 

@@ -129,10 +129,12 @@ LoopbackServer::LoopbackServer() : LoopbackServer(Options()) {}
 
 LoopbackServer::LoopbackServer(const Options &options) : options_(options) {
     if (options_.https) {
-        if (MakeCertificate()) {
+        const bool given = !options_.certPem.empty() || !options_.keyPem.empty();
+        if (given ? ReadIdentity() : MakeCertificate()) {
             server_ = std::make_unique<httplib::SSLServer>(keys_->cert, keys_->key);
         } else {
-            error_ = "cannot make a self-signed certificate";
+            error_ = given ? "cannot read the given certificate and key"
+                           : "cannot make a self-signed certificate";
         }
     } else {
         server_ = std::make_unique<httplib::Server>();
@@ -198,6 +200,22 @@ bool LoopbackServer::MakeCertificate() {
     long len = BIO_get_mem_data(bio, &data);
     certPem_.assign(data, static_cast<size_t>(len));
     BIO_free(bio);
+    return true;
+}
+
+bool LoopbackServer::ReadIdentity() {
+    keys_ = std::make_unique<KeyMaterial>();
+    BIO *bio = BIO_new_mem_buf(options_.certPem.data(), static_cast<int>(options_.certPem.size()));
+    keys_->cert = PEM_read_bio_X509(bio, nullptr, nullptr, nullptr);
+    BIO_free(bio);
+    bio = BIO_new_mem_buf(options_.keyPem.data(), static_cast<int>(options_.keyPem.size()));
+    keys_->key = PEM_read_bio_PrivateKey(bio, nullptr, nullptr, nullptr);
+    BIO_free(bio);
+    if (keys_->cert == nullptr || keys_->key == nullptr ||
+        X509_check_private_key(keys_->cert, keys_->key) != 1) {
+        return false;
+    }
+    certPem_ = options_.certPem;
     return true;
 }
 

@@ -1,5 +1,6 @@
 // A loopback HTTP/HTTPS server for tests, benchmarks and kovasim: per-route handlers over
-// cpp-httplib, a self-signed certificate made at start, and a record of every request.
+// cpp-httplib, a self-signed certificate made at start (or an identity the caller gives), and a
+// record of every request.
 #ifndef KOVASIM_LOOPBACK_SERVER_H
 #define KOVASIM_LOOPBACK_SERVER_H
 
@@ -51,7 +52,11 @@ class LoopbackServer {
         std::string host = "127.0.0.1";
         int port = 0;        // 0 picks a free port
         bool https = false;  // serve TLS with a self-signed certificate for "localhost"
-        int threads = 16;    // worker threads (concurrent connections served)
+        // With https: the certificate and its private key (PEM) to present instead of the
+        // self-signed one, for example one issued by a test CA. Both or neither.
+        std::string certPem;
+        std::string keyPem;
+        int threads = 16;  // worker threads (concurrent connections served)
         bool keepAlive = true;
     };
     using Handler = std::function<void(const httplib::Request &, httplib::Response &)>;
@@ -82,7 +87,8 @@ class LoopbackServer {
     bool Https() const { return options_.https; }
     // "http://127.0.0.1:PORT" (no trailing slash); brackets around an IPv6 host.
     std::string BaseUrl() const;
-    // The certificate in PEM form (HTTPS servers only), for clients that want to verify it.
+    // The certificate presented, in PEM form (HTTPS servers only), for clients that want to
+    // verify it.
     const std::string &CertificatePem() const { return certPem_; }
 
     // Every request received so far, in order of arrival.
@@ -98,6 +104,7 @@ class LoopbackServer {
   private:
     void Record(const httplib::Request &req);
     bool MakeCertificate();
+    bool ReadIdentity();
 
     Options options_;
     std::unique_ptr<httplib::Server> server_;
