@@ -24,8 +24,6 @@
 #include <vector>
 
 #include <gtest/gtest.h>
-#include <openssl/pem.h>
-#include <openssl/ssl.h>
 
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_mgr.h"
@@ -34,6 +32,7 @@
 #include "support/interpose.h"
 #include "support/nginx_server.h"
 #include "support/temp_dir.h"
+#include "support/tls_certs.h"
 #include "webapi_fixture.h"
 
 namespace {
@@ -153,15 +152,21 @@ int ConnectionTest::gathered_ = 0;
 int ConnectionTest::waiting_ = 0;
 int ConnectionTest::mostWaiting_ = 0;
 
-// Fresh request objects one after another ride one connection, over plain HTTP and over TLS.
-TEST_F(ConnectionTest, SequentialRequestsShareOneConnection) {
-    for (kovasim::LoopbackServer *server : {http_, https_}) {
-        SCOPED_TRACE(server->BaseUrl());
-        for (int i = 0; i < 6; ++i) {
-            ASSERT_TRUE(Fetch(Url(*server, "/hello"))) << kova_test::LogDump();
+// Fresh request objects one after another ride one connection, over plain HTTP and over TLS;
+// while kovacredential_no_reuse is set each opens its own, and once it is gone they share again.
+TEST_F(ConnectionTest, SequentialRequestsShareOneConnectionUnlessReuseIsOff) {
+    for (bool reuse : {false, true}) {
+        std::unique_ptr<ScopedEnv> off(reuse ? nullptr
+                                             : new ScopedEnv("kovacredential_no_reuse", "1"));
+        for (kovasim::LoopbackServer *server : {http_, https_}) {
+            SCOPED_TRACE(server->BaseUrl() + (reuse ? "" : " without reuse"));
+            server->ClearRecords();
+            for (int i = 0; i < 4; ++i) {
+                ASSERT_TRUE(Fetch(Url(*server, "/hello"))) << kova_test::LogDump();
+            }
+            EXPECT_EQ(server->RequestCount(), 4u);
+            EXPECT_EQ(server->ConnectionCount(), reuse ? 1u : 4u);
         }
-        EXPECT_EQ(server->RequestCount(), 6u);
-        EXPECT_EQ(server->ConnectionCount(), 1u);
     }
 }
 
@@ -219,29 +224,13 @@ TEST_F(ConnectionTest, VerifiedAndUnverifiedConnectionsStayApart) {
     EXPECT_EQ(ports[3], ports[1]);
 }
 
-// Trusts the server's certificate (PEM text at data[0]) and counts the calls (data[1]).
-struct TrustAndCount {
-    std::string pem;
-    int calls = 0;
-};
-
-void TrustAndCountContext(void *, void *sslCtx, void *data) {
-    auto *t = static_cast<TrustAndCount *>(data);
-    ++t->calls;
-    BIO *bio = BIO_new_mem_buf(t->pem.data(), static_cast<int>(t->pem.size()));
-    X509 *cert = PEM_read_bio_X509(bio, nullptr, nullptr, nullptr);
-    X509_STORE_add_cert(SSL_CTX_get_cert_store(static_cast<SSL_CTX *>(sslCtx)), cert);
-    X509_free(cert);
-    BIO_free(bio);
-}
-
 // A request with a TLS context callback gets a handshake of its own every time, so its
 // callback sees every connection: fresh requests, and one request processed twice, never ride
 // a kept connection, nor leave one for the next.
 TEST_F(ConnectionTest, ContextCallbackGetsItsOwnHandshakeEveryTime) {
     const std::string url = Url(*https_, "/hello", true);
-    TrustAndCount trust{https_->CertificatePem()};
-    auto withCallback = [&](CredRequest &req) { req.SetSSLVerify(TrustAndCountContext, &trust); };
+    kova_test::TrustedPem trust{https_->CertificatePem()};
+    auto withCallback = [&](CredRequest &req) { req.SetSSLVerify(kova_test::TrustPem, &trust); };
 
     ASSERT_TRUE(Fetch(url)) << kova_test::LogDump();
     ASSERT_TRUE(Fetch(url, withCallback)) << kova_test::LogDump();
@@ -335,21 +324,6 @@ TEST_F(ConnectionTest, ManagerKeepsHttp1ParallelAndReusesConnectionsBetweenRuns)
         EXPECT_EQ(server->RequestCount(), 2u * kAtOnce);
         EXPECT_EQ(server->ConnectionCount(), static_cast<size_t>(kAtOnce));
     }
-}
-
-// kovacredential_no_reuse makes every request open its own connection.
-TEST_F(ConnectionTest, SwitchTurnsReuseOff) {
-    {
-        ScopedEnv off("kovacredential_no_reuse", "1");
-        for (int i = 0; i < 3; ++i) {
-            ASSERT_TRUE(Fetch(Url(*https_, "/hello"))) << kova_test::LogDump();
-        }
-        EXPECT_EQ(https_->ConnectionCount(), 3u);
-    }
-    for (int i = 0; i < 3; ++i) {
-        ASSERT_TRUE(Fetch(Url(*https_, "/hello"))) << kova_test::LogDump();
-    }
-    EXPECT_EQ(https_->ConnectionCount(), 4u);
 }
 
 // The server closes a kept connection: when it was idle, the next request (a streamed POST)

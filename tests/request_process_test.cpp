@@ -23,9 +23,6 @@
 #include <vector>
 
 #include <gtest/gtest.h>
-#include <openssl/pem.h>
-#include <openssl/ssl.h>
-#include <openssl/x509.h>
 
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_util.h"
@@ -666,23 +663,6 @@ TEST_F(HttpsTest, ClearedContextCallbackIsNotCalled) {
               "exit 0");
 }
 
-// What the trusting context callback gets: the CA to add to the trusted ones, and a count of
-// its calls.
-struct Trust {
-    std::string pem;
-    int calls = 0;
-};
-
-void TrustCertificate(void *, void *sslCtx, void *data) {
-    auto *trust = static_cast<Trust *>(data);
-    ++trust->calls;
-    BIO *bio = BIO_new_mem_buf(trust->pem.data(), static_cast<int>(trust->pem.size()));
-    X509 *cert = PEM_read_bio_X509(bio, nullptr, nullptr, nullptr);
-    X509_STORE_add_cert(SSL_CTX_get_cert_store(static_cast<SSL_CTX *>(sslCtx)), cert);
-    X509_free(cert);
-    BIO_free(bio);
-}
-
 // Certificates of a private CA, checked the ways a request can: not at all by default; with
 // SetHTTPSVerify(true), trusting the CA through a CA file or not at all; with a context
 // callback (through the adapter that gives libcurl its result code), trusting the CA or not.
@@ -728,7 +708,7 @@ TEST_F(HttpsTest, PrivateCAHostNamesAndPinnedKeys) {
         ASSERT_TRUE(server.Start()) << server.Error();
         KOVA::CredRequest req;
         ASSERT_TRUE(req.SetURL(server.BaseUrl() + "/ok"));
-        Trust trust;
+        kova_test::TrustedPem trust;
         int calls = 0;
         if (c.check == kVerify) {
             req.SetHTTPSVerify(true);
@@ -737,7 +717,7 @@ TEST_F(HttpsTest, PrivateCAHostNamesAndPinnedKeys) {
             }
         } else if (c.check == kCallback) {
             trust.pem = ca.CertPem();
-            c.trusted ? req.SetSSLVerify(TrustCertificate, &trust)
+            c.trusted ? req.SetSSLVerify(kova_test::TrustPem, &trust)
                       : req.SetSSLVerify(CountingSslContext, &calls);
         }
         if (!c.pin.empty()) {

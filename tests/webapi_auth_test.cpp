@@ -66,7 +66,9 @@ TEST_F(WebApiAuthTest, LoginSendsEveryParameterInsideTheRsaEnvelopeAndStoresTheS
     EXPECT_EQ(sess.csrf_token, stored.csrf_token);
 }
 
-TEST_F(WebApiAuthTest, OneTimeCodeIsRequiredCheckedAndSent) {
+// The server's refusals of a login: a one-time code missing or wrong, and a ciphertoken older
+// than its window.
+TEST_F(WebApiAuthTest, OneTimeCodeAndCiphertokenAreChecked) {
     KOVA_CRED cred = StoredCred("otpuser", "secret");
     KOVA_CRED_SESS sess;
     Json::Value response;
@@ -82,10 +84,15 @@ TEST_F(WebApiAuthTest, OneTimeCodeIsRequiredCheckedAndSent) {
     ASSERT_TRUE(CredRequestUtil::LoginWithOTP(&cred, "123456", &sess, &response)) << LogDump();
     EXPECT_EQ("123456", Sim().LastLogin().params["otp_code"]);
     EXPECT_EQ(sess.access_token, SessionStored(cred.id).access_token);
+
+    Sim().SetTokenWindow(-1);  // every server time is already too old
+    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "123456", nullptr, &response));
+    Sim().SetTokenWindow(300);
+    EXPECT_EQ(kovasim::WebApiSim::kErrStaleToken, response["error"]["code"].asInt());
 }
 
 // A wrong password stores nothing; unknown ids, missing sessions and missing arguments are
-// refused, each with its log record, without traffic.
+// refused, each with its log record, without traffic; a login whose transfer fails says so.
 TEST_F(WebApiAuthTest, WrongPasswordAndMissingInputsAreRefused) {
     int id = StoreCred("admin", "wrong");
     KOVA_CRED_SESS sess;
@@ -125,6 +132,16 @@ TEST_F(WebApiAuthTest, WrongPasswordAndMissingInputsAreRefused) {
         EXPECT_EQ(LogCount(c.log), 1u) << LogDump();
     }
     EXPECT_EQ(0u, Server().RequestCount());
+
+    // A login whose transfer fails (same id, another server: the description is cached).
+    CredRequestUtil::GetWebAPIDesc(&cred);
+    kovasim::LoopbackServer failing;
+    failing.Route("*", "/webapi/.*",
+                  [](const httplib::Request &, httplib::Response &res) { res.status = 503; });
+    ASSERT_TRUE(failing.Start());
+    cred.port = failing.Port();
+    EXPECT_FALSE(CredRequestUtil::Login(&cred, nullptr));
+    EXPECT_TRUE(LogHas("Send login request fail.[13]")) << LogDump();
 }
 
 // The token provider of the AES envelope hands out this pass phrase.
@@ -191,39 +208,26 @@ TEST_F(WebApiAesTest, ParametersTravelInTheAesEnvelope) {
     EXPECT_EQ("admin", Sim().LastLogin().params["account"]);
 }
 
-TEST_F(WebApiAuthTest, StaleCiphertokenIsRefused) {
-    KOVA_CRED cred = Cred();
-    Sim().SetTokenWindow(-1);  // every server time is already too old
-    Json::Value response;
-    EXPECT_FALSE(CredRequestUtil::LoginWithOTP(&cred, "", nullptr, &response));
-    Sim().SetTokenWindow(300);
-    EXPECT_EQ(kovasim::WebApiSim::kErrStaleToken, response["error"]["code"].asInt());
-}
-
-TEST_F(WebApiAuthTest, AccessTokenReusesTheStoredSessionWithoutTraffic) {
+// A stored session is the access token, without traffic; a logout sends its id as parameter
+// and cookie and ends it on the server, and a second logout of it is refused.
+TEST_F(WebApiAuthTest, AccessTokenReusesTheStoredSessionAndLogoutEndsIt) {
     KOVA_CRED cred = StoredCred();
-    KOVA_CRED_SESS first;
+    KOVA_CRED_SESS sess;
     size_t logins = Sim().Hits("KOVA.API.Auth");
-    ASSERT_TRUE(CredRequestUtil::GetAccessToken(static_cast<long>(cred.id), &first)) << LogDump();
+    ASSERT_TRUE(CredRequestUtil::GetAccessToken(static_cast<long>(cred.id), &sess)) << LogDump();
     EXPECT_EQ(logins + 1, Sim().Hits("KOVA.API.Auth"));
-    EXPECT_EQ(first.access_token, SessionStored(cred.id).access_token);
+    EXPECT_EQ(sess.access_token, SessionStored(cred.id).access_token);
+    ASSERT_TRUE(Sim().SessionValid(sess.access_token));
 
     Server().ClearRecords();
     KOVA_CRED_SESS again;
     ASSERT_TRUE(CredRequestUtil::GetAccessToken(static_cast<long>(cred.id), &again));
-    EXPECT_EQ(first.access_token, again.access_token);
-    EXPECT_EQ(first.csrf_token, again.csrf_token);
+    EXPECT_EQ(sess.access_token, again.access_token);
+    EXPECT_EQ(sess.csrf_token, again.csrf_token);
     KOVA_CRED_SESS byRecord;
     ASSERT_TRUE(CredRequestUtil::GetAccessToken(&cred, &byRecord));
-    EXPECT_EQ(first.access_token, byRecord.access_token);
+    EXPECT_EQ(sess.access_token, byRecord.access_token);
     EXPECT_EQ(0u, Server().RequestCount());
-}
-
-TEST_F(WebApiAuthTest, LogoutSendsSidAndCookieAndEndsTheSession) {
-    KOVA_CRED cred = StoredCred();
-    KOVA_CRED_SESS sess;
-    ASSERT_TRUE(CredRequestUtil::Login(static_cast<long>(cred.id), &sess));
-    ASSERT_TRUE(Sim().SessionValid(sess.access_token));
 
     ASSERT_TRUE(CredRequestUtil::Logout(static_cast<long>(cred.id))) << LogDump();
     kovasim::RecordedRequest wire = LastAuthRequest();
@@ -234,8 +238,6 @@ TEST_F(WebApiAuthTest, LogoutSendsSidAndCookieAndEndsTheSession) {
     EXPECT_FALSE(Sim().SessionValid(sess.access_token));
     // The stored session is left for the caller to remove.
     EXPECT_EQ(sess.access_token, SessionStored(cred.id).access_token);
-
-    // A second logout of the same session is refused by the server.
     EXPECT_FALSE(CredRequestUtil::Logout(&cred, &sess));
     EXPECT_TRUE(LogHas("Logout response is invalid")) << LogDump();
 }
@@ -299,19 +301,6 @@ TEST_F(WebApiAuthTest, LoginAnswerIsReadLenientlyButLogoutAnswerMustBeWhole) {
 
     EXPECT_FALSE(CredRequestUtil::Logout(&cred, "S-1"));
     EXPECT_TRUE(LogHas("Logout response is invalid")) << LogDump();
-}
-
-TEST_F(WebApiAuthTest, LoginTransferFailureIsReported) {
-    KOVA_CRED cred = Cred();
-    CredRequestUtil::GetWebAPIDesc(&cred);  // cached, so only the login itself fails
-    kovasim::LoopbackServer failing;
-    failing.Route("*", "/webapi/.*",
-                  [](const httplib::Request &, httplib::Response &res) { res.status = 503; });
-    ASSERT_TRUE(failing.Start());
-    // Same id, other server: the description comes from the cache.
-    cred.port = failing.Port();
-    EXPECT_FALSE(CredRequestUtil::Login(&cred, nullptr));
-    EXPECT_TRUE(LogHas("Send login request fail.[13]")) << LogDump();
 }
 
 // Every request of a login or logout over a transport runs with the transport's checks and
@@ -443,17 +432,17 @@ TEST_F(WebApiRedirectTest, LoginGoesToTheRedirectTargetWithOnlyTheGivenFields) {
     KOVACredSessListFree(&list);
 }
 
-TEST_F(WebApiRedirectTest, RefusedProbeLetsTheRequestReportItsOwnError) {
+// A refused probe changes nothing and leaves the request to report its own error; a Location is
+// taken as the server sent it.
+TEST_F(WebApiRedirectTest, RefusedProbeAndLocationsAsTheServerSentThem) {
     kovasim::RefusedPort closed;
-    KOVA_CRED cred = Cred(closed.Port());
-    EXPECT_TRUE(CredRequestUtil::CheckRedirect(&cred));
-    EXPECT_EQ("http", cred.protocol);
-    EXPECT_EQ(closed.Port(), cred.port);
-    EXPECT_FALSE(CredRequestUtil::Login(&cred, nullptr));
+    KOVA_CRED refused = Cred(closed.Port());
+    EXPECT_TRUE(CredRequestUtil::CheckRedirect(&refused));
+    EXPECT_EQ("http", refused.protocol);
+    EXPECT_EQ(closed.Port(), refused.port);
+    EXPECT_FALSE(CredRequestUtil::Login(&refused, nullptr));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, CredRequestUtil::m_errCode);
-}
 
-TEST_F(WebApiRedirectTest, LocationIsTakenAsTheServerSentIt) {
     // A blank in front of the address hides its scheme from the split: the credential stays
     // plain HTTP and the text before the last colon becomes its host.
     const struct {

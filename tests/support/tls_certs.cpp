@@ -3,6 +3,7 @@
 #include <openssl/evp.h>
 #include <openssl/pem.h>
 #include <openssl/sha.h>
+#include <openssl/ssl.h>
 #include <openssl/x509.h>
 #include <openssl/x509v3.h>
 
@@ -137,6 +138,15 @@ TlsIdentity TestCa::Issue(const std::string &subjectAltNames) const {
     });
     identity.pin = Pin(key.get());
     return identity;
+}
+
+void TrustPem(void *, void *sslCtx, void *trustedPem) {
+    auto *trusted = static_cast<TrustedPem *>(trustedPem);
+    ++trusted->calls;
+    BIO *bio = BIO_new_mem_buf(trusted->pem.data(), static_cast<int>(trusted->pem.size()));
+    CertPtr cert(PEM_read_bio_X509(bio, nullptr, nullptr, nullptr));
+    BIO_free(bio);
+    X509_STORE_add_cert(SSL_CTX_get_cert_store(static_cast<SSL_CTX *>(sslCtx)), cert.get());
 }
 
 kovasim::LoopbackServer::Options HttpsWith(const TlsIdentity &identity) {

@@ -38,6 +38,14 @@ class TestCa {
     std::string certPem_;
 };
 
+// What TrustPem, a TLS context callback for CredRequest::SetSSLVerify, gets: a certificate
+// (PEM) to add to the trusted ones, and a count of its calls.
+struct TrustedPem {
+    std::string pem;
+    int calls = 0;
+};
+void TrustPem(void *curl, void *sslCtx, void *trustedPem);
+
 // Options of a LoopbackServer on 127.0.0.1 that serves HTTPS with `identity`.
 kovasim::LoopbackServer::Options HttpsWith(const TlsIdentity &identity);
 
