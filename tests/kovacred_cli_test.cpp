@@ -112,19 +112,6 @@ class KovacredTest : public ::testing::Test {
     static inline SimProcess *sim_ = nullptr;
 };
 
-TEST_F(KovacredTest, VersionNamesTheLibrariesTheToolsRunWith) {
-    const std::string libraries = std::string("libcurl ") +
-                                  curl_version_info(CURLVERSION_NOW)->version + "\nOpenSSL " +
-                                  OpenSSL_version(OPENSSL_VERSION_STRING) + "\nSQLite " +
-                                  sqlite3_libversion() + "\njsoncpp " JSONCPP_VERSION_STRING "\n";
-    std::string out;
-    EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --version", &out), 0);
-    EXPECT_EQ(out, "kovacred " KOVA_VERSION "\nlibkovacredential " KOVA_VERSION "\n" + libraries);
-    out.clear();
-    EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVASIM_BIN) + " --version", &out), 0);
-    EXPECT_EQ(out, "kovasim " KOVA_VERSION "\nlibkovacredential " KOVA_VERSION "\n" + libraries);
-}
-
 TEST_F(KovacredTest, StoreCommandsPrintTextOrJson) {
     const std::string password = "pa$$'w0rd\"-SECRET";
     Result r =
@@ -442,27 +429,7 @@ TEST_F(KovacredTest, BatchShowsProgressOnATerminal) {
     EXPECT_NE(ReadFile(out).find("0  cred 1 KOVA.Demo.Delay 1 wait"), std::string::npos);
 }
 
-TEST_F(KovacredTest, RequestStreamsTwentyMegabytesBothWaysByteExact) {
-    const std::string in = db_.dir().File("in.bin");
-    ASSERT_EQ(RunCommand("head -c " + std::to_string(20 << 20) + " /dev/urandom >" + in), 0);
-    const std::string out = db_.dir().File("out.bin");
-    Result r = Run("request -T " + in + " -o " + out + " " + Url("/raw/echo"));
-    ASSERT_EQ(r.status, 0) << r.err;
-    EXPECT_EQ(r.out, "");
-    EXPECT_TRUE(ReadFile(in) == ReadFile(out)) << "the body came back altered";
-
-    r = Run("request --json --upload-file - --output " + out + " " + Url("/raw/echo", true),
-            ReadFile(in));
-    ASSERT_EQ(r.status, 0) << r.err;
-    Json::Value answer = ParseOut(r.out);
-    EXPECT_EQ(answer["status"], 200);
-    EXPECT_EQ(answer["bytes"], 20 << 20);
-    EXPECT_EQ(answer["output"], out);
-    EXPECT_EQ(answer["headers"]["Content-Type"], "application/octet-stream");
-    EXPECT_TRUE(ReadFile(in) == ReadFile(out)) << "the body came back altered";
-}
-
-TEST_F(KovacredTest, RequestSendsItsOptionsAndPrintsTextOrJson) {
+TEST_F(KovacredTest, RequestSendsItsOptionsStreamsAndPrintsTextOrJson) {
     kovasim::LoopbackServer server;
     server.Route("*", "/echo", [](const httplib::Request &req, httplib::Response &res) {
         res.set_header("X-Answer", "42");
@@ -499,6 +466,25 @@ TEST_F(KovacredTest, RequestSendsItsOptionsAndPrintsTextOrJson) {
     EXPECT_EQ(Run("probe " + url).out, "reachable\n");
     EXPECT_EQ(ParseOut(Run("probe --json " + url).out),
               ParseOut("{\"url\": \"" + url + "\", \"reachable\": true}"));
+
+    // Twenty megabytes streamed up and down byte-exact, from a file and from standard input.
+    const std::string in = db_.dir().File("in.bin");
+    ASSERT_EQ(RunCommand("head -c " + std::to_string(20 << 20) + " /dev/urandom >" + in), 0);
+    const std::string out = db_.dir().File("out.bin");
+    r = Run("request -T " + in + " -o " + out + " " + Url("/raw/echo"));
+    ASSERT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out, "");
+    EXPECT_TRUE(ReadFile(in) == ReadFile(out)) << "the body came back altered";
+
+    r = Run("request --json --upload-file - --output " + out + " " + Url("/raw/echo", true),
+            ReadFile(in));
+    ASSERT_EQ(r.status, 0) << r.err;
+    answer = ParseOut(r.out);
+    EXPECT_EQ(answer["status"], 200);
+    EXPECT_EQ(answer["bytes"], 20 << 20);
+    EXPECT_EQ(answer["output"], out);
+    EXPECT_EQ(answer["headers"]["Content-Type"], "application/octet-stream");
+    EXPECT_TRUE(ReadFile(in) == ReadFile(out)) << "the body came back altered";
 }
 
 // -o replaces its file only when the request succeeds; like curl, the body of any HTTP answer
@@ -847,9 +833,20 @@ TEST_F(KovacredTest, CompletionOffersCommandsOptionsIdsAndFiles) {
     EXPECT_FALSE(std::ifstream(dir + "/absent.sqlite").good()) << "completion made a database";
 }
 
-// Every command and option `kovacred --help` lists is in kovacred(1) and (options) offered
-// by the completion.
-TEST(KovacredManualTest, PageAndCompletionNameEveryCommandAndOption) {
+// --version names the libraries the tools run with; every command and option `kovacred --help`
+// lists is in kovacred(1) and (options) offered by the completion.
+TEST(KovacredManualTest, VersionPageAndCompletionNameEverything) {
+    const std::string libraries = std::string("libcurl ") +
+                                  curl_version_info(CURLVERSION_NOW)->version + "\nOpenSSL " +
+                                  OpenSSL_version(OPENSSL_VERSION_STRING) + "\nSQLite " +
+                                  sqlite3_libversion() + "\njsoncpp " JSONCPP_VERSION_STRING "\n";
+    std::string out;
+    EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVACRED_BIN) + " --version", &out), 0);
+    EXPECT_EQ(out, "kovacred " KOVA_VERSION "\nlibkovacredential " KOVA_VERSION "\n" + libraries);
+    out.clear();
+    EXPECT_EQ(RunCommand(kova_test::ToolCommand(KOVASIM_BIN) + " --version", &out), 0);
+    EXPECT_EQ(out, "kovasim " KOVA_VERSION "\nlibkovacredential " KOVA_VERSION "\n" + libraries);
+
     std::string page;
     ASSERT_EQ(
         RunCommand("MANWIDTH=200 LC_ALL=C man -l " KOVA_BINARY_DIR "/doc/kovacred.1.gz", &page), 0);

@@ -115,7 +115,10 @@ TEST_F(ProcessTest, SetUpOnlyThenOkTwiceOnTheSameHandle) {
     EXPECT_EQ(server_.CountPath("/ok"), 2u);
 }
 
-TEST_F(ProcessTest, MapsStatusToErrorWhenRedirectsAreNotFollowed) {
+// Without following redirects a status other than 200 maps to its error, logged from 400 on.
+// Redirects are followed by default, and a POST stays a POST with its body on 301, 302 and 303,
+// where libcurl on its own would turn it into a bodiless GET.
+TEST_F(ProcessTest, StatusesMapToErrorsAndFollowedRedirectsKeepThePost) {
     struct Case {
         int status;
         KOVA::CRED_REQ_ERR error;
@@ -144,11 +147,6 @@ TEST_F(ProcessTest, MapsStatusToErrorWhenRedirectsAreNotFollowed) {
             << kova_test::LogDump();
         EXPECT_EQ(server_.RequestCount(), 1u);
     }
-}
-
-// Redirects are followed by default, and a POST stays a POST with its body on 301, 302 and 303,
-// where libcurl on its own would turn it into a bodiless GET.
-TEST_F(ProcessTest, FollowedRedirectKeepsPostAndItsBody) {
     for (int status : {301, 302, 303}) {
         for (bool raw : {false, true}) {
             SCOPED_TRACE(std::to_string(status) + (raw ? " raw" : " form"));

@@ -143,7 +143,16 @@ TEST_F(WebApiFactoryTest, FillFormErrorCodes) {
     EXPECT_EQ(KOVA::CRED_REQ_ERR_QUERY_FAIL, unreachable.GetError());
 }
 
-TEST_F(WebApiFactoryTest, CredentialIdFormLogsInOnceAndReusesTheSession) {
+// The credential-id factory logs in once and reuses the session; ProcessWithLogin attaches a
+// session of an unknown id to nothing and a stored one's to the request.
+TEST_F(WebApiFactoryTest, CredentialIdFormsLogInOnceAndReuseTheSession) {
+    CredRequest unknown;
+    unknown.SetURL(EntryUrl());
+    EXPECT_FALSE(unknown.ProcessWithLogin(999, true, 0));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_FAIL, unknown.GetError());
+    EXPECT_EQ(0u, Server().RequestCount());
+    EXPECT_EQ(nullptr, unknown.GetCurlHandler());
+
     int id = StoreCred();
     size_t logins = Sim().Hits("KOVA.API.Auth");
     std::unique_ptr<CredRequest> first(
@@ -157,6 +166,13 @@ TEST_F(WebApiFactoryTest, CredentialIdFormLogsInOnceAndReusesTheSession) {
     ASSERT_TRUE(second);
     EXPECT_EQ(logins + 1, Sim().Hits("KOVA.API.Auth"));
     EXPECT_EQ("admin", Answer(*second)["data"]["account"].asString());
+    CredRequest request;
+    WhoAmI(request);
+    ASSERT_TRUE(request.ProcessWithLogin(id, true, 0)) << LogDump();
+    EXPECT_EQ("admin", ParseBody(request.GetResponse())["data"]["account"].asString());
+    kovasim::RecordedRequest wire = Server().Last();
+    EXPECT_TRUE(wire.HasParam("KovaToken"));
+    EXPECT_EQ("", wire.query);
 
     EXPECT_EQ(nullptr,
               CredRequest::CreateWebAPIRequest(id, "KOVA.Demo.Echo", 0, "echo", Json::Value()));
@@ -204,25 +220,7 @@ TEST_F(WebApiFactoryTest, RelayRequestReadsItsBodyFromTheStreams) {
     EXPECT_EQ(2u, LogCount("Bad parameters")) << LogDump();
 }
 
-TEST_F(WebApiFactoryTest, ProcessWithLoginAttachesAFreshSession) {
-    CredRequest unknown;
-    unknown.SetURL(EntryUrl());
-    EXPECT_FALSE(unknown.ProcessWithLogin(999, true, 0));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_LOGIN_FAIL, unknown.GetError());
-    EXPECT_EQ(0u, Server().RequestCount());
-    EXPECT_EQ(nullptr, unknown.GetCurlHandler());
-
-    int id = StoreCred();
-    CredRequest request;
-    WhoAmI(request);
-    ASSERT_TRUE(request.ProcessWithLogin(id, true, 0)) << LogDump();
-    EXPECT_EQ("admin", ParseBody(request.GetResponse())["data"]["account"].asString());
-    kovasim::RecordedRequest wire = Server().Last();
-    EXPECT_TRUE(wire.HasParam("KovaToken"));
-    EXPECT_EQ("", wire.query);
-}
-
-TEST_F(WebApiFactoryTest, RequestLoginAndLogout) {
+TEST_F(WebApiFactoryTest, RequestLoginWebApiRequestAndLogout) {
     const struct {
         const char *account;
         const char *url;  // nullptr: the request's own URL
@@ -256,6 +254,22 @@ TEST_F(WebApiFactoryTest, RequestLoginAndLogout) {
     EXPECT_NE(std::string::npos, wire.query.find("KovaToken="));
     EXPECT_EQ("id=" + sid, wire.Header("Cookie"));
     EXPECT_TRUE(Sim().SessionValid(sid));
+    // A WebAPI request set up on a logged-in request uses that request's own credential.
+    CredRequest own;
+    own.SetURL(EntryUrl());
+    ASSERT_TRUE(own.Login("admin", "secret"));
+    Json::Value params;
+    params["a"] = "b";
+    ASSERT_TRUE(own.SetWebAPIRequest("KOVA.Demo.Echo", 1, "echo", params)) << LogDump();
+    const Json::Value answer = Answer(own);
+    EXPECT_EQ("b", answer["data"]["params"]["a"].asString());
+    EXPECT_EQ("KOVA.Demo.Echo", answer["data"]["api"].asString());
+    CredRequest fresh;
+    ClearLog();
+    EXPECT_FALSE(fresh.SetWebAPIRequest("KOVA.Demo.Echo", 0, "echo", params));
+    EXPECT_FALSE(fresh.SetWebAPIRequest("", 1, "echo", params));
+    EXPECT_EQ(2u, LogCount("Bad parameters"));
+    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, fresh.GetError());
 
     EXPECT_TRUE(request.Logout()) << LogDump();
     EXPECT_FALSE(Sim().SessionValid(sid));
@@ -283,24 +297,6 @@ TEST_F(WebApiFactoryTest, ApiValidityUsesTheRequestsUrl) {
     EXPECT_FALSE(oddPort.isAPIValid("KOVA.Demo.Echo"));
     EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, oddPort.GetError());
     EXPECT_TRUE(LogHas("127.0.0.1:0/webapi/query.cgi")) << LogDump();
-}
-
-TEST_F(WebApiFactoryTest, SetWebApiRequestUsesTheRequestsOwnCredential) {
-    CredRequest request;
-    request.SetURL(EntryUrl());
-    ASSERT_TRUE(request.Login("admin", "secret"));
-    Json::Value params;
-    params["a"] = "b";
-    ASSERT_TRUE(request.SetWebAPIRequest("KOVA.Demo.Echo", 1, "echo", params)) << LogDump();
-    const Json::Value answer = Answer(request);
-    EXPECT_EQ("b", answer["data"]["params"]["a"].asString());
-    EXPECT_EQ("KOVA.Demo.Echo", answer["data"]["api"].asString());
-
-    CredRequest fresh;
-    EXPECT_FALSE(fresh.SetWebAPIRequest("KOVA.Demo.Echo", 0, "echo", params));
-    EXPECT_FALSE(fresh.SetWebAPIRequest("", 1, "echo", params));
-    EXPECT_EQ(2u, LogCount("Bad parameters"));
-    EXPECT_EQ(KOVA::CRED_REQ_ERR_NONE, fresh.GetError());
 }
 
 }  // namespace
