@@ -89,7 +89,7 @@ TEST_F(WireTest, QueryJoiningEncodingAndTokenPlacement) {
 }
 
 // Post parameters become a form body, added headers merge by name, and of the cookies only the
-// last in name order is sent.
+// last in name order is sent; the JSON format writes the values as JSON.
 TEST_F(WireTest, PostParamsBecomeFormBodyWithHeadersAndCookie) {
     KOVA::CredRequest req;
     ASSERT_TRUE(req.SetURL(Url("/echo")));
@@ -110,21 +110,19 @@ TEST_F(WireTest, PostParamsBecomeFormBodyWithHeadersAndCookie) {
     EXPECT_EQ(r.Header("X-A"), "2");
     EXPECT_EQ(r.Header("X-B"), "3");
     EXPECT_EQ(r.Header("Cookie"), "id=SID");
-}
 
-TEST_F(WireTest, JsonFormatWritesValuesAsJson) {
     for (bool json : {true, false}) {
         SCOPED_TRACE(json);
-        KOVA::CredRequest req;
-        ASSERT_TRUE(req.SetURL(Url("/echo")));
+        KOVA::CredRequest formatted;
+        ASSERT_TRUE(formatted.SetURL(Url("/echo")));
         if (json)
-            req.SetRequestFormat("JSON");
+            formatted.SetRequestFormat("JSON");
         Json::Value params;
         params["s"] = "x";
         params["n"] = 3;
         params["o"]["k"] = true;
-        ASSERT_TRUE(req.AddPostParam(params));
-        auto r = Send(req);
+        ASSERT_TRUE(formatted.AddPostParam(params));
+        r = Send(formatted);
         EXPECT_EQ(r.Param("s"), json ? "\"x\"" : "x");
         EXPECT_EQ(r.Param("n"), "3");
         if (json) {
@@ -134,8 +132,8 @@ TEST_F(WireTest, JsonFormatWritesValuesAsJson) {
 }
 
 // A streamed body has no length, so libcurl sends it chunked and, by default, waits for an
-// interim 100 answer; the empty Expect of a header list suppresses that.
-TEST_F(WireTest, StreamedBodyExpectsContinueOnlyWithoutHeaderList) {
+// interim 100 answer; the empty Expect of a header list suppresses that. A size limit cuts it.
+TEST_F(WireTest, StreamedBodyIsChunkedAndCutByTheSharedLimit) {
     for (bool withHeaders : {false, true}) {
         SCOPED_TRACE(withHeaders);
         File stream = StreamWith("stream-body");
@@ -154,10 +152,22 @@ TEST_F(WireTest, StreamedBodyExpectsContinueOnlyWithoutHeaderList) {
             EXPECT_EQ(r.Header("Expect"), "100-continue");
         }
     }
+    // The stream limit is shared by all requests and cleared whenever one is constructed.
+    for (bool constructAnother : {false, true}) {
+        SCOPED_TRACE(constructAnother);
+        File stream = StreamWith("0123456789abcdef");
+        KOVA::CredRequest req;
+        ASSERT_TRUE(req.SetURL(Url("/echo")));
+        ASSERT_TRUE(req.SetReqStream(stream.get()));
+        ASSERT_TRUE(req.SetReqStreamSize(4));
+        if (constructAnother)
+            KOVA::CredRequest other;
+        EXPECT_EQ(Send(req).body, constructAnother ? "0123456789abcdef" : "0123");
+    }
 }
 
 // Body sources in order of precedence: raw parameter, upload file, request stream, post
-// parameters. Each case offers every source from its own down.
+// parameters. Each case offers every source from its own down. A missing upload file fails.
 TEST_F(WireTest, BodySourcePrecedence) {
     std::string path = dir_.File("up.txt");
     std::ofstream(path) << "file-content";
@@ -193,21 +203,13 @@ TEST_F(WireTest, BodySourcePrecedence) {
             EXPECT_EQ(r.body, "stream-body");
         }
     }
-}
-
-// The stream limit is shared by all requests and cleared whenever one is constructed.
-TEST_F(WireTest, RequestStreamLimitCutsTheBodyUntilTheNextRequest) {
-    for (bool constructAnother : {false, true}) {
-        SCOPED_TRACE(constructAnother);
-        File stream = StreamWith("0123456789abcdef");
-        KOVA::CredRequest req;
-        ASSERT_TRUE(req.SetURL(Url("/echo")));
-        ASSERT_TRUE(req.SetReqStream(stream.get()));
-        ASSERT_TRUE(req.SetReqStreamSize(4));
-        if (constructAnother)
-            KOVA::CredRequest other;
-        EXPECT_EQ(Send(req).body, constructAnother ? "0123456789abcdef" : "0123");
-    }
+    // An upload file that cannot be read fails the transfer.
+    KOVA::CredRequest req;
+    ASSERT_TRUE(req.SetURL(Url("/echo")));
+    ASSERT_TRUE(req.SetUploadFile("file", dir_.File("absent").c_str()));
+    EXPECT_FALSE(req.Process(true, 0));
+    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_CURL_OTHER);
+    EXPECT_TRUE(kova_test::LogHas("CURL Error(26)")) << kova_test::LogDump();
 }
 
 // A request stream that hands out "part-" and then fails to read.
@@ -238,15 +240,6 @@ TEST_F(WireTest, RequestStreamReadErrorAbortsTheTransfer) {
     for (const auto &r : server_.Requests()) {
         EXPECT_EQ(r.body, "");  // the server saw no body it could take as whole
     }
-}
-
-TEST_F(WireTest, MissingUploadFileFailsTheTransfer) {
-    KOVA::CredRequest req;
-    ASSERT_TRUE(req.SetURL(Url("/echo")));
-    ASSERT_TRUE(req.SetUploadFile("file", dir_.File("absent").c_str()));
-    EXPECT_FALSE(req.Process(true, 0));
-    EXPECT_EQ(req.GetError(), KOVA::CRED_REQ_ERR_CURL_OTHER);
-    EXPECT_TRUE(kova_test::LogHas("CURL Error(26)")) << kova_test::LogDump();
 }
 
 }  // namespace
