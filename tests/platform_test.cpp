@@ -5,7 +5,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <fstream>
 #include <functional>
 #include <string>
 #include <thread>
@@ -167,29 +166,17 @@ TEST(JsonText, ParsesStrictlyAndWritesCompactly) {
     EXPECT_TRUE(v.isNull());
 }
 
-// A number of kilobytes from /proc/self/status ("VmHWM", "VmRSS"); -1 when it cannot be read.
-long StatusKilobytes(const std::string &field) {
-    std::ifstream status("/proc/self/status");
-    std::string line;
-    while (std::getline(status, line)) {
-        if (line.compare(0, field.size() + 1, field + ":") == 0) {
-            return std::stol(line.substr(field.size() + 1));
-        }
-    }
-    return -1;
-}
-
 // Run in a child: makes the text, parses it, and returns 0 when the parse succeeded as
 // `parses` says and the high-water mark grew by less than eight times the text plus the
 // budget's margin; otherwise says why on standard error and returns 1.
 int ParseWithinPeak(const char *shape, const std::function<std::string()> &make, bool lenient,
                     bool parses) {
-    const long before = StatusKilobytes("VmHWM");
+    const long before = kova_test::PeakRssKiB();
     const std::string text = make();
     Json::Value value;
     const bool parsed =
         lenient ? kova::JsonFromLenientText(text, value, true) : kova::JsonFromString(text, value);
-    const long grown = StatusKilobytes("VmHWM") - before;
+    const long grown = kova_test::PeakRssKiB() - before;
     const long bound = static_cast<long>((8 * text.size() + kova::kJsonCostMargin) / 1024);
 #if defined(__SANITIZE_ADDRESS__)
     // AddressSanitizer's red zones and quarantine inflate every allocation, so only the

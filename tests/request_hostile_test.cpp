@@ -25,6 +25,7 @@
 #include "request/cred_request_p.h"
 #include "simlib/fault_server.h"
 #include "simlib/loopback_server.h"
+#include "support/child.h"
 #include "support/interpose.h"
 #include "support/temp_dir.h"
 
@@ -45,24 +46,6 @@ struct Outcome {
     int curlCode = -1;              // GetCurlCode of the request
     int code = 0;                   // anything else a case reports
 };
-
-// The peak resident set; with `reset` it first starts the peak afresh from the current set.
-long PeakRssKiB(bool reset = false) {
-    if (reset) {
-        File clear(fopen("/proc/self/clear_refs", "w"));
-        if (clear) {
-            fputs("5", clear.get());
-        }
-    }
-    File status(fopen("/proc/self/status", "r"));
-    char line[256];
-    while (status && fgets(line, sizeof(line), status.get()) != nullptr) {
-        if (strncmp(line, "VmHWM:", 6) == 0) {
-            return strtol(line + 6, nullptr, 10);
-        }
-    }
-    return -1;
-}
 
 // Runs `body` in a forked child that an alarm ends after `seconds`, and hands back its outcome
 // through shared memory. Fails when the child crashed, hung or leaked (the sanitizer build
@@ -127,9 +110,9 @@ Outcome Fetch(Fault fault, Sink sink) {
     } else if (sink == Sink::kWriter) {
         request.SetRespStream(reinterpret_cast<FILE *>(&counted), CountingWriter);
     }
-    const long before = PeakRssKiB(true);
+    const long before = kova_test::PeakRssKiB(true);
     outcome.ok = request.Process(true, 0);
-    outcome.rssGrowthKiB = PeakRssKiB() - before;
+    outcome.rssGrowthKiB = kova_test::PeakRssKiB() - before;
     outcome.error = request.GetError();
     outcome.headers = static_cast<int>(request.GetResponseHeader().size());
     if (stream != nullptr) {
@@ -213,9 +196,9 @@ TEST(HostilePeerTest, GzipBombThroughDiscoveryStopsAtTheCap) {
             cred.host = "127.0.0.1";
             cred.port = server.Port();
             KOVA::CredRequestUtil::m_errCode = 0;
-            const long before = PeakRssKiB(true);
+            const long before = kova_test::PeakRssKiB(true);
             result.ok = KOVA::CredRequestUtil::GetWebAPIDesc(&cred);
-            result.rssGrowthKiB = PeakRssKiB() - before;
+            result.rssGrowthKiB = kova_test::PeakRssKiB() - before;
             result.queryError = KOVA::CredRequestUtil::m_errCode;
             result.bytes = server.RequestCount();
             result.writeErrorLogged = kova_test::LogHas("CURL Error(23)");

@@ -6,25 +6,25 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-namespace kova_test {
-namespace {
+#include <fstream>
 
-// Whether the calling thread is the process's only one.
-[[maybe_unused]] bool OnlyThread() {
-    FILE *status = fopen("/proc/self/status", "r");
-    if (status == nullptr) {
-        return false;
+namespace kova_test {
+long ProcStatus(const std::string &field) {
+    std::ifstream status("/proc/self/status");
+    for (std::string line; std::getline(status, line);) {
+        if (line.compare(0, field.size() + 1, field + ":") == 0) {
+            return std::stol(line.substr(field.size() + 1));
+        }
     }
-    char line[256];
-    int threads = 0;
-    while (fgets(line, sizeof line, status) != nullptr &&
-           sscanf(line, "Threads: %d", &threads) != 1) {
-    }
-    fclose(status);
-    return threads == 1;
+    return -1;
 }
 
-}  // namespace
+long PeakRssKiB(bool reset) {
+    if (reset) {
+        std::ofstream("/proc/self/clear_refs") << "5";
+    }
+    return ProcStatus("VmHWM");
+}
 
 std::string RunInChild(unsigned seconds, const std::function<int()> &body) {
 #if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
@@ -33,7 +33,7 @@ std::string RunInChild(unsigned seconds, const std::function<int()> &body) {
     // held by a server thread at the fork, and the child then waits for it forever), and these
     // runs look for races and memory errors rather than crashes: with other threads running,
     // the scenario runs in the test's own process, still ended by SIGALRM after `seconds`.
-    if (!OnlyThread()) {
+    if (ProcStatus("Threads") != 1) {
         signal(SIGALRM, SIG_DFL);
         alarm(seconds);
         const int result = body();
