@@ -59,16 +59,6 @@ std::vector<int> Ports(const kovasim::LoopbackServer &server) {
     return ports;
 }
 
-// Sets an environment variable for the object's life.
-class ScopedEnv {
-  public:
-    ScopedEnv(const char *name, const char *value) : name_(name) { setenv(name, value, 1); }
-    ~ScopedEnv() { unsetenv(name_); }
-
-  private:
-    const char *name_;
-};
-
 // Plain and TLS loopback servers answering "/hello"; "/cookie" also sets a cookie. Every test
 // starts with empty records and an empty pool, so that no connection is kept from another.
 class ConnectionTest : public ::testing::Test {
@@ -114,7 +104,10 @@ class ConnectionTest : public ::testing::Test {
         https_->ClearRecords();
         kova_test::ClearLog();
     }
-    void TearDown() override { CredRequest::CloseIdleConnections(); }
+    void TearDown() override {
+        unsetenv("kovacredential_no_reuse");
+        CredRequest::CloseIdleConnections();
+    }
 
     // The URL of `path` on the server, by name ("localhost", which its certificate names) or
     // by address.
@@ -156,8 +149,7 @@ int ConnectionTest::mostWaiting_ = 0;
 // while kovacredential_no_reuse is set each opens its own, and once it is gone they share again.
 TEST_F(ConnectionTest, SequentialRequestsShareOneConnectionUnlessReuseIsOff) {
     for (bool reuse : {false, true}) {
-        std::unique_ptr<ScopedEnv> off(reuse ? nullptr
-                                             : new ScopedEnv("kovacredential_no_reuse", "1"));
+        reuse ? unsetenv("kovacredential_no_reuse") : setenv("kovacredential_no_reuse", "1", 1);
         for (kovasim::LoopbackServer *server : {http_, https_}) {
             SCOPED_TRACE(server->BaseUrl() + (reuse ? "" : " without reuse"));
             server->ClearRecords();
@@ -374,20 +366,8 @@ TEST(IdleCloseTest, StreamedPostAfterTheServerClosedItsConnection) {
         EXPECT_EQ(server.ConnectionCount(), 2);
         server.Stop();
 
-        // The chunked body as sent: one chunk-size line per chunk, the data whole.
-        auto data = [](const std::string &chunked) {
-            std::string out;
-            size_t pos = 0;
-            while (pos < chunked.size()) {
-                const size_t eol = chunked.find("\r\n", pos);
-                const size_t size = std::stoul(chunked.substr(pos, eol - pos), nullptr, 16);
-                out += chunked.substr(eol + 2, size);
-                pos = eol + 2 + size + 2;
-            }
-            return out;
-        };
         ASSERT_NE(bodies[1].find("\r\n\r\n"), std::string::npos) << bodies[1].substr(0, 200);
-        EXPECT_EQ(data(bodies[1]), body);
+        EXPECT_EQ(kova_test::Dechunk(bodies[1]), body);
         if (c == kClosedWhileIdle) {
             EXPECT_EQ(bodies[0], "");
         }

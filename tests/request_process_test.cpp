@@ -35,6 +35,7 @@
 
 namespace {
 
+using kova_test::Dechunk;
 using kova_test::File;
 using kova_test::Pattern;
 using kova_test::ReadAll;
@@ -275,20 +276,6 @@ TEST_F(ProcessTest, CutOffBodyIsRetriedAndEachAttemptStartsClean) {
         EXPECT_EQ(req.GetResponse(), c.toStream ? "" : c.response);
         EXPECT_EQ(ReadAll(out.get()), c.toStream ? std::string("kept") + c.response : "kept");
     }
-}
-
-// De-chunks a chunked request body; "" when it is malformed or incomplete.
-std::string Dechunk(const std::string &chunked) {
-    std::string body;
-    for (size_t pos = 0, eol; (eol = chunked.find("\r\n", pos)) != std::string::npos;) {
-        const size_t size = std::stoul(chunked.substr(pos, eol - pos), nullptr, 16);
-        if (size == 0 || eol + 4 + size > chunked.size()) {
-            return size == 0 ? body : "";
-        }
-        body.append(chunked, eol + 2, size);
-        pos = eol + 4 + size;
-    }
-    return "";
 }
 
 // A raw server that takes request bodies. For its connections, in order, it follows a plan:

@@ -175,4 +175,17 @@ std::string ReadAll(FILE *f) {
     return out;
 }
 
+std::string Dechunk(const std::string &chunked) {
+    std::string body;
+    for (size_t pos = 0, eol; (eol = chunked.find("\r\n", pos)) != std::string::npos;) {
+        const size_t size = std::stoul(chunked.substr(pos, eol - pos), nullptr, 16);
+        if (size == 0 || eol + 4 + size > chunked.size()) {
+            return size == 0 ? body : "";
+        }
+        body.append(chunked, eol + 2, size);
+        pos = eol + 4 + size;
+    }
+    return "";
+}
+
 }  // namespace kova_test

@@ -54,6 +54,8 @@ std::string ReadAll(FILE *f);
 // `size` letters in a pattern that does not repeat within a few kilobytes, so that a body cut,
 // doubled or shifted anywhere shows.
 std::string Pattern(size_t size);
+// The data of a chunked body through its last chunk; "" when it is malformed or incomplete.
+std::string Dechunk(const std::string &chunked);
 
 }  // namespace kova_test
 
