@@ -346,7 +346,16 @@ TEST_F(EncInfoTest, AnswersAndFailures) {
     EXPECT_TRUE(kova_test::LogHas("Cannot find id[987654] in database")) << kova_test::LogDump();
 }
 
-TEST_F(EncInfoTest, RsaEnvelopeOnTheWire) {
+int InstalledToken(char *token, size_t tokenSize, char *key, size_t keySize) {
+    snprintf(token, tokenSize, "%s", "token-0123456789");
+    snprintf(key, keySize, "%s", "aes-key-abcdefghijklmnopqrstuvwx");
+    return 0;
+}
+
+// The RSA envelope on the wire holds every parameter but the CSRF token, with the client time.
+// Either envelope fails to an empty string without what it needs (an encryption URL, a token);
+// the AES envelope then encrypts every parameter but the CSRF token under the token's key.
+TEST_F(EncInfoTest, RsaAndAesEnvelopesAndTheirFailures) {
     KOVA::CredRequest req;
     ASSERT_TRUE(req.SetURL(server_.BaseUrl() + "/webapi/entry.cgi"));
     ASSERT_TRUE(req.SetEncURL(EncUrl()));
@@ -355,7 +364,7 @@ TEST_F(EncInfoTest, RsaEnvelopeOnTheWire) {
     ASSERT_TRUE(req.AddPostParam("passwd", "p w"));
     ASSERT_TRUE(req.AddPostParam("KovaToken", "TOK"));
     ASSERT_TRUE(req.Process(true, 0)) << kova_test::LogDump();
-    auto r = server_.Last();
+    const auto r = server_.Last();
     EXPECT_EQ(r.path, "/webapi/entry.cgi");
     ASSERT_TRUE(r.HasParam("__cIpHeRtExT")) << r.body;
     EXPECT_FALSE(r.HasParam("account"));
@@ -363,17 +372,7 @@ TEST_F(EncInfoTest, RsaEnvelopeOnTheWire) {
     EXPECT_EQ(r.body.rfind("&KovaToken=TOK"), r.body.size() - 14);
     EXPECT_EQ(RsaDecrypt(key2048_, r.Param("__cIpHeRtExT")),
               "account=admin&client_time=1700000000&passwd=p%20w");
-}
 
-int InstalledToken(char *token, size_t tokenSize, char *key, size_t keySize) {
-    snprintf(token, tokenSize, "%s", "token-0123456789");
-    snprintf(key, keySize, "%s", "aes-key-abcdefghijklmnopqrstuvwx");
-    return 0;
-}
-
-// Either envelope fails to an empty string without what it needs (an encryption URL, a token);
-// the AES envelope then encrypts every parameter but the CSRF token under the token's key.
-TEST_F(EncInfoTest, EnvelopeFailuresAndAesEnvelope) {
     const std::string aesKey = "aes-key-abcdefghijklmnopqrstuvwx";
     KOVA::CredRequestPrivate p(nullptr);
     Json::Value params;
