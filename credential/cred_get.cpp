@@ -19,10 +19,8 @@ int KOVACredGetByID(long id, KOVA_CRED *pCred) {
     if (pCred == nullptr) {
         return kova::ArgInvalid(kUnit, kLineGetArg, "__null != pCred");
     }
-    KOVACredRandInit();
-    kova::cred::Database db = kova::cred::OpenDatabase();
+    kova::cred::Database db = kova::cred::OpenDatabase(kUnit, kLineGetOpen);
     if (!db) {
-        kova::LogInnerFailure(kUnit, kLineGetOpen, "Init sqlite failed. ");
         return -1;
     }
     if (KOVACredDBRecordGet(db.get(), id, pCred) < 0) {

@@ -74,9 +74,16 @@ using StatementRow = bool (*)(void *arg, sqlite3_stmt *stmt);
 ExecResult StepWithRetry(sqlite3 *db, const char *sql, StatementRow row, void *arg,
                          SqlText *errorMessage);
 
-// Opens the database as KOVACredDBInit does, owning the connection.
-inline Database OpenDatabase() {
-    return Database(KOVACredDBInit());
+// Opens the database for one call of the interface, as KOVACredDBInit does, owning the
+// connection; a failed open is logged as "<unit>:<line> Init sqlite failed. " with the inner
+// error, and the result is empty.
+inline Database OpenDatabase(const char *unit, int line) {
+    KOVACredRandInit();
+    Database db(KOVACredDBInit());
+    if (!db) {
+        LogInnerFailure(unit, line, "Init sqlite failed. ");
+    }
+    return db;
 }
 
 // The id of the newest credential whose application equals `application`, or -1: the list

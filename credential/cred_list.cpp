@@ -16,10 +16,8 @@ int KOVACredListGet(KOVA_CRED **ppCredList, KOVA_CRED_FILTER filter, void *pArg)
     if (ppCredList == nullptr) {
         return kova::ArgInvalid(kUnit, kLineArg, "__null != pCredList");
     }
-    KOVACredRandInit();
-    kova::cred::Database db = kova::cred::OpenDatabase();
+    kova::cred::Database db = kova::cred::OpenDatabase(kUnit, kLineOpen);
     if (!db) {
-        kova::LogInnerFailure(kUnit, kLineOpen, "Init sqlite failed. ");
         return -1;
     }
     KOVA_CRED *head = KOVACredDBRecordGetList(db.get(), nullptr, nullptr, 0);
@@ -42,10 +40,8 @@ int KOVACredListGet(KOVA_CRED **ppCredList, KOVA_CRED_FILTER filter, void *pArg)
 }
 
 int kova::cred::ListNewestCredIdByApplication(const char *application) {
-    KOVACredRandInit();
-    Database db = OpenDatabase();
+    kova::cred::Database db = kova::cred::OpenDatabase(kUnit, kLineOpen);
     if (!db) {
-        kova::LogInnerFailure(kUnit, kLineOpen, "Init sqlite failed. ");
         return -1;
     }
     return NewestCredIdByApplication(db.get(), application);

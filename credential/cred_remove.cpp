@@ -12,10 +12,8 @@ constexpr int kLineRemove = 18;
 }  // namespace
 
 int KOVACredRemoveByID(long id) {
-    KOVACredRandInit();
-    kova::cred::Database db = kova::cred::OpenDatabase();
+    kova::cred::Database db = kova::cred::OpenDatabase(kUnit, kLineOpen);
     if (!db) {
-        kova::LogInnerFailure(kUnit, kLineOpen, "Init sqlite failed. ");
         return -1;
     }
     if (KOVACredDBRecordRemove(db.get(), id) != 0) {

@@ -16,10 +16,8 @@ int KOVACredSessAdd(KOVA_CRED_SESS *pSess) {
     if (pSess == nullptr) {
         return kova::ArgInvalid(kUnit, kLineArg, "__null != pSess");
     }
-    KOVACredRandInit();
-    kova::cred::Database db = kova::cred::OpenDatabase();
+    kova::cred::Database db = kova::cred::OpenDatabase(kUnit, kLineOpen);
     if (!db) {
-        kova::LogInnerFailure(kUnit, kLineOpen, "Init sqlite failed. ");
         return -1;
     }
     int newId = -1;

@@ -16,10 +16,8 @@ int KOVACredSessGetByID(long id, KOVA_CRED_SESS *pSess) {
     if (pSess == nullptr) {
         return kova::ArgInvalid(kUnit, kLineGetArg, "__null != pSess");
     }
-    KOVACredRandInit();
-    kova::cred::Database db = kova::cred::OpenDatabase();
+    kova::cred::Database db = kova::cred::OpenDatabase(kUnit, kLineGetOpen);
     if (!db) {
-        kova::LogInnerFailure(kUnit, kLineGetOpen, "Init sqlite failed. ");
         return -1;
     }
     if (KOVACredSessDBRecordGet(db.get(), id, pSess) < 0) {

@@ -15,10 +15,8 @@ int KOVACredSessListGet(KOVA_CRED_SESS **ppSessList, KOVA_CRED_SESS_FILTER filte
     if (ppSessList == nullptr) {
         return kova::ArgInvalid(kUnit, kLineArg, "__null != pSessList");
     }
-    KOVACredRandInit();
-    kova::cred::Database db = kova::cred::OpenDatabase();
+    kova::cred::Database db = kova::cred::OpenDatabase(kUnit, kLineOpen);
     if (!db) {
-        kova::LogInnerFailure(kUnit, kLineOpen, "Init sqlite failed. ");
         return -1;
     }
     KOVA_CRED_SESS *head = KOVACredSessDBRecordGetList(db.get(), nullptr, nullptr, 0);

@@ -10,27 +10,13 @@
 
 #include <memory>
 
-#include <json/reader.h>
-#include <json/writer.h>
 #include <openssl/evp.h>
+
+#include "simlib/sim_json.h"
 
 namespace kovasim {
 
 namespace {
-
-bool ParseJson(const std::string &text, Json::Value &value) {
-    Json::CharReaderBuilder builder;
-    Json::CharReaderBuilder::strictMode(&builder.settings_);
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-    std::string errors;
-    return !text.empty() && reader->parse(text.data(), text.data() + text.size(), &value, &errors);
-}
-
-std::string WriteJson(const Json::Value &value) {
-    Json::StreamWriterBuilder builder;
-    builder["indentation"] = "";
-    return Json::writeString(builder, value);
-}
 
 Json::Value Failure(int code, const char *message) {
     Json::Value answer(Json::objectValue);

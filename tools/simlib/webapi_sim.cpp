@@ -8,13 +8,13 @@
 #include <sstream>
 #include <thread>
 
-#include <json/reader.h>
-#include <json/writer.h>
 #include <openssl/bn.h>
 #include <openssl/core_names.h>
 #include <openssl/evp.h>
 #include <openssl/rand.h>
 #include <openssl/rsa.h>
+
+#include "simlib/sim_json.h"
 
 namespace kovasim {
 
@@ -36,27 +36,12 @@ struct BnFree {
     void operator()(BIGNUM *bn) const { BN_free(bn); }
 };
 
-std::string CompactJson(const Json::Value &value) {
-    Json::StreamWriterBuilder builder;
-    builder["indentation"] = "";
-    return Json::writeString(builder, value);
-}
-
-bool ParseJson(const std::string &text, Json::Value &value) {
-    Json::CharReaderBuilder builder;
-    Json::CharReaderBuilder::strictMode(&builder.settings_);
-    builder["strictRoot"] = false;  // parameter values are single JSON values
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-    std::string errors;
-    return !text.empty() && reader->parse(text.data(), text.data() + text.size(), &value, &errors);
-}
-
 // Parameters of APIs whose request format is "JSON" arrive in their JSON form, so a string
 // value comes quoted; the standard parameters are read through this in both formats.
 std::string Plain(const std::string &value) {
     if (value.size() >= 2 && value.front() == '"') {
         Json::Value parsed;
-        if (ParseJson(value, parsed) && parsed.isString()) {
+        if (ParseJson(value, parsed, true) && parsed.isString()) {
             return parsed.asString();
         }
     }
@@ -177,14 +162,14 @@ struct WebApiSim::Call {
         answer["success"] = true;
         answer["data"] = data;
         res.status = 200;
-        res.set_content(CompactJson(answer), "application/json");
+        res.set_content(WriteJson(answer), "application/json");
     }
     void Fail(int code) {
         Json::Value answer(Json::objectValue);
         answer["success"] = false;
         answer["error"]["code"] = code;
         res.status = 200;
-        res.set_content(CompactJson(answer), "application/json");
+        res.set_content(WriteJson(answer), "application/json");
     }
 };
 
@@ -715,7 +700,7 @@ void WebApiSim::HandleJson(Call &call) {
             continue;
         }
         Json::Value value;
-        if (!ParseJson(p.second, value)) {
+        if (!ParseJson(p.second, value, true)) {
             call.Fail(kErrBadParam);
             return;
         }
