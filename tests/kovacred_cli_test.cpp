@@ -252,7 +252,7 @@ TEST_F(KovacredTest, FailuresPrintOneLineWithTheCodesNameAndExitNonZero) {
         << r.err;
 }
 
-TEST_F(KovacredTest, WebApiCommandsLogInCallAndLogOut) {
+TEST_F(KovacredTest, WebApiCommandsLogInCallAndLogOutShowingNoSecrets) {
     Add("admin", "secret");
     Add("admin", "wrong");
     Add("otpuser", "secret");
@@ -299,26 +299,24 @@ TEST_F(KovacredTest, WebApiCommandsLogInCallAndLogOut) {
     EXPECT_EQ(Run("login 3 --otp 000000").err,
               "kovacred: login failed (server error 404: wrong one-time code)\n");
     EXPECT_EQ(Run("login 3 --otp 123456").status, 0);
-}
 
-// The password, session id and token of a stored credential reach no output but that of
-// "session show", although the echo API sends the session back in every answer.
-TEST_F(KovacredTest, SecretsAppearOnlyInSessionShow) {
+    // The password, session id and token of a stored credential reach no output but that of
+    // "session show", although the echo API sends the session back in every answer.
     Add("keeper", kPassword);
-    ASSERT_EQ(Run("login 1").status, 0);
-    const std::string batch = R"([{"cred": 1, "api": "KOVA.Demo.Echo", "version": 1,
+    ASSERT_EQ(Run("login 5").status, 0);
+    const std::string batch = R"([{"cred": 5, "api": "KOVA.Demo.Echo", "version": 1,
                                   "method": "echo", "params": {"p": ")" +
                               std::string(kPassword) + "\"}}]";
     std::set<std::string> secrets = {kPassword};
     bool echoed = false;
     for (const std::string command :
-         {"list", "list --json", "show 1", "show 1 --json", "apis 1", "apis 1 --json", "batch -",
-          "batch - --json", "login 1", "call 1 KOVA.Demo.Echo 1 echo",
-          "call 1 KOVA.Demo.Echo 1 echo --json", "logout 1"}) {
-        Result r = Run(command, command.rfind("batch", 0) == 0 ? batch : "");
+         {"list", "list --json", "show 5", "show 5 --json", "apis 5", "apis 5 --json", "batch -",
+          "batch - --json", "login 5", "call 5 KOVA.Demo.Echo 1 echo",
+          "call 5 KOVA.Demo.Echo 1 echo --json", "logout 5"}) {
+        r = Run(command, command.rfind("batch", 0) == 0 ? batch : "");
         EXPECT_TRUE(r.status == 0) << command << ": " << r.err;
         KOVA_CRED_SESS sess;
-        if (KOVACredSessGetByID(1, &sess) == 0 && sess.id == 1) {
+        if (KOVACredSessGetByID(5, &sess) == 0 && sess.id == 5) {
             secrets.insert(sess.access_token);
             secrets.insert(sess.csrf_token);
         }
@@ -331,13 +329,13 @@ TEST_F(KovacredTest, SecretsAppearOnlyInSessionShow) {
     }
     EXPECT_TRUE(echoed) << "the echo answers should have carried the session";
 
-    ASSERT_EQ(Run("login 1").status, 0);
-    KOVA_CRED_SESS sess;
-    ASSERT_EQ(KOVACredSessGetByID(1, &sess), 0);
-    for (const char *command : {"session show 1", "session show 1 --json"}) {
-        Result r = Run(command);
-        EXPECT_NE(r.out.find(sess.access_token), std::string::npos) << r.out;
-        EXPECT_NE(r.out.find(sess.csrf_token), std::string::npos) << r.out;
+    ASSERT_EQ(Run("login 5").status, 0);
+    KOVA_CRED_SESS kept;
+    ASSERT_EQ(KOVACredSessGetByID(5, &kept), 0);
+    for (const char *command : {"session show 5", "session show 5 --json"}) {
+        r = Run(command);
+        EXPECT_NE(r.out.find(kept.access_token), std::string::npos) << r.out;
+        EXPECT_NE(r.out.find(kept.csrf_token), std::string::npos) << r.out;
     }
 }
 
