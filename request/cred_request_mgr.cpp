@@ -409,17 +409,30 @@ int Admit(CURLM *multi, RunControl &control) {
     return started;
 }
 
+// The server a set-up request's transfer goes to: the one its set-up read from the URL, unless
+// the caller took the handle and may have pointed it elsewhere. Empty while reuse is off.
+const std::string &ServerOfTransfer(CredRequest *request, std::string &lentServer) {
+    const CredRequestPrivate *p = CredRequestPrivate::Of(request);
+    if (!CredRequestPool::ReuseEnabled()) {
+        return lentServer;
+    }
+    if (!p->handleLent) {
+        return p->server;
+    }
+    const char *url = nullptr;
+    if (curl_easy_getinfo(p->curl, CURLINFO_EFFECTIVE_URL, &url) == CURLE_OK && url != nullptr) {
+        lentServer = CredRequestPool::ServerOf(url);
+    }
+    return lentServer;
+}
+
 // Starts a set-up request's transfer, or queues it behind its server's probe (see
 // ServerAdmission). Plain HTTP, and every transfer while reuse is off, starts at once.
 void StartOrQueue(CURLM *multi, CredRequest *request, RunControl &control) {
     control.active.push_back(request);
     CURL *easy = HandleOf(request);
-    const char *url = nullptr;
-    std::string server;
-    if (CredRequestPool::ReuseEnabled() &&
-        curl_easy_getinfo(easy, CURLINFO_EFFECTIVE_URL, &url) == CURLE_OK && url != nullptr) {
-        server = CredRequestPool::ServerOf(url);
-    }
+    std::string lentServer;
+    const std::string &server = ServerOfTransfer(request, lentServer);
     if (server.compare(0, 8, "https://") != 0) {
         AddTransfer(multi, request, control);
         return;

@@ -154,6 +154,9 @@ class CredRequestPrivate {
     // pooled) and the pool generation it was taken in.
     std::string poolKey;
     unsigned poolGeneration = 0;
+    // The server of the URL `curl` was set up with (CredRequestPool::ServerOf; empty when
+    // there is none or libcurl cannot parse it), read once for the pool key and the manager.
+    std::string server;
     // Set once the caller took the handle (CredRequest::GetCurlHandler): it may then sit in a
     // multi handle of the caller's or hold state that curl_easy_reset keeps (cookies, a share),
     // so it is cleaned up instead of going back to the pool.
