@@ -6,7 +6,6 @@
 #include <stdlib.h>
 
 #include <algorithm>
-#include <chrono>
 #include <memory>
 #include <new>
 
@@ -137,22 +136,20 @@ void CredRequestFarlinkPrivate::SetTotalTimeout(long milliseconds) {
 
 CredRequestFarlinkPrivate::DeadlineScope::DeadlineScope(CredRequestFarlinkPrivate &client,
                                                         long milliseconds)
-    : client_(client), started_(!client.deadlineRunning && milliseconds > 0) {
+    : client_(client), started_(!client.deadline.IsSet() && milliseconds > 0) {
     if (started_) {
-        client_.deadline =
-            std::chrono::steady_clock::now() + std::chrono::milliseconds(milliseconds);
-        client_.deadlineRunning = true;
+        client_.deadline = kova::Deadline::After(milliseconds);
     }
 }
 
 CredRequestFarlinkPrivate::DeadlineScope::~DeadlineScope() {
     if (started_) {
-        client_.deadlineRunning = false;
+        client_.deadline = kova::Deadline();
     }
 }
 
 bool CredRequestFarlinkPrivate::DeadlineExpired() const {
-    return deadlineRunning && std::chrono::steady_clock::now() >= deadline;
+    return deadline.Expired();
 }
 
 bool CredRequestFarlinkPrivate::BoundRequest(CredRequest &request, long responseTimeout,
@@ -163,21 +160,19 @@ bool CredRequestFarlinkPrivate::BoundRequest(CredRequest &request, long response
     if (defaultTimeout > 0) {
         request.SetDefaultTimeout(defaultTimeout);
     }
-    if (!deadlineRunning) {
+    if (!deadline.IsSet()) {
         return true;
     }
-    // Rounded up, plus the 2 ms that the request's and libcurl's whole-millisecond clocks may
-    // take off it (libcurl rounds the time spent up), so that a request cut short by it ends
+    // Plus the 2 ms that the request's and libcurl's whole-millisecond clocks may take off
+    // what is left (libcurl rounds the time spent up), so that a request cut short by it ends
     // at or after the deadline and its failure is seen as the deadline's.
-    constexpr long long kClockRoundingMs = 2;
-    const long long left =
-        std::chrono::ceil<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now())
-            .count();
+    constexpr long kClockRoundingMs = 2;
+    const long left = deadline.LeftMs();
     if (left <= 0) {
         return false;
     }
-    return request.SetTotalTimeout(
-        static_cast<long>(std::min<long long>(left + kClockRoundingMs, LONG_MAX)));
+    return request.SetTotalTimeout(left < LONG_MAX - kClockRoundingMs ? left + kClockRoundingMs
+                                                                      : LONG_MAX);
 }
 
 // ---- Errors.

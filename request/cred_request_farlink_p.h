@@ -4,7 +4,6 @@
 #ifndef KOVA_REQUEST_CRED_REQUEST_FARLINK_P_H
 #define KOVA_REQUEST_CRED_REQUEST_FARLINK_P_H
 
-#include <chrono>
 #include <string>
 #include <vector>
 
@@ -12,6 +11,7 @@
 
 #include "kovacredential/cred_request.h"
 #include "kovacredential/cred_request_farlink.h"
+#include "platform/kova_deadline.h"
 #include "platform/kova_log.h"
 
 namespace KOVA {
@@ -145,8 +145,8 @@ class CredRequestFarlinkPrivate {
     std::string serviceId = "zon";
     std::string serviceProtocol = "http";
     long totalTimeout = 0;
-    bool deadlineRunning = false;
-    std::chrono::steady_clock::time_point deadline;
+    // The deadline of the operation in progress; none between operations.
+    kova::Deadline deadline;
 };
 
 }  // namespace KOVA

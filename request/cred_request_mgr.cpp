@@ -23,6 +23,7 @@
 #include <openssl/ssl.h>
 
 #include "kovacredential/cred_request_util.h"
+#include "platform/kova_deadline.h"
 #include "platform/kova_log.h"
 #include "request/cred_request_p.h"
 #include "request/cred_request_pool.h"
@@ -338,8 +339,7 @@ struct RunControl {
     // it), made once the run's requests are set up: a finished transfer finds its request
     // without a walk through all of them.
     std::unordered_map<CURL *, CredRequest *> requestOf;
-    bool hasDeadline = false;
-    Clock::time_point deadline;
+    kova::Deadline deadline;
     const RunRegistration *registration = nullptr;
 };
 
@@ -409,17 +409,30 @@ int Admit(CURLM *multi, RunControl &control) {
     return started;
 }
 
+// The server a set-up request's transfer goes to: the one its set-up read from the URL, unless
+// the caller took the handle and may have pointed it elsewhere. Empty while reuse is off.
+const std::string &ServerOfTransfer(CredRequest *request, std::string &lentServer) {
+    const CredRequestPrivate *p = CredRequestPrivate::Of(request);
+    if (!CredRequestPool::ReuseEnabled()) {
+        return lentServer;
+    }
+    if (!p->handleLent) {
+        return p->server;
+    }
+    const char *url = nullptr;
+    if (curl_easy_getinfo(p->curl, CURLINFO_EFFECTIVE_URL, &url) == CURLE_OK && url != nullptr) {
+        lentServer = CredRequestPool::ServerOf(url);
+    }
+    return lentServer;
+}
+
 // Starts a set-up request's transfer, or queues it behind its server's probe (see
 // ServerAdmission). Plain HTTP, and every transfer while reuse is off, starts at once.
 void StartOrQueue(CURLM *multi, CredRequest *request, RunControl &control) {
     control.active.push_back(request);
     CURL *easy = HandleOf(request);
-    const char *url = nullptr;
-    std::string server;
-    if (CredRequestPool::ReuseEnabled() &&
-        curl_easy_getinfo(easy, CURLINFO_EFFECTIVE_URL, &url) == CURLE_OK && url != nullptr) {
-        server = CredRequestPool::ServerOf(url);
-    }
+    std::string lentServer;
+    const std::string &server = ServerOfTransfer(request, lentServer);
     if (server.compare(0, 8, "https://") != 0) {
         AddTransfer(multi, request, control);
         return;
@@ -448,7 +461,8 @@ bool CredRequestMgr::Run(long timeoutMilliseconds) {
         SetError(CRED_REQ_ERR_BAD_PARAM);
         return false;
     }
-    const Clock::time_point start = Clock::now();
+    // The deadline counts from the call, the set-up of the multi handle and the requests included.
+    const kova::Deadline deadline = kova::Deadline::After(timeoutMilliseconds);
     // The thread's multi handle keeps the connections of earlier runs (see
     // CredRequestPool::ThreadMulti).
     bool ownedMulti = false;
@@ -491,10 +505,7 @@ bool CredRequestMgr::Run(long timeoutMilliseconds) {
     return kova::Guarded(kUnit, kLineMgrException, false, [&] {
         const RunRegistration registration(this);
         control.registration = &registration;
-        if (timeoutMilliseconds > 0) {
-            control.hasDeadline = true;
-            control.deadline = start + Millis(timeoutMilliseconds);
-        }
+        control.deadline = deadline;
         control.active.reserve(requests.size());
         long longestTimeout = 0;
         for (CredRequest *request : requests) {
@@ -724,9 +735,8 @@ bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunCont
         const Clock::time_point now = Clock::now();
         Millis wait =
             std::max(wholeWait - std::chrono::duration_cast<Millis>(now - quietSince), Millis(0));
-        if (control != nullptr && control->hasDeadline) {
-            wait = std::min(
-                wait, std::max(std::chrono::ceil<Millis>(control->deadline - now), Millis(0)));
+        if (control != nullptr && control->deadline.IsSet()) {
+            wait = std::min(wait, Millis(std::max(control->deadline.LeftMs(), 0L)));
         }
         int ready = 0;
         code = WaitForSockets(
@@ -738,7 +748,7 @@ bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunCont
                       strerror(EINTR), EINTR);
             return StopRun(mgr, multi, *control, CRED_REQ_ERR_SELECT);
         }
-        if (control != nullptr && control->hasDeadline && Clock::now() >= control->deadline) {
+        if (control != nullptr && control->deadline.Expired()) {
             return StopRun(mgr, multi, *control, CRED_REQ_ERR_TIMEOUT);
         }
         if (code != CURLM_OK) {

@@ -16,6 +16,7 @@
 
 #include "kovacredential/cred_request.h"
 #include "kovacredential/kovacred.h"
+#include "platform/kova_deadline.h"
 
 namespace KOVA {
 
@@ -95,9 +96,6 @@ class CredRequestPrivate {
     // ---- Deadline and transfer facts.
     // Starts the deadline of a Process from now (with a total time-out).
     void StartDeadline();
-    // Milliseconds left until the deadline of the current Process (negative once it has
-    // passed); LONG_MAX without a total time-out.
-    long DeadlineLeftMs() const;
     // Limits the next attempt on the handle to what is left of the deadline (no limit without
     // a total time-out). False when the option cannot be set (CRED_REQ_ERR_CURL_INTERNAL).
     bool ArmDeadline();
@@ -156,6 +154,9 @@ class CredRequestPrivate {
     // pooled) and the pool generation it was taken in.
     std::string poolKey;
     unsigned poolGeneration = 0;
+    // The server of the URL `curl` was set up with (CredRequestPool::ServerOf; empty when
+    // there is none or libcurl cannot parse it), read once for the pool key and the manager.
+    std::string server;
     // Set once the caller took the handle (CredRequest::GetCurlHandler): it may then sit in a
     // multi handle of the caller's or hold state that curl_easy_reset keeps (cookies, a share),
     // so it is cleaned up instead of going back to the pool.
@@ -185,9 +186,8 @@ class CredRequestPrivate {
     // force it before the handle is set up.
     bool secureProcess = SecureProcess();
 
-    // The deadline of the current Process (CLOCK_MONOTONIC, milliseconds), with a total
-    // time-out.
-    int64_t deadlineMs = 0;
+    // The deadline of the current Process, with a total time-out.
+    kova::Deadline deadline;
     // What libcurl tells of the last transfer attempt, read from the handle right after it (the
     // handle may serve another request later) and turned into JSON only when asked for.
     struct TransferFacts {

@@ -175,8 +175,8 @@ struct ThreadMultiHolder {
 };
 thread_local ThreadMultiHolder tThreadMulti;
 
-// The server of the URL this thread asked KeyOf for last: requests in a row mostly go to the
-// same URL, which then is not parsed again.
+// The server of the URL this thread asked ServerOf for last: requests in a row mostly go to
+// the same URL, which then is not parsed again.
 struct LastServer {
     std::string url;
     std::string server;
@@ -196,26 +196,18 @@ unsigned CredRequestPool::Generation() {
     return gGeneration;
 }
 
-std::string CredRequestPool::KeyOf(const std::string &url, const Tls &tls) {
+std::string CredRequestPool::KeyOf(const std::string &server, const Tls &tls) {
     (void)gForkHandlers;
-    if (!ReuseEnabled()) {
-        return std::string();
-    }
-    LastServer &last = tLastServer;
-    if (last.server.empty() || last.url != url) {
-        last.server = ServerOf(url);
-        last.url = last.server.empty() ? std::string() : url;
-    }
-    if (last.server.empty()) {
+    if (server.empty() || !ReuseEnabled()) {
         return std::string();
     }
     // Lengths keep the free-form parts from running into each other.
     const std::string caLength = std::to_string(tls.caFile.size());
     const std::string pinLength = std::to_string(tls.pinnedKey.size());
     std::string key;
-    key.reserve(last.server.size() + caLength.size() + tls.caFile.size() + pinLength.size() +
+    key.reserve(server.size() + caLength.size() + tls.caFile.size() + pinLength.size() +
                 tls.pinnedKey.size() + 24);
-    key.append(last.server)
+    key.append(server)
         .append(tls.verify ? " verify" : " noverify")
         .append(" ca")
         .append(caLength)
@@ -229,6 +221,10 @@ std::string CredRequestPool::KeyOf(const std::string &url, const Tls &tls) {
 }
 
 std::string CredRequestPool::ServerOf(const std::string &url) {
+    LastServer &last = tLastServer;
+    if (!last.server.empty() && last.url == url) {
+        return last.server;
+    }
     std::unique_ptr<CURLU, UrlDeleter> parsed(curl_url());
     if (!parsed ||
         curl_url_set(parsed.get(), CURLUPART_URL, url.c_str(), CURLU_GUESS_SCHEME) != CURLUE_OK) {
@@ -245,7 +241,9 @@ std::string CredRequestPool::ServerOf(const std::string &url) {
             c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
         }
     }
-    return scheme + "://" + host + ":" + port;
+    last.server = scheme + "://" + host + ":" + port;
+    last.url = url;
+    return last.server;
 }
 
 CURLM *CredRequestPool::ThreadMulti(bool *owned) {

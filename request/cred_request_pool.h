@@ -63,9 +63,9 @@ class CredRequestPool {
         std::string pinnedKey;
     };
 
-    // The pool key of a request to `url` under `tls`; empty (not pooled) when reuse is switched
-    // off or libcurl cannot parse the URL.
-    static std::string KeyOf(const std::string &url, const Tls &tls);
+    // The pool key of a request to `server` (ServerOf of its URL) under `tls`; empty (not
+    // pooled) when reuse is switched off or `server` is empty.
+    static std::string KeyOf(const std::string &server, const Tls &tls);
 
     // A handle for `key`: an idle one, reset to libcurl's defaults, or a new one (attached to the
     // share when `key` is not empty). Null when libcurl cannot make one. `*generation` receives
@@ -80,7 +80,8 @@ class CredRequestPool {
     // Null when the copy cannot be made.
     static CURL *FreshIfInherited(CURL *curl, std::string *key, unsigned *generation);
     // "scheme://host:port" of `url` (scheme and host in lower case, the scheme's port when the
-    // URL names none); empty when libcurl cannot parse it.
+    // URL names none); empty when libcurl cannot parse it. The same URL as the thread's last
+    // one is not parsed again.
     static std::string ServerOf(const std::string &url);
 
     // The multi handle the request manager runs its transfers on, on this thread. While a

@@ -1,11 +1,9 @@
 // Execution of KOVA::CredRequest: the transfer with bounded retries and the mapping of every
 // libcurl result and HTTP status to one request error.
 #include <stdio.h>
-#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <limits>
 
 #include "kovacredential/cred_request_util.h"
 #include "platform/kova_log.h"
@@ -27,12 +25,6 @@ bool PausesBeforeRetry(CURLcode rc) {
 
 // The pause before a retry after a resolve failure or a time-out, in milliseconds (sleep(1)).
 constexpr long kRetryPauseMs = 1000;
-
-int64_t MonotonicMs() {
-    struct timespec now = {};
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
-}
 
 // A libcurl time in microseconds, 0 when libcurl cannot tell it.
 curl_off_t Micros(CURL *curl, CURLINFO what) {
@@ -62,20 +54,13 @@ const char *HttpVersionText(long version) {
 }  // namespace
 
 void CredRequestPrivate::StartDeadline() {
-    deadlineMs = totalTimeoutMs > 0 ? MonotonicMs() + totalTimeoutMs : 0;
-}
-
-long CredRequestPrivate::DeadlineLeftMs() const {
-    if (deadlineMs == 0) {
-        return std::numeric_limits<long>::max();
-    }
-    return static_cast<long>(deadlineMs - MonotonicMs());
+    deadline = kova::Deadline::After(totalTimeoutMs);
 }
 
 bool CredRequestPrivate::ArmDeadline() {
     // A deadline that has passed still leaves the attempt 1 ms, which libcurl ends with its
     // own time-out.
-    const long limit = deadlineMs != 0 ? std::max(DeadlineLeftMs(), 1L) : 0L;
+    const long limit = deadline.IsSet() ? std::max(deadline.LeftMs(), 1L) : 0L;
     if (!SetOption(CURLOPT_TIMEOUT_MS, limit)) {
         return false;
     }
@@ -83,7 +68,7 @@ bool CredRequestPrivate::ArmDeadline() {
     // getaddrinfo without reply lasts the system resolver's whole time-out); under a deadline
     // it leaves the thread to finish on its own instead. Older libcurl lacks the option and
     // keeps waiting, hence the result is not checked.
-    curl_easy_setopt(curl, CURLOPT_QUICK_EXIT, deadlineMs != 0 ? 1L : 0L);
+    curl_easy_setopt(curl, CURLOPT_QUICK_EXIT, deadline.IsSet() ? 1L : 0L);
     return true;
 }
 
@@ -178,7 +163,7 @@ bool CredRequest::Process(bool perform, int retries) {
             }
             // Retries, and the pause before one, fit within the deadline or are not made.
             const bool pause = PausesBeforeRetry(rc);
-            if (d->DeadlineLeftMs() <= (pause ? kRetryPauseMs : 0)) {
+            if (d->deadline.LeftMs() <= (pause ? kRetryPauseMs : 0)) {
                 rc = CURLE_OPERATION_TIMEDOUT;
                 break;
             }

@@ -109,9 +109,9 @@ bool CredRequestPrivate::InitCurlHandler() {
         tls.verify = verifySetting.isBool() && verifySetting.asBool();
         tls.caFile = caFile;
         tls.pinnedKey = pinnedPublicKey;
-        poolKey = urlValue.isString() && sslCtxFn == nullptr
-                      ? CredRequestPool::KeyOf(urlValue.asString(), tls)
-                      : std::string();
+        server =
+            urlValue.isString() ? CredRequestPool::ServerOf(urlValue.asString()) : std::string();
+        poolKey = sslCtxFn == nullptr ? CredRequestPool::KeyOf(server, tls) : std::string();
         curl = CredRequestPool::Acquire(poolKey, &poolGeneration);
         if (curl == nullptr) {
             error = CRED_REQ_ERR_CURL_INTERNAL;

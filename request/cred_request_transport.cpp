@@ -31,8 +31,8 @@ void CredRequestPrivate::TakeTransport(const CredRequestPrivate &transport) {
     caFile = transport.caFile;
     pinnedPublicKey = transport.pinnedPublicKey;
     defaultTimeout = transport.defaultTimeout;
-    if (transport.deadlineMs != 0) {
-        totalTimeoutMs = std::max(transport.DeadlineLeftMs(), 1L);
+    if (transport.deadline.IsSet()) {
+        totalTimeoutMs = std::max(transport.deadline.LeftMs(), 1L);
     } else {
         totalTimeoutMs = transport.totalTimeoutMs;
     }

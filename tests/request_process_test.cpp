@@ -455,12 +455,16 @@ TEST_F(ProcessTest, StallTimesOutAndCutsTheResponseStreamBackBeforeTheNextAttemp
     EXPECT_EQ(ReadAll(own.get()), hundred);
 
     // libcurl counts the stall in milliseconds held in a long: time-outs beyond that range (30
-    // days where long has 32 bits, the longest long anywhere) must still let a stall pass.
-    for (long seconds : {30L * 24 * 3600, std::numeric_limits<long>::max()}) {
-        SCOPED_TRACE(seconds);
+    // days where long has 32 bits, the longest long anywhere) must still let a stall pass, and
+    // so must total time-outs past the range of the monotonic clock's nanoseconds.
+    constexpr long kLongest = std::numeric_limits<long>::max();
+    for (const auto &limits : {std::make_pair(30L * 24 * 3600, kLongest / 1000),
+                               std::make_pair(kLongest, kLongest)}) {
+        SCOPED_TRACE(limits.first);
         KOVA::CredRequest slow;
         ASSERT_TRUE(slow.SetURL(raw.BaseUrl() + "/"));
-        ASSERT_TRUE(slow.SetResponseTimeout(seconds));
+        ASSERT_TRUE(slow.SetResponseTimeout(limits.first));
+        ASSERT_TRUE(slow.SetTotalTimeout(limits.second));
         EXPECT_TRUE(slow.Process(true, 0)) << slow.GetError();
         EXPECT_EQ(slow.GetResponse(), "complete");
     }
