@@ -2,6 +2,7 @@
 
 #include <stdlib.h>
 #include <string.h>
+#include <sys/auxv.h>
 
 #include <atomic>
 
@@ -31,8 +32,11 @@ size_t IndexOf(const char *name) {
 }  // namespace
 
 const char *SecureEnv(const char *name) {
+    // Only a secure process can have a variable that secure_getenv does not give; the kernel
+    // sets that for the process's life, so the second search is made only there.
+    static const bool secureExecution = getauxval(AT_SECURE) != 0;
     const char *value = secure_getenv(name);
-    if (value == nullptr && getenv(name) != nullptr &&
+    if (value == nullptr && secureExecution && getenv(name) != nullptr &&
         !gLogged[IndexOf(name)].exchange(true, std::memory_order_relaxed)) {
         Log("%s:%d %s is set but ignored: the process runs in secure-execution mode (set-user-ID, "
             "set-group-ID or file capabilities)\n",

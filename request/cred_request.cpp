@@ -1,5 +1,7 @@
 // KOVA::CredRequest settings: the request settings document, its low-level operations and the
 // public setters and getters built on them.
+#include <string.h>
+
 #include <utility>
 
 #include "kovacredential/cred_request.h"
@@ -128,8 +130,14 @@ const Json::Value &CredRequestPrivate::GetData(const std::string &key, const std
     return member != nullptr ? *member : fallback;
 }
 
-bool CredRequestPrivate::HasData(const std::string &key) const {
-    return settings.isMember(key);
+const Json::Value &CredRequestPrivate::Setting(const char *key) const {
+    static const Json::Value kNone;
+    const Json::Value *slot = settings.find(key, key + strlen(key));
+    return slot != nullptr ? *slot : kNone;
+}
+
+bool CredRequestPrivate::HasData(const char *key) const {
+    return settings.find(key, key + strlen(key)) != nullptr;
 }
 
 bool CredRequestPrivate::HasRawData(const std::string &key) const {
@@ -334,7 +342,7 @@ bool CredRequest::SetResponseTimeout(long seconds) {
 long CredRequest::GetResponseTimeout() {
     constexpr long kUnsetResponseTimeout = 120;
     return OnPrivate(d, kUnsetResponseTimeout, [&](CredRequestPrivate &p) {
-        const Json::Value &value = p.GetData("RespTime", "", kNull);
+        const Json::Value &value = p.Setting("RespTime");
         if (!value.isIntegral()) {
             return kUnsetResponseTimeout;
         }

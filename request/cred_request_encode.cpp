@@ -27,12 +27,12 @@ namespace {
 // Encryption mode of the document: 0 (plain) when "Crypto" is absent, not a number, or a number
 // no mode can be (asInt would throw on a value beyond int).
 int CryptoMode(const CredRequestPrivate &p) {
-    const Json::Value &mode = p.GetData("Crypto", "", kNull);
+    const Json::Value &mode = p.Setting("Crypto");
     return mode.isInt() ? mode.asInt() : 0;
 }
 
 bool IsJsonFormat(const CredRequestPrivate &p) {
-    const Json::Value &format = p.GetData("Format", "", kNull);
+    const Json::Value &format = p.Setting("Format");
     return format.isString() && format.asString() == "JSON";
 }
 }  // namespace
@@ -125,7 +125,7 @@ constexpr int kLineRsaEncStringFail = 157;
 
 bool CredRequestPrivate::GetRSAEncParam(const Json::Value &params, std::string &name,
                                         std::string &value) {
-    const Json::Value &encUrl = GetData("EncURL", "", kNull);
+    const Json::Value &encUrl = Setting("EncURL");
     if (!encUrl.isString()) {
         kova::Log("%s:%d Get encryption url fail", kUnit, kLineRsaNoEncUrl);
         return false;
@@ -196,7 +196,7 @@ bool CredRequestPrivate::GetAESEncParam(const Json::Value &params, std::string &
 constexpr int kLineCookieFormat = 201;
 
 std::string CredRequestPrivate::GetCookies() {
-    const Json::Value &cookies = GetData("Cookie", "", kNull);
+    const Json::Value &cookies = Setting("Cookie");
     if (!cookies.isConvertibleTo(Json::objectValue)) {
         kova::Log("%s:%d Invalid Cookie format", kUnit, kLineCookieFormat);
         return "";

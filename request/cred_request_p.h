@@ -41,7 +41,9 @@ class CredRequestPrivate {
     // otherwise `fallback`.
     const Json::Value &GetData(const std::string &key, const std::string &name,
                                const Json::Value &fallback) const;
-    bool HasData(const std::string &key) const;
+    // The member `key` of the settings document, or a null value when it has none.
+    const Json::Value &Setting(const char *key) const;
+    bool HasData(const char *key) const;
     bool HasRawData(const std::string &key) const;
     bool HasData(const std::string &key, const std::string &name) const;
     const Json::Value &GetResponseHeader() const { return respHeader; }

@@ -100,12 +100,12 @@ bool CredRequestPrivate::InitCurlHandler() {
         return true;
     }
     InitCurlGlobal(secureProcess);
-    const Json::Value &urlValue = GetData("URL", "", kNull);
+    const Json::Value &urlValue = Setting("URL");
     // The handle comes from the pool of the server and TLS settings; a request with a TLS
     // context callback, or without a URL, gets one of its own.
     auto takeHandle = [&] {
         CredRequestPool::Tls tls;
-        const Json::Value &verifySetting = GetData("VerifySSL", "", kNull);
+        const Json::Value &verifySetting = Setting("VerifySSL");
         tls.verify = verifySetting.isBool() && verifySetting.asBool();
         tls.caFile = caFile;
         tls.pinnedKey = pinnedPublicKey;
@@ -143,7 +143,7 @@ bool CredRequestPrivate::InitCurlHandler() {
     // Parameters are encoded before the handle is taken: encoding may fetch the server's
     // encryption information with a request of its own, which then finds the kept connection
     // to the server free.
-    const Json::Value &fileObj = GetData("File", "", kNull);
+    const Json::Value &fileObj = Setting("File");
     const bool rawBody = HasData("RawParam");
     const Json::Value formFields =
         !rawBody && fileObj.isObject()
@@ -187,7 +187,7 @@ bool CredRequestPrivate::InitCurlHandler() {
     // Certificate and host checks are off unless asked for; a TLS context callback forces them
     // and its own handshake on every transfer (a fresh connection, closed after it, no TLS
     // session resumed), so that the callback sees each one.
-    const Json::Value &verify = GetData("VerifySSL", "", kNull);
+    const Json::Value &verify = Setting("VerifySSL");
     if (sslCtxFn != nullptr) {
         if (!SetOption(CURLOPT_SSL_VERIFYPEER, 1L) ||
             !SetOption(CURLOPT_SSL_VERIFYHOST, kVerifyHostName) ||
@@ -214,7 +214,7 @@ bool CredRequestPrivate::InitCurlHandler() {
         return false;
     }
 
-    const Json::Value &respTime = GetData("RespTime", "", kNull);
+    const Json::Value &respTime = Setting("RespTime");
     const Json::Int64 lowSpeedTime = respTime.isInt64() ? respTime.asInt64() : defaultTimeout;
     if (!SetOption(CURLOPT_TCP_KEEPALIVE, 1L) || !SetOption(CURLOPT_TCP_KEEPIDLE, defaultTimeout) ||
         !SetOption(CURLOPT_TCP_KEEPINTVL, defaultTimeout) ||
@@ -225,7 +225,7 @@ bool CredRequestPrivate::InitCurlHandler() {
         return false;
     }
 
-    if (GetData("Cookie", "", kNull).isObject()) {
+    if (Setting("Cookie").isObject()) {
         std::string cookies = GetCookies();
         if (!SetOption(CURLOPT_COOKIE, cookies.c_str())) {
             return false;
@@ -234,7 +234,7 @@ bool CredRequestPrivate::InitCurlHandler() {
 
     // An empty Expect header stops libcurl from waiting for an interim 100 answer; it is sent
     // only together with the caller's own headers.
-    const Json::Value &headerObj = GetData("Header", "", kNull);
+    const Json::Value &headerObj = Setting("Header");
     if (headerObj.isObject()) {
         struct curl_slist *list = curl_slist_append(nullptr, "Expect:");
         if (list == nullptr) {
@@ -314,7 +314,7 @@ bool CredRequestPrivate::InitCurlHandler() {
         }
     }
 
-    if (GetData("RespHeader", "", kNull).isObject()) {
+    if (Setting("RespHeader").isObject()) {
         Json::Value &respHeaderSettings = settings["RespHeader"];
         const Json::Value &mode = GetData("RespHeader", "MODE", kNull);
         const std::string modeText = mode.isString() ? mode.asString() : std::string();
