@@ -28,9 +28,22 @@ constexpr int kLineConstructException = 25;
 
 }  // namespace
 
-CredRequestPrivate::CredRequestPrivate(CredRequest *ownerRequest)
-    : cred(KOVACredAlloc()), sess(KOVACredSessAlloc()), owner(ownerRequest) {
+CredRequestPrivate::CredRequestPrivate(CredRequest *ownerRequest) : owner(ownerRequest) {
     reqStreamLimited = false;
+}
+
+KOVA_CRED *CredRequestPrivate::Cred() {
+    if (cred == nullptr) {
+        cred = KOVACredAlloc();
+    }
+    return cred;
+}
+
+KOVA_CRED_SESS *CredRequestPrivate::Sess() {
+    if (sess == nullptr) {
+        sess = KOVACredSessAlloc();
+    }
+    return sess;
 }
 
 CredRequestPrivate::~CredRequestPrivate() {

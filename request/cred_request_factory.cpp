@@ -40,12 +40,12 @@ bool CredRequest::SetWebAPIRequest(const std::string &api, int version, const st
             kova::Log("%s:%d Bad parameters", kUnit, kLineSetBadParam);
             return false;
         }
-        if (!CredRequestUtil::SetWebAPIURL(d->cred, api, version, method, this)) {
+        if (!CredRequestUtil::SetWebAPIURL(d->Cred(), api, version, method, this)) {
             kova::Log("%s:%d SetWebAPIURL fail", kUnit, kLineSetUrl);
             return false;
         }
         std::string format;
-        if (!CredRequestUtil::GetWebAPIRequestFormat(d->cred, api, format)) {
+        if (!CredRequestUtil::GetWebAPIRequestFormat(d->Cred(), api, format)) {
             kova::Log("%s:%d GetWebAPIRequestFormat fail[%s]", kUnit, kLineSetFormat, api.c_str());
             return false;
         }
@@ -227,10 +227,11 @@ bool CredRequestPrivate::buildCredByURL(const std::string &url) {
             error = CRED_REQ_ERR_LOGIN_PARAM;
             return false;
         }
-        if (cred == nullptr || KOVACredItemSetProtocol(cred, protocol.c_str()) < 0 ||
-            KOVACredItemSetPort(cred, static_cast<int32_t>(strtol(port.c_str(), nullptr, 10))) <
+        KOVA_CRED *built = Cred();
+        if (built == nullptr || KOVACredItemSetProtocol(built, protocol.c_str()) < 0 ||
+            KOVACredItemSetPort(built, static_cast<int32_t>(strtol(port.c_str(), nullptr, 10))) <
                 0 ||
-            KOVACredItemSetHost(cred, host.c_str()) < 0) {
+            KOVACredItemSetHost(built, host.c_str()) < 0) {
             error = CRED_REQ_ERR_LOGIN_PARAM;
             return false;
         }

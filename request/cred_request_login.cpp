@@ -49,22 +49,23 @@ bool CredRequest::Login(const std::string &account, const std::string &password,
             return false;
         }
         if (account.empty() || password.empty() ||
-            KOVACredItemSetRemoteAccount(d->cred, account.c_str()) < 0 ||
-            KOVACredItemSetRemotePasswd(d->cred, password.c_str()) < 0) {
+            KOVACredItemSetRemoteAccount(d->Cred(), account.c_str()) < 0 ||
+            KOVACredItemSetRemotePasswd(d->Cred(), password.c_str()) < 0) {
             SetError(CRED_REQ_ERR_LOGIN_PARAM);
             return false;
         }
-        if (d->sess == nullptr || !CredRequestUtil::LoginWithOTP(d->cred, "", d->sess, nullptr) ||
-            d->sess->access_token.empty()) {
+        if (d->Sess() == nullptr ||
+            !CredRequestUtil::LoginWithOTP(d->Cred(), "", d->Sess(), nullptr) ||
+            d->Sess()->access_token.empty()) {
             SetError(CRED_REQ_ERR_LOGIN_SESSION);
             return false;
         }
-        const std::string sid = d->sess->access_token;
+        const std::string sid = d->Sess()->access_token;
         if (!AddCookie("id", sid) || !AddGetParam("_sid", sid)) {
             SetError(CRED_REQ_ERR_LOGIN_SESSION);
             return false;
         }
-        if (!d->sess->csrf_token.empty() && !AddGetParam("KovaToken", d->sess->csrf_token)) {
+        if (!d->Sess()->csrf_token.empty() && !AddGetParam("KovaToken", d->Sess()->csrf_token)) {
             kova::Log("%s:%d Add csrf_token fail", kUnit, kLineLoginToken);
             SetError(CRED_REQ_ERR_LOGIN_SESSION);
             return false;
@@ -75,11 +76,11 @@ bool CredRequest::Login(const std::string &account, const std::string &password,
 
 bool CredRequest::Logout() {
     return kova::GuardedOn(kUnit, kLineLoginException, d, false, [&](CredRequestPrivate &) {
-        if (d->cred == nullptr || d->sess == nullptr || d->cred->host.empty() ||
-            d->cred->protocol.empty() || d->sess->access_token.empty()) {
+        if (d->Cred() == nullptr || d->Sess() == nullptr || d->Cred()->host.empty() ||
+            d->Cred()->protocol.empty() || d->Sess()->access_token.empty()) {
             return false;
         }
-        return CredRequestUtil::Logout(d->cred, d->sess);
+        return CredRequestUtil::Logout(d->Cred(), d->Sess());
     });
 }
 
@@ -88,7 +89,7 @@ bool CredRequest::isAPIValid(const std::string &api) {
         if (!d->buildCredByURL(GetURL())) {
             return false;
         }
-        return !CredRequestUtil::GetWebAPIPath(d->cred, api).empty();
+        return !CredRequestUtil::GetWebAPIPath(d->Cred(), api).empty();
     });
 }
 

@@ -148,8 +148,12 @@ class CredRequestPrivate {
     static std::atomic<bool> headerMessageShown;
 
     // Fields, in this order.
-    KOVA_CRED *cred;
-    KOVA_CRED_SESS *sess;
+    // The credential and session a login or WebAPI call of this request fills, made at their
+    // first use (a plain request needs neither); null when memory ran out.
+    KOVA_CRED *Cred();
+    KOVA_CRED_SESS *Sess();
+    KOVA_CRED *cred = nullptr;
+    KOVA_CRED_SESS *sess = nullptr;
     CredRequest *owner;
     CURL *curl = nullptr;
     // Where `curl` goes back to (request/cred_request_pool.h): its pool key (empty: not
