@@ -647,8 +647,8 @@ TEST_F(PrivilegedDatabaseTest, FileOfAnotherUserIsRefusedAndOwnFilesGetTheirMode
         },
         60);
     EXPECT_EQ(WaitChild(child), 0);
-    EXPECT_EQ((std::vector<long>{OwnerOf(victim), ModeOf(victim)}),
-              (std::vector<long>{1000, 0666}));
+    EXPECT_EQ((std::vector<unsigned long>{OwnerOf(victim), ModeOf(victim)}),
+              (std::vector<unsigned long>{1000, 0666}));
     EXPECT_EQ(ReadFile(victim), "");
     EXPECT_EQ(RawQuery(own, "SELECT host FROM credentials;"), (std::vector<Row>{{"h"}}));
 }
