@@ -458,8 +458,8 @@ TEST_F(ProcessTest, StallTimesOutAndCutsTheResponseStreamBackBeforeTheNextAttemp
     // days where long has 32 bits, the longest long anywhere) must still let a stall pass, and
     // so must total time-outs past the range of the monotonic clock's nanoseconds.
     constexpr long kLongest = std::numeric_limits<long>::max();
-    for (const auto &limits : {std::make_pair(30L * 24 * 3600, kLongest / 1000),
-                               std::make_pair(kLongest, kLongest)}) {
+    for (const auto &limits :
+         {std::make_pair(30L * 24 * 3600, kLongest / 1000), std::make_pair(kLongest, kLongest)}) {
         SCOPED_TRACE(limits.first);
         KOVA::CredRequest slow;
         ASSERT_TRUE(slow.SetURL(raw.BaseUrl() + "/"));
