@@ -66,6 +66,14 @@ void LogMultiError(int line, CURLMcode code) {
               curl_multi_strerror(code));
 }
 
+// A multi-handle call that failed ends the run: logged at `line`, the manager's error
+// CRED_REQ_ERR_CURL_INTERNAL, and false for the run to return.
+bool MultiFailed(CredRequestMgr &mgr, int line, CURLMcode code) {
+    mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
+    LogMultiError(line, code);
+    return false;
+}
+
 }  // namespace
 
 CredRequestMgr::CredRequestMgr() : error(CRED_REQ_ERR_NONE) {}
@@ -488,15 +496,11 @@ bool CredRequestMgr::Run(long timeoutMilliseconds) {
     CURLMcode code =
         curl_multi_setopt(multi, CURLMOPT_SOCKETFUNCTION, &CredRequestMgr::SocketCallback);
     if (code != CURLM_OK) {
-        SetError(CRED_REQ_ERR_CURL_INTERNAL);
-        LogMultiError(kLineSocketFunctionFail, code);
-        return false;
+        return MultiFailed(*this, kLineSocketFunctionFail, code);
     }
     code = curl_multi_setopt(multi, CURLMOPT_SOCKETDATA, this);
     if (code != CURLM_OK) {
-        SetError(CRED_REQ_ERR_CURL_INTERNAL);
-        LogMultiError(kLineSocketDataFail, code);
-        return false;
+        return MultiFailed(*this, kLineSocketDataFail, code);
     }
     if (requests.empty()) {
         return true;
@@ -710,15 +714,11 @@ bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunCont
     int running = 0;
     CURLMcode code = curl_multi_perform(multi, &running);
     if (code != CURLM_OK) {
-        mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
-        LogMultiError(kLineFirstPerformFail, code);
-        return false;
+        return MultiFailed(mgr, kLineFirstPerformFail, code);
     }
     code = Advance(multi, &running, mgr, control);
     if (code != CURLM_OK) {
-        mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
-        LogMultiError(kLineFirstPerformFail, code);
-        return false;
+        return MultiFailed(mgr, kLineFirstPerformFail, code);
     }
     // The run ends with a time-out once no socket has been ready for a whole wait. The wait is
     // polled (descriptors of any number); libcurl cuts it short for its own timer, and so does
@@ -753,9 +753,7 @@ bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunCont
         }
         if (code != CURLM_OK) {
             if (!IsPollFailure(code)) {
-                mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
-                LogMultiError(kLineFdsetFail, code);
-                return false;
+                return MultiFailed(mgr, kLineFdsetFail, code);
             }
             kova::Log("%s:%d %s select error: %s[%d]", kUnit, kLineSelectError, kLoopName,
                       strerror(err), err);
@@ -766,17 +764,13 @@ bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunCont
             quietSince = Clock::now();
             code = curl_multi_perform(multi, &running);
             if (code != CURLM_OK) {
-                mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
-                LogMultiError(kLineReadyPerformFail, code);
-                return false;
+                return MultiFailed(mgr, kLineReadyPerformFail, code);
             }
         } else if (Clock::now() - quietSince < wholeWait) {
             // libcurl's timer is due (or a signal woke the wait): let it advance.
             code = curl_multi_perform(multi, &running);
             if (code != CURLM_OK) {
-                mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
-                LogMultiError(kLineIdlePerformFail, code);
-                return false;
+                return MultiFailed(mgr, kLineIdlePerformFail, code);
             }
         } else {
             if (retries > kMaxSelectRetries) {
@@ -797,16 +791,12 @@ bool DriveTransfers(CredRequestMgr &mgr, CURLM *multi, long waitSeconds, RunCont
             ++retries;
             quietSince = Clock::now();
             if (code != CURLM_OK) {
-                mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
-                LogMultiError(kLineRetryPerformFail, code);
-                return false;
+                return MultiFailed(mgr, kLineRetryPerformFail, code);
             }
         }
         code = Advance(multi, &running, mgr, control);
         if (code != CURLM_OK) {
-            mgr.SetError(CRED_REQ_ERR_CURL_INTERNAL);
-            LogMultiError(kLineReadyPerformFail, code);
-            return false;
+            return MultiFailed(mgr, kLineReadyPerformFail, code);
         }
     }
     return true;

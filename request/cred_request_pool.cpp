@@ -84,6 +84,16 @@ void TakeExpired(PoolState &state, std::vector<CURL *> &out) {
     }
 }
 
+// Removes every idle handle from the pool; the caller cleans them up after unlocking.
+std::vector<CURL *> TakeAll(PoolState &state) {
+    std::vector<CURL *> handles;
+    for (const IdleHandle &h : state.idle) {
+        handles.push_back(h.curl);
+    }
+    state.idle.clear();
+    return handles;
+}
+
 void CleanUp(const std::vector<CURL *> &handles) {
     for (CURL *curl : handles) {
         curl_easy_cleanup(curl);
@@ -99,10 +109,7 @@ void CloseAtExit() {
     {
         std::lock_guard<std::mutex> lock(state->mutex);
         state->open = false;
-        for (const IdleHandle &h : state->idle) {
-            handles.push_back(h.curl);
-        }
-        state->idle.clear();
+        handles = TakeAll(*state);
     }
     CleanUp(handles);
     std::lock_guard<std::mutex> lock(state->mutex);
@@ -355,10 +362,7 @@ void CredRequestPool::CloseIdle() {
     std::vector<CURL *> handles;
     {
         std::lock_guard<std::mutex> lock(state->mutex);
-        for (const IdleHandle &h : state->idle) {
-            handles.push_back(h.curl);
-        }
-        state->idle.clear();
+        handles = TakeAll(*state);
     }
     CleanUp(handles);
     tThreadMulti.Close();

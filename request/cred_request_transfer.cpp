@@ -101,12 +101,12 @@ bool CredRequestPrivate::InitCurlHandler() {
     }
     InitCurlGlobal(secureProcess);
     const Json::Value &urlValue = Setting("URL");
+    const Json::Value &verify = Setting("VerifySSL");
     // The handle comes from the pool of the server and TLS settings; a request with a TLS
     // context callback, or without a URL, gets one of its own.
     auto takeHandle = [&] {
         CredRequestPool::Tls tls;
-        const Json::Value &verifySetting = Setting("VerifySSL");
-        tls.verify = verifySetting.isBool() && verifySetting.asBool();
+        tls.verify = verify.isBool() && verify.asBool();
         tls.caFile = caFile;
         tls.pinnedKey = pinnedPublicKey;
         server =
@@ -187,7 +187,6 @@ bool CredRequestPrivate::InitCurlHandler() {
     // Certificate and host checks are off unless asked for; a TLS context callback forces them
     // and its own handshake on every transfer (a fresh connection, closed after it, no TLS
     // session resumed), so that the callback sees each one.
-    const Json::Value &verify = Setting("VerifySSL");
     if (sslCtxFn != nullptr) {
         if (!SetOption(CURLOPT_SSL_VERIFYPEER, 1L) ||
             !SetOption(CURLOPT_SSL_VERIFYHOST, kVerifyHostName) ||
